@@ -1,0 +1,49 @@
+// Property lists: reading (XML and binary) and writing (XML, or binary on
+// request) of Values through libplist.
+//
+// Reading validates what libplist lets pass: an empty file, a truncated or
+// malformed document, trailing garbage, a missing "</plist>" and an integer
+// element whose text is not a number are errors, never crashes. A UTF-8
+// byte-order mark is accepted. Errors are in kFileErrorDomain (code 260 for a
+// missing file, 256 for any other read failure, with the underlying POSIX
+// error where there is one) and say what was wrong.
+//
+// Writing: with `atomically`, the data goes to a temporary file in the same
+// directory, is flushed to disk and renamed over the target, so the target is
+// either the old file or the new one, whole. Unsigned integers above
+// INT64_MAX are written so that they read back unsigned.
+//
+// Thread safety: all functions may be called from any thread.
+#pragma once
+
+#include <optional>
+
+#include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/URL.h"
+#include "Platform/Foundation/Value.h"
+
+namespace platform::plist {
+
+enum class Format { XML, Binary };
+
+// Parses a property list from memory (either format).
+std::optional<Value> parse(const void* bytes, size_t length, Error* error = nullptr);
+// Reads and parses a whole file.
+std::optional<Value> readFile(const URL& url, Error* error = nullptr);
+// Reads a file whose root must be a dictionary; another root is an error
+// (kFileErrorDomain, 256, "... root is a <type>, not a dictionary").
+std::optional<Dictionary> readDictionary(const URL& url, Error* error = nullptr);
+
+// Serialises a Value. Null Values, URLs and Errors cannot be serialised (an
+// error); a URL nested inside is written as its path string.
+std::optional<Data> serialize(const Value& value, Format format, Error* error = nullptr);
+bool writeFile(const Value& value, const URL& url, Format format = Format::XML, bool atomically = true,
+               Error* error = nullptr);
+
+// Reads a whole file's bytes (no caching). Missing file: kFileErrorDomain 260
+// with the POSIX error underneath; other failures: kFileErrorDomain 256.
+std::optional<Data> readFileBytes(const URL& url, Error* error = nullptr);
+// Writes bytes, atomically when asked (temporary file, fsync, rename).
+bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error = nullptr);
+
+}  // namespace platform::plist

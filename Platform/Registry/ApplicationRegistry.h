@@ -1,0 +1,83 @@
+// The application registry and installation daemon: what the operating system
+// knows of installed bundles, and how bundles are installed.
+//
+// ApplicationRegistry is an interface so that the migrator's unit tests use
+// fakes; SQLiteApplicationRegistry (SQLiteRegistry.h) is the real one.
+//
+// Thread safety: implementations are safe to call from several threads; an
+// installation's progress callback may be called on a thread of the
+// registry's, and every report is delivered before the installation call
+// returns.
+#pragma once
+
+#include <functional>
+#include <map>
+#include <optional>
+#include <string>
+
+#include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/URL.h"
+#include "Platform/Foundation/Value.h"
+
+namespace platform {
+
+// Install options and progress keys with the roles the migrator needs.
+inline constexpr char kRegistryInstallTypeKey[] = "InstallType";
+inline constexpr char kRegistryPackageTypeKey[] = "PackageType";
+inline constexpr char kRegistryPackageTypeCustomer[] = "Customer";
+inline constexpr char kRegistryPackageTypePlaceholder[] = "Placeholder";
+inline constexpr char kRegistryStoreMetadataKey[] = "StoreMetadata";
+// Progress-report keys.
+inline constexpr char kRegistryProgressErrorKey[] = "Error";
+inline constexpr char kRegistryProgressErrorDescriptionKey[] = "ErrorDescription";
+inline constexpr char kRegistryProgressErrorDetailKey[] = "ErrorDetail";
+inline constexpr char kRegistryProgressPercentKey[] = "PercentComplete";
+inline constexpr char kRegistryProgressStatusKey[] = "Status";
+// The refusal of an application older than the built-in copy.
+inline constexpr char kRegistryErrorApplicationAlreadyInstalled[] = "ApplicationAlreadyInstalled";
+// The registry's error domain.
+inline constexpr char kRegistryErrorDomain[] = "ApplicationRegistryErrorDomain";
+
+// Bundle types a record can have.
+inline constexpr char kBundleTypeUser[] = "User";
+inline constexpr char kBundleTypeSystem[] = "System";
+inline constexpr char kBundleTypePlaceholder[] = "Placeholder";
+inline constexpr char kBundleTypeVPNPlugin[] = "VPNPlugin";
+
+// What the registry knows of one installed bundle.
+struct BundleRecord {
+  std::string identifier;
+  std::string bundleType;
+  URL bundleURL;
+  URL bundleContainerURL;
+  std::optional<URL> dataContainerURL;
+  // Group identifier to the group's container; an installed bundle's record
+  // always has one (empty without groups), a placeholder's has none.
+  std::optional<std::map<std::string, URL>> groupContainerURLs;
+  bool foundBackingBundle = false;
+  // Beyond what the migrator reads: for inspection tools.
+  bool isPlaceholder = false;
+  std::string version;
+  std::string displayName;
+};
+
+// Called with one progress report (a dictionary) at a time.
+using InstallProgressCallback = std::function<void(const Dictionary& progress)>;
+
+class ApplicationRegistry {
+ public:
+  virtual ~ApplicationRegistry() = default;
+
+  virtual bool isInstalled(const std::string& identifier) = 0;
+  virtual std::optional<BundleRecord> recordForIdentifier(const std::string& identifier) = 0;
+
+  // Installs the package directory at `package` ("Payload/*.app", optional
+  // "*.vpnplugin", store metadata beside "Payload"). `progress` may be empty.
+  // Returns only after the last report has been delivered.
+  virtual bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
+                              Error* error) = 0;
+  // Installs a placeholder bundle directory; no progress reports.
+  virtual bool installBundle(const URL& bundle, const Dictionary& options, Error* error) = 0;
+};
+
+}  // namespace platform

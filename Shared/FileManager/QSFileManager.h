@@ -1,0 +1,128 @@
+// QSFileManager: the gateway through which the system lists, creates, copies,
+// moves and removes files. Every failure is reported as a boolean (or an
+// absent result) plus an error record.
+//
+// Out-parameter contract: an `error` argument is written if and only if the
+// operation fails (createTemporaryDirectoryInDirectoryURL clears it at entry),
+// and only when it is not null. Nothing throws.
+//
+// Thread safety: the shared instance is created once, safely under concurrent
+// first calls, and never destroyed. The class holds no state; every operation
+// keeps its state on its own call and may run on several threads at once.
+#pragma once
+
+#include <sys/stat.h>
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/URL.h"
+#include "Platform/Foundation/Value.h"
+
+// One entry of a tree walk.
+struct QSTraversalEntry {
+  enum class Kind { DirectoryPre, DirectoryPost, RegularFile, SymbolicLink, Other };
+  std::string path;         // root path followed by the path inside the tree
+  Kind kind = Kind::Other;
+  int errorNumber = 0;      // the error the walk met for this entry, 0 if none
+  struct stat status {};    // lstat of the item (for DirectoryPost: the one taken at DirectoryPre)
+};
+
+// Per-entry step of a walk: return true to go on, false to stop (optionally
+// writing *error).
+using QSTraversalBlock = std::function<bool(const QSTraversalEntry& entry, platform::Error* error)>;
+
+// Predicate of a guarded class change: given the current class, answer
+// whether to change it.
+using QSDataProtectionPredicate = std::function<bool(int32_t currentClass)>;
+
+// "No class to set" for directory creation.
+inline constexpr int32_t kQSNoDataProtectionClass = -1;
+
+class QSFileManager {
+ public:
+  static QSFileManager& defaultManager();
+
+  // --- Existence (lstat; a dangling link exists) ---------------------------
+  bool itemExistsAtURL(const platform::URL& url) const;
+  bool itemDoesNotExistAtURL(const platform::URL& url) const;
+
+  // --- Listing -------------------------------------------------------------
+  // The children in directory order ("." and ".." never listed). A symbolic
+  // link is listed as a non-directory URL, or left out (with a level-5 line)
+  // when `ignoringSymlinks`.
+  [[nodiscard]] std::optional<std::vector<platform::URL>> urlsForItemsInDirectoryAtURL(
+      const platform::URL& url, bool ignoringSymlinks, platform::Error* error = nullptr) const;
+
+  // --- Removal (recursive, never follows links; absent items succeed) -------
+  bool removeItemAtURL(const platform::URL& url, platform::Error* error = nullptr) const;
+
+  // --- Directory creation ---------------------------------------------------
+  bool createDirectoryAtURL(const platform::URL& url, bool withIntermediateDirectories, mode_t mode,
+                            int32_t dataProtectionClass, platform::Error* error = nullptr) const;
+  bool createDirectoryAtURL(const platform::URL& url, bool withIntermediateDirectories, mode_t mode,
+                            platform::Error* error = nullptr) const;
+
+  // --- Copy and move ---------------------------------------------------------
+  // Copy carries data, extended attributes (ACLs included), mode, owner, group
+  // and times of every item and copies links as links. Move renames, or on
+  // EXDEV copies and then removes the source.
+  bool _copyItemAtURL(const platform::URL& src, const platform::URL& dst, bool failIfSrcMissing,
+                      platform::Error* error = nullptr) const;
+  bool _moveItemAtURL(const platform::URL& src, const platform::URL& dst, bool failIfSrcMissing,
+                      platform::Error* error = nullptr) const;
+  bool copyItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst,
+                             platform::Error* error = nullptr) const;
+  bool copyItemAtURL(const platform::URL& src, const platform::URL& dst, platform::Error* error = nullptr) const;
+  bool moveItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst,
+                             platform::Error* error = nullptr) const;
+  bool moveItemAtURL(const platform::URL& src, const platform::URL& dst, platform::Error* error = nullptr) const;
+
+  // --- Temporary directories ("temp.XXXXXX", mode 0700) ----------------------
+  std::optional<platform::URL> createTemporaryDirectoryInDirectoryURL(const platform::URL& parent,
+                                                                      platform::Error* error = nullptr) const;
+
+  // --- Tree walk, ownership, symbolic links -----------------------------------
+  bool _traverseDirectory(const platform::URL& root, platform::Error* error, const QSTraversalBlock& withBlock) const;
+  bool standardizeOwnershipAtURL(const platform::URL& url, uint32_t toUID, uint32_t GID, bool validateSymlinks,
+                                 platform::Error* error = nullptr) const;
+  bool createSymbolicLinkAtURL(const platform::URL& url, const platform::URL& withDestinationURL,
+                               platform::Error* error = nullptr) const;
+  std::optional<platform::URL> destinationOfSymbolicLinkAtURL(const platform::URL& url,
+                                                              platform::Error* error = nullptr) const;
+
+  // --- Path containment ---------------------------------------------------------
+  // The real path of `url` when it lies inside `ifChildOfURL` (links resolved,
+  // missing tails tolerated), or none with one level-3 line saying why. An
+  // empty URL stands for a missing argument.
+  std::optional<platform::URL> realPathForURL(const platform::URL& url, const platform::URL& ifChildOfURL) const;
+  std::optional<platform::URL> _realPathForURL(const platform::URL& url, bool allowNonExistentPathComponents) const;
+  std::optional<platform::URL> _realPathWhatExistsInPath(const std::string& path) const;
+  // A null path pointer stands for a missing path.
+  bool _validateSymlink(const std::string* path, uint32_t withStartingDepth, uint32_t* andEndingDepth) const;
+
+  // --- Data-protection classes and extended attributes ------------------------
+  bool dataProtectionClassOfItemAtURL(const platform::URL& url, int32_t* dataProtectionClass,
+                                      platform::Error* error = nullptr) const;
+  bool setDataProtectionClassOfItemAtURL(const platform::URL& url, int32_t toClass,
+                                         const QSDataProtectionPredicate& ifPredicate,
+                                         platform::Error* error = nullptr) const;
+  bool markBundleAsPlaceholder(const platform::URL& bundle, platform::Error* withError = nullptr) const;
+  bool bundleAtURLIsPlaceholder(const platform::URL& bundle) const;
+  bool setInstallType(const platform::Value& installType, const platform::URL& onBundle,
+                      platform::Error* error = nullptr) const;
+  std::optional<platform::Value> installTypeForBundle(const platform::URL& bundle,
+                                                      platform::Error* error = nullptr) const;
+
+  // --- Store data ----------------------------------------------------------------
+  bool captureStoreDataFromDirectory(const platform::URL& source, const platform::URL& toDirectory, bool doCopy,
+                                     bool failureIsFatal, platform::Error* withError = nullptr) const;
+
+ private:
+  QSFileManager() = default;
+};
