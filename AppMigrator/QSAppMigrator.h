@@ -14,9 +14,11 @@
 
 #include <atomic>
 #include <cstdint>
+#include <deque>
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "Platform/BundleReader.h"
@@ -92,6 +94,24 @@ class QSAppMigrator final : public platform::DataClassMigrator {
  private:
   explicit QSAppMigrator(const QSMigratorServices& services) : services_(services) {}
 
+  // Initialisation steps. _loadItemsToMigrate is false when the old
+  // applications directory exists but cannot be listed.
+  bool _loadItemsToMigrate();
+  void _loadInstallMap();
+  void _loadHarborMap();
+  void _loadLastSystemVersion();
+
+  // Run steps. The introspection pass yields the work list (application
+  // containers first); the migration pass answers whether every container
+  // migrated. _removeOldLayoutIfEmpty is false when entries remain.
+  std::deque<platform::Dictionary> _introspectItemsToMigrate();
+  bool _migrateWorkList(const std::deque<platform::Dictionary>& workList);
+  bool _removeOldLayoutIfEmpty();
+  void _recordCurrentSystemVersion();
+
+  // "SafeHarbor.plist" in the data directory.
+  platform::URL _safeHarborMapURL() const;
+
   QSMigratorServices services_;
 
   // Fields of the run, in their declared order.
@@ -114,7 +134,19 @@ inline constexpr char kQSSecondBundlePathKey[] = "SecondBundlePath";
 inline constexpr char kQSContainerTypeApp[] = "App";
 inline constexpr char kQSContainerTypeVPNBundle[] = "VPNBundle";
 inline constexpr char kQSMigrationMarkerFileName[] = "com.vantrel.quill.set.container_migrator.plist";
+inline constexpr char kQSSafeHarborMapFileName[] = "SafeHarbor.plist";
 
 // Writes one HostLog line of the migrator: category "Transvaler", the calling
 // file and line, and `function` (the operation's full name).
 #define QSAM_LOG(level, function, ...) HostLog(__FILE__, (function), __LINE__, kQSLogCategory, (level), __VA_ARGS__)
+
+// Dictionary lookups of the migrator: the value under `key`, or null when it is
+// absent; the string under `key`, or null when it is absent or not a string.
+inline const platform::Value* QSValueForKey(const platform::Dictionary& dictionary, std::string_view key) {
+  auto it = dictionary.find(key);
+  return it == dictionary.end() ? nullptr : &it->second;
+}
+inline const std::string* QSStringForKey(const platform::Dictionary& dictionary, std::string_view key) {
+  const platform::Value* value = QSValueForKey(dictionary, key);
+  return value ? value->asString() : nullptr;
+}

@@ -87,6 +87,12 @@ class QSFileManager {
   std::optional<platform::URL> createTemporaryDirectoryInDirectoryURL(const platform::URL& parent,
                                                                       platform::Error* error = nullptr) const;
 
+  // --- Status of one item (lstat; a final symbolic link is not followed) ------
+  // Sets *isLink (when not null) to whether the item at `url` is itself a
+  // symbolic link. Fails with a POSIX record whose code is lstat's errno.
+  [[nodiscard]] bool isSymbolicLinkAtURL(const platform::URL& url, bool* isLink,
+                                         platform::Error* error = nullptr) const;
+
   // --- Tree walk, ownership, symbolic links -----------------------------------
   bool _traverseDirectory(const platform::URL& root, platform::Error* error, const QSTraversalBlock& withBlock) const;
   bool standardizeOwnershipAtURL(const platform::URL& url, uint32_t toUID, uint32_t GID, bool validateSymlinks,

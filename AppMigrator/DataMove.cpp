@@ -1,0 +1,75 @@
+// The user's data: moved item by item from the old container into the data
+// container that the registry assigned, and the check that nothing but the
+// migration's own bookkeeping is left behind afterwards.
+#include "AppMigrator/QSAppMigrator.h"
+#include "Platform/Host/HostLog.h"
+#include "Shared/FileManager/QSFileManager.h"
+#include "Shared/Support/QSGlobalConfiguration.h"
+#include "Shared/Support/QSLog.h"
+
+using platform::Error;
+using platform::URL;
+
+namespace {
+
+constexpr char kMigrateDataContainerFunction[] = "-[QSAppMigrator _migrateDataContainerForIdentifier:fromURL:toURL:]";
+constexpr char kContainerHasMissedItemsFunction[] = "-[QSAppMigrator _containerHasMissedItems:withIdentifier:]";
+
+// Bookkeeping items that may stay in an old container: the container marker
+// and two markers of other writers, which this plug-in only tolerates.
+constexpr const char* kBookkeepingItemNames[] = {
+    kQSMigrationMarkerFileName,
+    "com.vantrel.quill.set.migration_marker",
+    "com.vantrel.quillset.placeholder",
+};
+
+bool isBookkeepingItem(const std::string& name) {
+  for (const char* bookkeeping : kBookkeepingItemNames) {
+    if (name == bookkeeping) return true;
+  }
+  return false;
+}
+
+}  // namespace
+
+bool QSAppMigrator::_migrateDataContainerForIdentifier(const std::string& identifier, const URL& fromURL,
+                                                       const URL& toURL) {
+  const QSFileManager& fileManager = QSFileManager::defaultManager();
+  for (const std::string& name : QSGlobalConfiguration::sharedInstance().appUserDataItemNames()) {
+    const URL source = fromURL.appending(name, true);
+    const URL destination = toURL.appending(name, true);
+    if (!fileManager.itemExistsAtURL(source)) continue;
+
+    // Replace, never merge: whatever the new container holds under this name
+    // goes first. A removal that fails leaves the move below to report it.
+    (void)fileManager.removeItemAtURL(destination);
+    Error error;
+    if (!fileManager.moveItemIfExistsAtURL(source, destination, &error)) {
+      QSAM_LOG(kQSLogLevelError, kMigrateDataContainerFunction,
+               "QSAppMigrator: Failed to move %@ to %@ migrating for %@ : %@", source, destination, identifier, error);
+      return false;
+    }
+  }
+  return true;
+}
+
+bool QSAppMigrator::_containerHasMissedItems(const URL& container, const std::string& withIdentifier) {
+  Error error;
+  std::optional<std::vector<URL>> items =
+      QSFileManager::defaultManager().urlsForItemsInDirectoryAtURL(container, false, &error);
+  if (!items) {
+    // A container that cannot be looked into must be kept.
+    QSAM_LOG(kQSLogLevelError, kContainerHasMissedItemsFunction,
+             "QSAppMigrator: Failed to enumerate container %@ for %@ : %@", container.path(), withIdentifier, error);
+    return true;
+  }
+
+  platform::Array missed;
+  for (const URL& item : *items) {
+    if (!isBookkeepingItem(item.lastPathComponent())) missed.emplace_back(item);
+  }
+  if (missed.empty()) return false;
+  QSAM_LOG(kQSLogLevelError, kContainerHasMissedItemsFunction, "QSAppMigrator: Found missed items in %@ for %@: %@",
+           container.path(), withIdentifier, missed);
+  return true;
+}
