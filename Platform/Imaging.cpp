@@ -1,0 +1,220 @@
+#include "Platform/Imaging.h"
+
+#include <cairo.h>
+#include <png.h>
+
+#include <csetjmp>
+#include <numbers>
+
+namespace platform {
+
+namespace {
+
+// Corner radius of the home-screen mask, as a fraction of the icon's side.
+constexpr double kIconCornerRadiusFraction = 0.225;
+constexpr int kBytesPerPixel = 4;
+constexpr int kBitsPerChannel = 8;
+constexpr uint8_t kOpaqueAlpha = 255;
+
+// --- cairo objects, each released by its owner --------------------------------
+
+struct SurfaceDeleter {
+  void operator()(cairo_surface_t* s) const { cairo_surface_destroy(s); }
+};
+struct ContextDeleter {
+  void operator()(cairo_t* c) const { cairo_destroy(c); }
+};
+struct PatternDeleter {
+  void operator()(cairo_pattern_t* p) const { cairo_pattern_destroy(p); }
+};
+using SurfacePtr = std::unique_ptr<cairo_surface_t, SurfaceDeleter>;
+using ContextPtr = std::unique_ptr<cairo_t, ContextDeleter>;
+using PatternPtr = std::unique_ptr<cairo_pattern_t, PatternDeleter>;
+
+// The icon file a bundle names, else the default. A name that would leave the
+// bundle directory is not used: none.
+std::optional<std::string> iconFileName(const Bundle& bundle) {
+  std::string name = kDefaultIconFileName;
+  if (bundle.info()) {
+    const auto found = bundle.info()->find(kBundleIconFileKey);
+    if (found != bundle.info()->end() && found->second.isString() && !found->second.asString()->empty()) {
+      name = *found->second.asString();
+    }
+  }
+  if (name.find('/') != std::string::npos || name == "." || name == "..") return std::nullopt;
+  return name;
+}
+
+// The decoded PNG, or none when it cannot be read or is empty.
+SurfacePtr decodePNG(const URL& file) {
+  SurfacePtr source(cairo_image_surface_create_from_png(file.fileSystemRepresentation()));
+  // cairo never returns null: a failed decode is a surface in an error state.
+  if (cairo_surface_status(source.get()) != CAIRO_STATUS_SUCCESS) return nullptr;
+  if (cairo_image_surface_get_width(source.get()) <= 0 || cairo_image_surface_get_height(source.get()) <= 0) {
+    return nullptr;
+  }
+  return source;
+}
+
+// Adds a rounded square of side `size` and corner radius `radius` to the path.
+void addRoundedSquare(cairo_t* cr, double size, double radius) {
+  const double half = std::numbers::pi / 2;
+  cairo_new_sub_path(cr);
+  cairo_arc(cr, size - radius, radius, radius, -half, 0);
+  cairo_arc(cr, size - radius, size - radius, radius, 0, half);
+  cairo_arc(cr, radius, size - radius, radius, half, 2 * half);
+  cairo_arc(cr, radius, radius, radius, 2 * half, 3 * half);
+  cairo_close_path(cr);
+}
+
+// Draws `source` scaled to fill a size x size square, clipped to the mask.
+SurfacePtr renderMasked(cairo_surface_t* source, int size) {
+  SurfacePtr target(cairo_image_surface_create(CAIRO_FORMAT_ARGB32, size, size));
+  if (cairo_surface_status(target.get()) != CAIRO_STATUS_SUCCESS) return nullptr;
+  ContextPtr cr(cairo_create(target.get()));
+  if (cairo_status(cr.get()) != CAIRO_STATUS_SUCCESS) return nullptr;
+
+  PatternPtr pattern(cairo_pattern_create_for_surface(source));
+  cairo_matrix_t matrix;
+  cairo_matrix_init_scale(&matrix, static_cast<double>(cairo_image_surface_get_width(source)) / size,
+                          static_cast<double>(cairo_image_surface_get_height(source)) / size);
+  cairo_pattern_set_matrix(pattern.get(), &matrix);
+  cairo_pattern_set_filter(pattern.get(), CAIRO_FILTER_BEST);
+  // Padding keeps the edge pixels from blending with transparent black.
+  cairo_pattern_set_extend(pattern.get(), CAIRO_EXTEND_PAD);
+
+  addRoundedSquare(cr.get(), size, size * kIconCornerRadiusFraction);
+  cairo_clip(cr.get());
+  cairo_set_source(cr.get(), pattern.get());
+  cairo_paint(cr.get());
+  if (cairo_status(cr.get()) != CAIRO_STATUS_SUCCESS) return nullptr;
+  cairo_surface_flush(target.get());
+  return target;
+}
+
+// cairo's premultiplied native-endian ARGB32 to straight RGBA.
+Image toStraightRGBA(cairo_surface_t* surface) {
+  Image image;
+  image.width = cairo_image_surface_get_width(surface);
+  image.height = cairo_image_surface_get_height(surface);
+  image.rgba.resize(static_cast<size_t>(image.width) * image.height * kBytesPerPixel);
+  const unsigned char* data = cairo_image_surface_get_data(surface);
+  const int stride = cairo_image_surface_get_stride(surface);
+  uint8_t* out = image.rgba.data();
+  for (int y = 0; y < image.height; ++y) {
+    const auto* row = reinterpret_cast<const uint32_t*>(data + static_cast<size_t>(y) * stride);
+    for (int x = 0; x < image.width; ++x) {
+      const uint32_t pixel = row[x];
+      const uint32_t a = pixel >> 24;
+      const uint32_t channels[3] = {(pixel >> 16) & 0xff, (pixel >> 8) & 0xff, pixel & 0xff};
+      for (uint32_t c : channels) {
+        // Undo the premultiplication, rounding to nearest.
+        *out++ = a == 0 ? 0 : static_cast<uint8_t>((c * kOpaqueAlpha + a / 2) / a);
+      }
+      *out++ = static_cast<uint8_t>(a);
+    }
+  }
+  return image;
+}
+
+// --- libpng --------------------------------------------------------------------
+
+// The write structure and its info structure, destroyed together.
+class PNGWriter {
+ public:
+  PNGWriter() {
+    png_ = png_create_write_struct(PNG_LIBPNG_VER_STRING, nullptr, &PNGWriter::onError, &PNGWriter::onWarning);
+    if (png_) info_ = png_create_info_struct(png_);
+  }
+  ~PNGWriter() {
+    if (png_) png_destroy_write_struct(&png_, info_ ? &info_ : nullptr);
+  }
+  PNGWriter(const PNGWriter&) = delete;
+  PNGWriter& operator=(const PNGWriter&) = delete;
+
+  bool valid() const { return png_ && info_; }
+  png_structp png() const { return png_; }
+  png_infop info() const { return info_; }
+
+ private:
+  // libpng must not return from its error handler: go back to the setjmp of
+  // writeRows.
+  static void onError(png_structp png, png_const_charp) { png_longjmp(png, 1); }
+  static void onWarning(png_structp, png_const_charp) {}
+
+  png_structp png_ = nullptr;
+  png_infop info_ = nullptr;
+};
+
+void appendToBuffer(png_structp png, png_bytep bytes, png_size_t length) {
+  auto* buffer = static_cast<Data*>(png_get_io_ptr(png));
+  buffer->insert(buffer->end(), bytes, bytes + length);
+}
+
+void flushNothing(png_structp) {}
+
+// Encodes the image; every object with a destructor lives in the caller, so
+// that a longjmp from libpng skips none.
+bool writeRows(PNGWriter& writer, const Image& image, png_bytep* rows, Data& buffer) {
+  if (setjmp(png_jmpbuf(writer.png()))) return false;
+  png_set_write_fn(writer.png(), &buffer, &appendToBuffer, &flushNothing);
+  png_set_IHDR(writer.png(), writer.info(), static_cast<png_uint_32>(image.width),
+               static_cast<png_uint_32>(image.height), kBitsPerChannel, PNG_COLOR_TYPE_RGB_ALPHA, PNG_INTERLACE_NONE,
+               PNG_COMPRESSION_TYPE_DEFAULT, PNG_FILTER_TYPE_DEFAULT);
+  png_write_info(writer.png(), writer.info());
+  png_write_image(writer.png(), rows);
+  png_write_end(writer.png(), writer.info());
+  return true;
+}
+
+class PNGImageEncoder final : public ImageEncoder {
+ public:
+  explicit PNGImageEncoder(Data& buffer) : buffer_(buffer) {}
+
+  void addImage(const Image& image) override { images_.push_back(image); }
+
+  bool finalize() override {
+    if (images_.size() != 1) return false;
+    const Image& image = images_.front();
+    if (image.width <= 0 || image.height <= 0 ||
+        image.rgba.size() != static_cast<size_t>(image.width) * image.height * kBytesPerPixel) {
+      return false;
+    }
+    std::vector<png_bytep> rows(static_cast<size_t>(image.height));
+    const size_t rowBytes = static_cast<size_t>(image.width) * kBytesPerPixel;
+    for (size_t y = 0; y < rows.size(); ++y) {
+      // libpng takes non-const rows but only reads them when writing.
+      rows[y] = const_cast<png_bytep>(image.rgba.data() + y * rowBytes);
+    }
+    PNGWriter writer;
+    if (!writer.valid()) return false;
+    Data encoded;
+    if (!writeRows(writer, image, rows.data(), encoded)) return false;
+    buffer_.insert(buffer_.end(), encoded.begin(), encoded.end());
+    return true;
+  }
+
+ private:
+  Data& buffer_;
+  std::vector<Image> images_;
+};
+
+}  // namespace
+
+std::optional<Image> CairoIconRenderer::homeScreenIconForBundle(const Bundle& bundle) {
+  const std::optional<std::string> name = iconFileName(bundle);
+  if (!name) return std::nullopt;
+  SurfacePtr source = decodePNG(bundle.url().appending(*name));
+  if (!source) return std::nullopt;
+  SurfacePtr icon = renderMasked(source.get(), kHomeScreenIconSize);
+  if (!icon) return std::nullopt;
+  return toStraightRGBA(icon.get());
+}
+
+std::unique_ptr<ImageEncoder> PNGImageEncoding::createEncoder(Data& buffer, std::string_view typeIdentifier,
+                                                              size_t imageCount) {
+  if (typeIdentifier != kImageTypePNG || imageCount != 1) return nullptr;
+  return std::make_unique<PNGImageEncoder>(buffer);
+}
+
+}  // namespace platform

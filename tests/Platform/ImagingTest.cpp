@@ -1,0 +1,204 @@
+#include <gtest/gtest.h>
+
+#include "Platform/Imaging.h"
+#include "support/ImageSupport.h"
+#include "support/TestSupport.h"
+
+using platform::Bundle;
+using platform::Data;
+using platform::Dictionary;
+using platform::Image;
+using platform::URL;
+using platform::Value;
+
+namespace {
+
+constexpr uint32_t kOpaqueRed = 0xff0000ff;
+constexpr uint32_t kOpaqueBlue = 0x0000ffff;
+constexpr uint32_t kOpaqueGreen = 0x00ff00ff;
+constexpr int kSize = platform::kHomeScreenIconSize;
+
+uint8_t alphaOf(uint32_t rgba) {
+  return rgba & 0xff;
+}
+uint8_t redOf(uint32_t rgba) {
+  return rgba >> 24;
+}
+
+class IconRendering : public testing::Test {
+ protected:
+  Bundle bundleWithInfo(std::optional<Dictionary> info) {
+    return Bundle(URL::fileURL(dir_.path(), true), std::move(info));
+  }
+  qstest::TempDir dir_{"icon"};
+  platform::CairoIconRenderer renderer_;
+};
+
+TEST_F(IconRendering, DefaultIconIsScaledToHomeScreenSizeAndMaskedToRoundedSquare) {
+  ASSERT_TRUE(qstest::writeSolidPNG(dir_ / "Icon.png", 57, 40, kOpaqueRed));
+  const std::optional<Image> icon = renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{}));
+  ASSERT_TRUE(icon);
+  ASSERT_EQ(icon->width, kSize);
+  ASSERT_EQ(icon->height, kSize);
+  ASSERT_EQ(icon->rgba.size(), static_cast<size_t>(kSize * kSize * 4));
+  EXPECT_EQ(qstest::pixelAt(*icon, kSize / 2, kSize / 2), kOpaqueRed);
+  // The padded edge midpoints are inside the mask and keep the colour.
+  EXPECT_EQ(qstest::pixelAt(*icon, 0, kSize / 2), kOpaqueRed);
+  EXPECT_EQ(qstest::pixelAt(*icon, kSize / 2, kSize - 1), kOpaqueRed);
+  for (auto [x, y] : {std::pair{0, 0}, {kSize - 1, 0}, {0, kSize - 1}, {kSize - 1, kSize - 1}}) {
+    EXPECT_EQ(alphaOf(qstest::pixelAt(*icon, x, y)), 0) << x << "," << y;
+  }
+}
+
+TEST_F(IconRendering, AntialiasedMaskEdgeIsStraightNotPremultiplied) {
+  ASSERT_TRUE(qstest::writeSolidPNG(dir_ / "Icon.png", kSize, kSize, kOpaqueRed));
+  const std::optional<Image> icon = renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{}));
+  ASSERT_TRUE(icon);
+  // Walk the diagonal from the corner into the icon: the first partly
+  // transparent pixel still carries full red.
+  bool sawPartial = false;
+  for (int i = 0; i < kSize / 2 && !sawPartial; ++i) {
+    const uint32_t pixel = qstest::pixelAt(*icon, i, i);
+    if (alphaOf(pixel) > 0 && alphaOf(pixel) < 255) {
+      sawPartial = true;
+      EXPECT_GE(redOf(pixel), 250) << "alpha " << int(alphaOf(pixel));
+    }
+  }
+  EXPECT_TRUE(sawPartial);
+}
+
+TEST_F(IconRendering, ScalingKeepsTheImageLayout) {
+  ASSERT_TRUE(qstest::writeSplitPNG(dir_ / "Icon.png", 20, 20, kOpaqueBlue, kOpaqueGreen));
+  const std::optional<Image> icon = renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{}));
+  ASSERT_TRUE(icon);
+  EXPECT_EQ(qstest::pixelAt(*icon, kSize / 4, kSize / 2), kOpaqueBlue);
+  EXPECT_EQ(qstest::pixelAt(*icon, 3 * kSize / 4, kSize / 2), kOpaqueGreen);
+}
+
+TEST_F(IconRendering, IconFileKeyChoosesTheFile) {
+  ASSERT_TRUE(qstest::writeSolidPNG(dir_ / "Icon.png", 8, 8, kOpaqueRed));
+  ASSERT_TRUE(qstest::writeSolidPNG(dir_ / "AppIcon.png", 8, 8, kOpaqueBlue));
+  const std::optional<Image> icon = renderer_.homeScreenIconForBundle(
+      bundleWithInfo(Dictionary{{platform::kBundleIconFileKey, Value("AppIcon.png")}}));
+  ASSERT_TRUE(icon);
+  EXPECT_EQ(qstest::pixelAt(*icon, kSize / 2, kSize / 2), kOpaqueBlue);
+}
+
+TEST_F(IconRendering, IconFileKeyOfAnotherTypeFallsBackToDefault) {
+  ASSERT_TRUE(qstest::writeSolidPNG(dir_ / "Icon.png", 8, 8, kOpaqueRed));
+  const std::optional<Image> icon =
+      renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{{platform::kBundleIconFileKey, Value(7)}}));
+  ASSERT_TRUE(icon);
+  EXPECT_EQ(qstest::pixelAt(*icon, kSize / 2, kSize / 2), kOpaqueRed);
+}
+
+TEST_F(IconRendering, NoIconFileGivesNone) {
+  EXPECT_FALSE(renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{})));
+  EXPECT_FALSE(renderer_.homeScreenIconForBundle(bundleWithInfo(std::nullopt)));
+}
+
+TEST_F(IconRendering, GarbageOrTruncatedPNGGivesNone) {
+  ASSERT_TRUE(qstest::writeFile(dir_ / "Icon.png", "this is not a PNG"));
+  EXPECT_FALSE(renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{})));
+
+  ASSERT_TRUE(qstest::writeSolidPNG(dir_ / "Whole.png", 30, 30, kOpaqueRed));
+  const std::string whole = qstest::readFile(dir_ / "Whole.png");
+  ASSERT_TRUE(qstest::writeFile(dir_ / "Icon.png", whole.substr(0, whole.size() / 2)));
+  EXPECT_FALSE(renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{})));
+}
+
+TEST_F(IconRendering, IconFileOutsideTheBundleIsNotRead) {
+  qstest::TempDir outside("outside");
+  ASSERT_TRUE(qstest::writeSolidPNG(outside / "Evil.png", 8, 8, kOpaqueRed));
+  const std::string escape = "../" + URL::fileURL(outside.path()).lastPathComponent() + "/Evil.png";
+  EXPECT_FALSE(
+      renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{{platform::kBundleIconFileKey, Value(escape)}})));
+}
+
+// --- Encoding ------------------------------------------------------------------
+
+Image gradient(int width, int height) {
+  Image image;
+  image.width = width;
+  image.height = height;
+  for (int y = 0; y < height; ++y) {
+    for (int x = 0; x < width; ++x) {
+      image.rgba.insert(image.rgba.end(), {static_cast<uint8_t>(x * 7), static_cast<uint8_t>(y * 5),
+                                           static_cast<uint8_t>(x + y), static_cast<uint8_t>(255 - x)});
+    }
+  }
+  return image;
+}
+
+TEST(PNGEncoding, RoundTripsPixelsExactly) {
+  platform::PNGImageEncoding encoding;
+  Data buffer;
+  auto encoder = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
+  ASSERT_TRUE(encoder);
+  const Image image = gradient(33, 17);
+  encoder->addImage(image);
+  ASSERT_TRUE(encoder->finalize());
+  const std::optional<Image> decoded = qstest::decodePNG(buffer);
+  ASSERT_TRUE(decoded);
+  EXPECT_EQ(decoded->width, 33);
+  EXPECT_EQ(decoded->height, 17);
+  EXPECT_EQ(decoded->rgba, image.rgba);
+}
+
+TEST(PNGEncoding, OnlyPNGAndExactlyOneImageAreSupported) {
+  platform::PNGImageEncoding encoding;
+  Data buffer;
+  EXPECT_FALSE(encoding.createEncoder(buffer, "public.jpeg", 1));
+  EXPECT_FALSE(encoding.createEncoder(buffer, platform::kImageTypePNG, 0));
+  EXPECT_FALSE(encoding.createEncoder(buffer, platform::kImageTypePNG, 2));
+}
+
+TEST(PNGEncoding, FinalizeFailsWithoutExactlyOneImageAndWritesNothing) {
+  platform::PNGImageEncoding encoding;
+  Data buffer;
+  auto none = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
+  EXPECT_FALSE(none->finalize());
+  auto two = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
+  two->addImage(gradient(2, 2));
+  two->addImage(gradient(2, 2));
+  EXPECT_FALSE(two->finalize());
+  EXPECT_TRUE(buffer.empty());
+}
+
+TEST(PNGEncoding, MalformedImageFailsAndWritesNothing) {
+  platform::PNGImageEncoding encoding;
+  Data buffer;
+  auto encoder = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
+  Image bad = gradient(4, 4);
+  bad.rgba.pop_back();
+  encoder->addImage(bad);
+  EXPECT_FALSE(encoder->finalize());
+  EXPECT_TRUE(buffer.empty());
+
+  auto empty = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
+  empty->addImage(Image{});
+  EXPECT_FALSE(empty->finalize());
+  EXPECT_TRUE(buffer.empty());
+}
+
+TEST(PNGEncoding, RenderedIconEncodesToA120PixelPNG) {
+  qstest::TempDir dir("icon");
+  ASSERT_TRUE(qstest::writeSolidPNG(dir / "Icon.png", 60, 60, kOpaqueGreen));
+  platform::CairoIconRenderer renderer;
+  const std::optional<Image> icon =
+      renderer.homeScreenIconForBundle(Bundle(URL::fileURL(dir.path(), true), Dictionary{}));
+  ASSERT_TRUE(icon);
+  platform::PNGImageEncoding encoding;
+  Data buffer;
+  auto encoder = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
+  encoder->addImage(*icon);
+  ASSERT_TRUE(encoder->finalize());
+  const std::optional<Image> decoded = qstest::decodePNG(buffer);
+  ASSERT_TRUE(decoded);
+  EXPECT_EQ(decoded->width, kSize);
+  EXPECT_EQ(decoded->height, kSize);
+  EXPECT_EQ(alphaOf(qstest::pixelAt(*decoded, 0, 0)), 0);
+  EXPECT_EQ(qstest::pixelAt(*decoded, kSize / 2, kSize / 2), kOpaqueGreen);
+}
+
+}  // namespace
