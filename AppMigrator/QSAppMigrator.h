@@ -114,6 +114,14 @@ class QSAppMigrator final : public platform::DataClassMigrator {
 
   QSMigratorServices services_;
 
+  // Placeholder installation once the staged directory's URL is known; the
+  // caller removes the staged directory afterwards.
+  bool _installPlaceholderStagedAtURL(const platform::URL& staged, const platform::URL& bundle,
+                                      const std::string& identifier, const platform::URL& storeMetadataURL);
+  // The per-group step of _migrateGroupContainersForIdentifier.
+  void _migrateGroupContainer(const std::string& identifier, const std::string& group,
+                              const platform::URL& newContainer);
+
   // Fields of the run, in their declared order.
   std::atomic<uint64_t> _countItemsMigrated{0};
   std::optional<std::vector<platform::URL>> _itemsToMigrate;
@@ -150,3 +158,8 @@ inline const std::string* QSStringForKey(const platform::Dictionary& dictionary,
   const platform::Value* value = QSValueForKey(dictionary, key);
   return value ? value->asString() : nullptr;
 }
+
+// Install options shared by the staged and the placeholder installation.
+inline constexpr uint64_t kQSMigratorInstallType = 6;
+inline constexpr char kQSInstallOptionSkipBlacklist[] = "SkipBlacklist";
+inline constexpr char kQSInstallOptionVerifyForMigrator[] = "VerifyForMigrator";

@@ -1,0 +1,119 @@
+// Group containers: the old container of each application group, recorded in
+// the old install map, is emptied into the new group container that the
+// registry reports for the installed application, then removed.
+#include "AppMigrator/QSAppMigrator.h"
+#include "Platform/Host/HostLog.h"
+#include "Shared/FileManager/QSFileManager.h"
+#include "Shared/Support/QSLog.h"
+
+using platform::Error;
+using platform::URL;
+
+namespace {
+
+constexpr char kMigrateFunction[] = "-[QSAppMigrator _migrateGroupContainersForIdentifier:]";
+constexpr char kMoveAllFunction[] = "-[QSAppMigrator _moveAllItemsInGroupContainerURL:toGroupContainerURL:]";
+constexpr char kGroupContainerPathKey[] = "Container";
+
+// Moves every item of `source` into `destination`, replacing (never merging)
+// an item of the same name. False only when `source` cannot be listed;
+// otherwise *failedItems is the number of items that could not be moved.
+bool moveAllItems(const URL& source, const URL& destination, size_t* failedItems) {
+  const QSFileManager& fm = QSFileManager::defaultManager();
+  Error error;
+  const auto items = fm.urlsForItemsInDirectoryAtURL(source, false, &error);
+  if (!items) {
+    QSAM_LOG(kQSLogLevelError, kMoveAllFunction,
+             "QSAppMigrator: Failed to get all urls in source group container %@ : %@", source.path(), error);
+    return false;
+  }
+  *failedItems = 0;
+  for (const URL& item : *items) {
+    const URL target = destination.appending(item.lastPathComponent());
+    // The outcome is not tested: the move that follows fails if the old item
+    // is still in the way.
+    (void)fm.removeItemAtURL(target);
+    if (!fm.moveItemIfExistsAtURL(item, target, &error)) {
+      QSAM_LOG(kQSLogLevelError, kMoveAllFunction, "QSAppMigrator: Failed to move item %@ to %@ : %@", item.path(),
+               target.path(), error);
+      ++*failedItems;
+    }
+  }
+  return true;
+}
+
+}  // namespace
+
+bool QSAppMigrator::_migrateGroupContainersForIdentifier(const std::string& identifier) {
+  if (!_groupContainerMap || _groupContainerMap->empty()) return true;
+
+  const std::optional<platform::BundleRecord> record = services_.registry->recordForIdentifier(identifier);
+  if (!record) {
+    QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Failed to get bundle proxy for %@", identifier);
+    return false;
+  }
+  if (!record->groupContainerURLs) {
+    QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Failed to get group container URLs for installed %@",
+             identifier);
+    return false;
+  }
+  if (record->groupContainerURLs->empty()) {
+    QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: No group containers to migrate for %@", identifier);
+    return true;
+  }
+  // The record's dictionary is walked while the map loses entries.
+  for (const auto& [group, newContainer] : *record->groupContainerURLs) {
+    _migrateGroupContainer(identifier, group, newContainer);
+  }
+  return true;
+}
+
+void QSAppMigrator::_migrateGroupContainer(const std::string& identifier, const std::string& group,
+                                           const URL& newContainer) {
+  const auto entry = _groupContainerMap->find(group);
+  const platform::Dictionary* entryDictionary =
+      entry == _groupContainerMap->end() ? nullptr : entry->second.asDictionary();
+  if (!entryDictionary) {
+    QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: No group container entry to migrate for %@[%@]",
+             identifier, group);
+    return;
+  }
+  const platform::Value* path = entry->second.get(kGroupContainerPathKey);
+  if (!path || !path->isString()) {
+    QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: Failed to get path to group container for %@[%@]",
+             identifier, group);
+    return;
+  }
+  const URL oldContainer = URL::fileURL(*path->asString(), true);
+  const QSFileManager& fm = QSFileManager::defaultManager();
+  if (!fm.itemExistsAtURL(oldContainer)) {
+    QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Missing source group container at %@",
+             oldContainer.path());
+    return;
+  }
+  QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: Migrating group container %@ at %@ to %@", group,
+           oldContainer, newContainer);
+  size_t failedItems = 0;
+  if (!moveAllItems(oldContainer, newContainer, &failedItems)) return;
+  _groupContainerMap->erase(entry);
+
+  // Items that could not be moved are still in the old group container: it is
+  // kept so that nothing is lost. Its map entry goes all the same, as for any
+  // group whose items have been moved, so it is not moved a second time.
+  if (failedItems > 0) {
+    QSAM_LOG(kQSLogLevelError, kMigrateFunction,
+             "QSAppMigrator: Keeping old group container at %@ : %lu items could not be moved", oldContainer.path(),
+             static_cast<unsigned long>(failedItems));
+    return;
+  }
+  Error error;
+  if (!fm.removeItemAtURL(oldContainer, &error)) {
+    QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Failed to remove old group container at %@ : %@",
+             oldContainer.path(), error);
+  }
+}
+
+bool QSAppMigrator::_moveAllItemsInGroupContainerURL(const URL& source, const URL& toGroupContainerURL) {
+  size_t failedItems = 0;
+  return moveAllItems(source, toGroupContainerURL, &failedItems);
+}
