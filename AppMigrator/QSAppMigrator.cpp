@@ -120,7 +120,9 @@ URL QSAppMigrator::_safeHarborMapURL() const {
 
 // --- The host's queries ---------------------------------------------------------
 
-std::string QSAppMigrator::dataClassName() { return kQSDataClassName; }
+std::string QSAppMigrator::dataClassName() {
+  return kQSDataClassName;
+}
 
 float QSAppMigrator::estimatedDuration() {
   if (!_itemsToMigrate) return kBaseDuration;
@@ -197,8 +199,7 @@ bool QSAppMigrator::_migrateWorkList(const std::deque<Dictionary>& workList) {
   for (const Dictionary& info : workList) {
     const Value* identifier = QSValueForKey(info, kQSBundleIdentifierKey);
     const Value* bundlePath = QSValueForKey(info, kQSBundlePathKey);
-    QSAM_LOG(kQSLogLevelNotice, kPerformMigrationFunction, "QSAppMigrator: Migrating %@ at %@", identifier,
-             bundlePath);
+    QSAM_LOG(kQSLogLevelNotice, kPerformMigrationFunction, "QSAppMigrator: Migrating %@ at %@", identifier, bundlePath);
     if (!_migrateContainerWithInfo(info)) {
       QSAM_LOG(kQSLogLevelError, kPerformMigrationFunction, "QSAppMigrator: Migration of %@ at %@ failed", identifier,
                bundlePath);

@@ -37,9 +37,9 @@ Dictionary stagedInstallOptions(const std::string& identifier) {
 platform::InstallProgressCallback progressCallback(const URL& bundle,
                                                    const std::shared_ptr<std::atomic<bool>>& alreadyInstalled) {
   return [bundle, alreadyInstalled](const Dictionary& progress) {
-    const auto errorName = progress.find(platform::kRegistryProgressErrorKey);
-    if (errorName == progress.end()) return;
-    if (errorName->second == Value(platform::kRegistryErrorApplicationAlreadyInstalled)) {
+    const Value* errorName = QSValueForKey(progress, platform::kRegistryProgressErrorKey);
+    if (!errorName) return;
+    if (*errorName == Value(platform::kRegistryErrorApplicationAlreadyInstalled)) {
       QSAM_LOG(kQSLogLevelNotice, kFunction,
                "QSAppMigrator: Installation of %@ failed because it's older than what's built into the system. Data "
                "migration already happened so we're done here.",
@@ -47,11 +47,9 @@ platform::InstallProgressCallback progressCallback(const URL& bundle,
       alreadyInstalled->store(true);
       return;
     }
-    const auto description = progress.find(platform::kRegistryProgressErrorDescriptionKey);
-    const auto detail = progress.find(platform::kRegistryProgressErrorDetailKey);
     QSAM_LOG(kQSLogLevelError, kFunction, "QSAppMigrator: Installation of %@ failed with Quillset error %@ (%@ : %@)",
-             bundle.path(), description == progress.end() ? Value() : description->second, errorName->second,
-             detail == progress.end() ? Value() : detail->second);
+             bundle.path(), QSValueForKey(progress, platform::kRegistryProgressErrorDescriptionKey), *errorName,
+             QSValueForKey(progress, platform::kRegistryProgressErrorDetailKey));
   };
 }
 
