@@ -1,0 +1,25 @@
+// Recursive copy of a file-system item, built from POSIX calls.
+//
+// copyTree copies the item at `source` to `destination`: a directory with
+// everything in it, a regular file, a symbolic link (as a link, never
+// followed), or a device, fifo or socket node. Every item keeps its data, its
+// extended attributes of every namespace that can be read (access-control
+// lists included), its mode, owner, group and access and modification times.
+//
+// Nothing is merged or replaced: an existing item at `destination` fails the
+// copy with EEXIST. The copy stops at the first failure and leaves what it
+// had copied so far. Entries of the source that vanish while the copy runs
+// are left out. Copying a directory into itself fails with EINVAL.
+//
+// The walk iterates instead of recursing and holds two descriptors per level
+// of the tree, so a tree deeper than half the process's descriptor limit
+// fails with EMFILE.
+//
+// Returns 0 or the error number of the failure. Thread-safe; nothing shared.
+#pragma once
+
+namespace qsfs {
+
+[[nodiscard]] int copyTree(const char* source, const char* destination);
+
+}  // namespace qsfs

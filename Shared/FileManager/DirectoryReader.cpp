@@ -1,0 +1,37 @@
+#include "Shared/FileManager/DirectoryReader.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "Shared/FileManager/PosixHandles.h"
+#include "Shared/FileManager/QuillsetAdditions.h"
+
+namespace qsfs {
+
+bool isDotOrDotDot(const char* name) {
+  return std::strcmp(name, kCurrentDirectoryName) == 0 || std::strcmp(name, kParentDirectoryName) == 0;
+}
+
+int readDirectoryEntries(int directoryFD, std::vector<DirectoryEntry>& entries) {
+  // A stream of its own (a fresh open description, not a dup) so that the
+  // caller's descriptor and its position are left alone.
+  ScopedFD fd(openat(directoryFD, kCurrentDirectoryName, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!fd.valid()) return errno;
+  ScopedDIR stream(fdopendir(fd.get()));
+  if (!stream.valid()) return errno;
+  fd.release();
+  for (;;) {
+    errno = 0;
+    const dirent* entry = readdir(stream.get());
+    if (entry == nullptr) return errno;
+    if (isDotOrDotDot(entry->d_name)) continue;
+    entries.push_back(
+        {QuillsetAdditions::stringWithFileSystemRepresentation(entry->d_name, std::strlen(entry->d_name)),
+         entry->d_type});
+  }
+}
+
+}  // namespace qsfs
