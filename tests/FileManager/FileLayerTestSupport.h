@@ -1,0 +1,90 @@
+// Helpers for the file layer's tests: a directory on another file system (for
+// cross-device moves), status and attribute probes, and error-record checks.
+#pragma once
+
+#include <ftw.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <optional>
+#include <string>
+
+#include <gtest/gtest.h>
+
+#include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/URL.h"
+#include "Shared/Support/QSError.h"
+#include "support/TestSupport.h"
+
+namespace qstest {
+
+// A fresh directory under /dev/shm (tmpfs), on another file system than the
+// test root (ext4), removed when the object goes away.
+class ShmDir {
+ public:
+  ShmDir() {
+    char buffer[] = "/dev/shm/qs-filelayer.XXXXXX";
+    if (mkdtemp(buffer) == nullptr) {
+      ADD_FAILURE() << "mkdtemp under /dev/shm: " << strerror(errno);
+      return;
+    }
+    path_ = buffer;
+  }
+  ~ShmDir() {
+    if (path_.empty()) return;
+    auto remove = [](const char* p, const struct stat*, int type, struct FTW*) {
+      return (type == FTW_DP ? rmdir(p) : unlink(p)) == 0 ? 0 : errno;
+    };
+    EXPECT_EQ(nftw(path_.c_str(), remove, 32, FTW_PHYS | FTW_DEPTH), 0) << "could not remove " << path_;
+  }
+  ShmDir(const ShmDir&) = delete;
+  ShmDir& operator=(const ShmDir&) = delete;
+  const std::string& path() const { return path_; }
+  std::string operator/(const std::string& rest) const { return path_ + "/" + rest; }
+
+ private:
+  std::string path_;
+};
+
+inline platform::URL fileURL(const std::string& path, bool isDirectory = false) {
+  return platform::URL::fileURL(path, isDirectory);
+}
+
+inline std::optional<struct stat> lstatOf(const std::string& path) {
+  struct stat status {};
+  if (lstat(path.c_str(), &status) != 0) return std::nullopt;
+  return status;
+}
+
+inline bool exists(const std::string& path) { return lstatOf(path).has_value(); }
+
+inline std::optional<std::string> xattrOf(const std::string& path, const char* name) {
+  char buffer[4096];
+  ssize_t size = lgetxattr(path.c_str(), name, buffer, sizeof buffer);
+  if (size < 0) return std::nullopt;
+  return std::string(buffer, static_cast<size_t>(size));
+}
+
+inline std::string functionNameOf(const platform::Error& error) {
+  auto it = error.userInfo().find(QSFunctionNameErrorKey);
+  if (it == error.userInfo().end() || !it->second.asString()) return std::string();
+  return *it->second.asString();
+}
+
+// Expects a POSIX record with `code`, `message` and `function`.
+inline void expectPOSIXError(const platform::Error& error, int code, const std::string& message,
+                             const std::string& function) {
+  EXPECT_EQ(error.domain(), platform::kPOSIXErrorDomain);
+  EXPECT_EQ(error.code(), code);
+  EXPECT_EQ(error.localizedDescription(), message);
+  EXPECT_EQ(functionNameOf(error), function);
+}
+
+// An error record that a successful call must leave as it was.
+inline platform::Error untouchedSentinel() { return platform::Error("Sentinel", 99); }
+
+}  // namespace qstest

@@ -1,0 +1,200 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "FileLayerTestSupport.h"
+#include "Shared/FileManager/PosixHandles.h"
+#include "Shared/FileManager/QSFileManager.h"
+#include "Shared/FileManager/RemoveTree.h"
+
+namespace {
+
+using platform::Error;
+using qstest::fileURL;
+
+constexpr char kRemoveFn[] = "-[QSFileManager removeItemAtURL:error:]";
+constexpr char kCallbackFn[] = "_removefile_error_callback";
+
+class FileManagerRemoval : public testing::Test {
+ protected:
+  QSFileManager& fm = QSFileManager::defaultManager();
+  qstest::TempDir dir{"removal"};
+};
+
+TEST_F(FileManagerRemoval, RemovesWholeTreeWithoutFollowingLinks) {
+  qstest::TempDir outside{"outside"};
+  ASSERT_TRUE(qstest::writeFile(outside / "keep", "keep"));
+  ASSERT_TRUE(qstest::makeDirs(dir / "tree/a/b/c"));
+  ASSERT_TRUE(qstest::writeFile(dir / "tree/a/file", "x"));
+  ASSERT_TRUE(qstest::writeFile(dir / "tree/a/b/c/deep", "y"));
+  ASSERT_EQ(symlink(outside.path().c_str(), (dir / "tree/a/link-to-outside").c_str()), 0);
+  ASSERT_EQ(symlink((outside / "keep").c_str(), (dir / "tree/file-link").c_str()), 0);
+  ASSERT_EQ(mkfifo((dir / "tree/a/b/fifo").c_str(), 0600), 0);
+  Error error = qstest::untouchedSentinel();
+  EXPECT_TRUE(fm.removeItemAtURL(fileURL(dir / "tree", true), &error));
+  EXPECT_TRUE(error.is("Sentinel", 99));
+  EXPECT_FALSE(qstest::exists(dir / "tree"));
+  EXPECT_EQ(qstest::readFile(outside / "keep"), "keep");
+}
+
+TEST_F(FileManagerRemoval, SingleFileAndLinkAtTheTop) {
+  ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));
+  ASSERT_TRUE(qstest::makeDirs(dir / "target"));
+  ASSERT_TRUE(qstest::writeFile(dir / "target/inside", "x"));
+  ASSERT_EQ(symlink("target", (dir / "link").c_str()), 0);
+  EXPECT_TRUE(fm.removeItemAtURL(fileURL(dir / "file")));
+  EXPECT_TRUE(fm.removeItemAtURL(fileURL(dir / "link")));
+  EXPECT_FALSE(qstest::exists(dir / "file"));
+  EXPECT_FALSE(qstest::exists(dir / "link"));
+  EXPECT_TRUE(qstest::exists(dir / "target/inside"));
+}
+
+TEST_F(FileManagerRemoval, AbsentItemSucceedsWithoutErrorOrLine) {
+  qstest::LogCapture log;
+  Error error = qstest::untouchedSentinel();
+  EXPECT_TRUE(fm.removeItemAtURL(fileURL(dir / "never-there"), &error));
+  EXPECT_TRUE(error.is("Sentinel", 99));
+  EXPECT_TRUE(log.systemLines().empty());
+}
+
+TEST_F(FileManagerRemoval, MissingURLFailsWithBadAddress) {
+  Error error;
+  EXPECT_FALSE(fm.removeItemAtURL(platform::URL(), &error));
+  qstest::expectPOSIXError(error, EFAULT, "nil url passed to -removeItemAtURL:error:", kRemoveFn);
+}
+
+TEST_F(FileManagerRemoval, ImmutableDirectoryKeepsFirstErrorAndRemovesTheRest) {
+  ASSERT_TRUE(qstest::makeDirs(dir / "tree/locked"));
+  ASSERT_TRUE(qstest::writeFile(dir / "tree/locked/file", "x"));
+  for (int i = 0; i < 20; ++i) ASSERT_TRUE(qstest::writeFile(dir / ("tree/free" + std::to_string(i)), "x"));
+  ASSERT_TRUE(qstest::setImmutable(dir / "tree/locked", true));
+  qstest::LogCapture log;
+  Error error;
+  bool removed = fm.removeItemAtURL(fileURL(dir / "tree", true), &error);
+  ASSERT_TRUE(qstest::setImmutable(dir / "tree/locked", false));
+
+  EXPECT_FALSE(removed);
+  qstest::expectPOSIXError(error, EPERM, "removefile of file://" + dir.path() + "/tree/ failed: Operation not permitted",
+                           kRemoveFn);
+  auto lines = log.systemLines();
+  ASSERT_EQ(lines.size(), 3u);
+  EXPECT_EQ(lines[0].message, "removefile hit error for " + dir.path() + "/tree/locked/file : Operation not permitted");
+  EXPECT_EQ(lines[1].message, "removefile hit error for " + dir.path() + "/tree/locked : Operation not permitted");
+  EXPECT_EQ(lines[2].message, "removefile hit error for " + dir.path() + "/tree : Directory not empty");
+  for (const auto& line : lines) {
+    EXPECT_EQ(line.function, kCallbackFn);
+    EXPECT_EQ(line.level, 3);
+  }
+  EXPECT_TRUE(qstest::exists(dir / "tree/locked/file"));
+  EXPECT_FALSE(qstest::exists(dir / "tree/free0"));
+  EXPECT_FALSE(qstest::exists(dir / "tree/free19"));
+}
+
+// Builds a chain of `depth` directories named "d" below `root` without ever
+// naming the whole path (it is far longer than PATH_MAX).
+void makeChain(const std::string& root, int depth) {
+  qsfs::ScopedFD current(open(root.c_str(), O_RDONLY | O_DIRECTORY));
+  ASSERT_TRUE(current.valid());
+  for (int i = 0; i < depth; ++i) {
+    ASSERT_EQ(mkdirat(current.get(), "d", 0755), 0) << "level " << i;
+    if (i % 100 == 0) {
+      int fd = openat(current.get(), "f", O_WRONLY | O_CREAT, 0644);
+      ASSERT_GE(fd, 0);
+      close(fd);
+    }
+    current.reset(openat(current.get(), "d", O_RDONLY | O_DIRECTORY));
+    ASSERT_TRUE(current.valid());
+  }
+}
+
+// Far deeper than the walk keeps directories open and than PATH_MAX allows.
+// On tmpfs, where deep directory removal is cheap.
+TEST_F(FileManagerRemoval, VeryDeepTreeIsRemoved) {
+  qstest::ShmDir shm;
+  ASSERT_TRUE(qstest::makeDirs(shm / "deep"));
+  ASSERT_NO_FATAL_FAILURE(makeChain(shm / "deep", 10000));
+  Error error;
+  EXPECT_TRUE(fm.removeItemAtURL(fileURL(shm / "deep", true), &error)) << error.description();
+  EXPECT_FALSE(qstest::exists(shm / "deep"));
+}
+
+TEST_F(FileManagerRemoval, EntriesVanishingDuringRemovalAreNoFailure) {
+  constexpr int kFiles = 3000;
+  qstest::ShmDir shm;
+  ASSERT_TRUE(qstest::makeDirs(shm / "tree"));
+  for (int i = 0; i < kFiles; ++i) ASSERT_TRUE(qstest::writeFile(shm / ("tree/f" + std::to_string(i)), ""));
+  qstest::LogCapture log;
+  std::thread rival([&] {
+    for (int i = kFiles - 1; i >= 0; --i) unlink((shm / ("tree/f" + std::to_string(i))).c_str());
+  });
+  Error error;
+  bool removed = fm.removeItemAtURL(fileURL(shm / "tree", true), &error);
+  rival.join();
+  EXPECT_TRUE(removed) << error.description();
+  EXPECT_FALSE(qstest::exists(shm / "tree"));
+  EXPECT_TRUE(log.systemLines().empty());
+}
+
+// The removal walk itself, with callbacks of the test's own.
+class RemoveTree : public FileManagerRemoval {};
+
+struct Seen {
+  std::vector<std::string> paths;
+  std::vector<int> numbers;
+};
+
+qsfs::RemovalDecision recordAndStop(const qsfs::RemovalState& state, const char* path, void* context) {
+  auto* seen = static_cast<Seen*>(context);
+  int errnum = 0;
+  EXPECT_EQ(state.errorNumber(&errnum), 0);
+  seen->paths.push_back(path);
+  seen->numbers.push_back(errnum);
+  return qsfs::RemovalDecision::Stop;
+}
+
+TEST_F(RemoveTree, CallbackThatStopsEndsTheWalkWithThatNumber) {
+  ASSERT_TRUE(qstest::makeDirs(dir / "tree/locked"));
+  ASSERT_TRUE(qstest::writeFile(dir / "tree/locked/file", "x"));
+  ASSERT_TRUE(qstest::setImmutable(dir / "tree/locked", true));
+  Seen seen;
+  qsfs::RemovalState state;
+  ASSERT_EQ(state.setErrorCallback(recordAndStop), 0);
+  ASSERT_EQ(state.setErrorContext(&seen), 0);
+  int result = qsfs::removeTree((dir / "tree").c_str(), state);
+  ASSERT_TRUE(qstest::setImmutable(dir / "tree/locked", false));
+  EXPECT_EQ(result, EPERM);
+  EXPECT_EQ(seen.paths, std::vector<std::string>{dir / "tree/locked/file"});
+  EXPECT_EQ(seen.numbers, std::vector<int>{EPERM});
+  EXPECT_TRUE(qstest::exists(dir / "tree/locked"));
+}
+
+TEST_F(RemoveTree, WithoutCallbackStopsAtFirstFailure) {
+  ASSERT_TRUE(qstest::makeDirs(dir / "tree/locked"));
+  ASSERT_TRUE(qstest::writeFile(dir / "tree/locked/file", "x"));
+  ASSERT_TRUE(qstest::setImmutable(dir / "tree/locked/file", true));
+  qsfs::RemovalState state;
+  int result = qsfs::removeTree((dir / "tree").c_str(), state);
+  ASSERT_TRUE(qstest::setImmutable(dir / "tree/locked/file", false));
+  EXPECT_EQ(result, EPERM);
+  EXPECT_TRUE(qstest::exists(dir / "tree/locked/file"));
+}
+
+TEST_F(RemoveTree, MissingRootReportsNoSuchFile) {
+  qsfs::RemovalState state;
+  EXPECT_EQ(qsfs::removeTree((dir / "none").c_str(), state), ENOENT);
+}
+
+TEST_F(RemoveTree, StateRefusesNullArgumentsAndHasNoNumberOutsideTheCallback) {
+  qsfs::RemovalState state;
+  EXPECT_EQ(state.setErrorCallback(nullptr), EINVAL);
+  EXPECT_EQ(state.setErrorContext(nullptr), EINVAL);
+  int errnum = 12345;
+  EXPECT_EQ(state.errorNumber(&errnum), EINVAL);
+  EXPECT_EQ(errnum, 12345);
+}
+
+}  // namespace
