@@ -75,8 +75,8 @@ bool QSFileManager::createDirectoryAtURL(const URL& url, bool withIntermediateDi
     }
   } else if (mkdir(url.fileSystemRepresentation(), mode) != 0 && errno != EEXIST) {
     int errnum = errno;
-    return QSFail(error, QSPOSIXError(kCreateDirectoryFn, __LINE__, errnum, "mkdir of %@ failed: %s", path,
-                                      QSErrorText(errnum)));
+    return QSFail(
+        error, QSPOSIXError(kCreateDirectoryFn, __LINE__, errnum, "mkdir of %@ failed: %s", path, QSErrorText(errnum)));
   }
   if (dataProtectionClass == kQSNoDataProtectionClass) return true;
 
@@ -87,9 +87,9 @@ bool QSFileManager::createDirectoryAtURL(const URL& url, bool withIntermediateDi
                                       QSErrorText(errnum)));
   }
   if (int errnum = qsfs::setDataProtectionClass(dirfd(directory.get()), dataProtectionClass); errnum != 0) {
-    return QSFail(error, QSPOSIXError(kCreateDirectoryFn, __LINE__, errnum,
-                                      "Failed to setclass(%d) on directory %@: %s", dataProtectionClass, path,
-                                      QSErrorText(errnum)));
+    return QSFail(error,
+                  QSPOSIXError(kCreateDirectoryFn, __LINE__, errnum, "Failed to setclass(%d) on directory %@: %s",
+                               dataProtectionClass, path, QSErrorText(errnum)));
   }
   return true;
 }

@@ -28,9 +28,8 @@ int readDirectoryEntries(int directoryFD, std::vector<DirectoryEntry>& entries) 
     const dirent* entry = readdir(stream.get());
     if (entry == nullptr) return errno;
     if (isDotOrDotDot(entry->d_name)) continue;
-    entries.push_back(
-        {QuillsetAdditions::stringWithFileSystemRepresentation(entry->d_name, std::strlen(entry->d_name)),
-         entry->d_type});
+    entries.push_back({QuillsetAdditions::stringWithFileSystemRepresentation(entry->d_name, std::strlen(entry->d_name)),
+                       entry->d_type});
   }
 }
 

@@ -24,8 +24,7 @@ qsfs::RemovalDecision _removefile_error_callback(const qsfs::RemovalState& state
               "removefile hit error for %s but we failed to get the error number", path);
     errnum = ENOENT;
   } else if (errnum != ENOENT) {
-    QS_SYSLOG(kQSLogLevelError, kRemoveErrorCallbackFn, "removefile hit error for %s : %s", path,
-              QSErrorText(errnum));
+    QS_SYSLOG(kQSLogLevelError, kRemoveErrorCallbackFn, "removefile hit error for %s : %s", path, QSErrorText(errnum));
   }
   int* firstError = static_cast<int*>(context);
   if (firstError != nullptr && *firstError == 0) *firstError = errnum;
@@ -50,8 +49,8 @@ bool QSFileManager::removeItemAtURL(const URL& url, Error* error) const {
   }
   int result = qsfs::removeTree(url.fileSystemRepresentation(), state);
   if (result != 0 && result != ENOENT) {
-    return QSFail(error, QSPOSIXError(kRemoveItemFn, __LINE__, result, "removefile of %@ failed: %s", url,
-                                      QSErrorText(result)));
+    return QSFail(
+        error, QSPOSIXError(kRemoveItemFn, __LINE__, result, "removefile of %@ failed: %s", url, QSErrorText(result)));
   }
   if (firstError == 0 || firstError == ENOENT) return true;
   return QSFail(error, QSPOSIXError(kRemoveItemFn, __LINE__, firstError, "removefile of %@ failed: %s", url,

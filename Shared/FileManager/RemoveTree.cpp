@@ -43,11 +43,11 @@ struct Frame {
   ScopedFD fd;
   dev_t device = 0;
   ino_t inode = 0;
-  std::string name;         // the name in the parent (the whole path for the root)
-  size_t pathLength = 0;    // length of the walk's path while this is the current directory
+  std::string name;       // the name in the parent (the whole path for the root)
+  size_t pathLength = 0;  // length of the walk's path while this is the current directory
   std::vector<DirectoryEntry> entries;
   size_t next = 0;
-  bool vanished = false;    // moved away or removed by someone else while we worked
+  bool vanished = false;  // moved away or removed by someone else while we worked
 };
 
 bool sameDirectory(int fd, const Frame& frame) {

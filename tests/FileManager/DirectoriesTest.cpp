@@ -121,9 +121,8 @@ TEST_F(FileManagerDirectories, ImmutableDirectoryRefusesTheClass) {
   bool created = fm.createDirectoryAtURL(fileURL(dir / "locked", true), true, kMode, kClass, &error);
   ASSERT_TRUE(qstest::setImmutable(dir / "locked", false));
   EXPECT_FALSE(created);
-  qstest::expectPOSIXError(error, EPERM,
-                           "Failed to setclass(4) on directory " + dir.path() + "/locked: Operation not permitted",
-                           kCreateFn);
+  qstest::expectPOSIXError(
+      error, EPERM, "Failed to setclass(4) on directory " + dir.path() + "/locked: Operation not permitted", kCreateFn);
   EXPECT_FALSE(hasClassAttribute(dir / "locked"));
 }
 

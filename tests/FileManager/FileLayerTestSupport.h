@@ -60,7 +60,9 @@ inline std::optional<struct stat> lstatOf(const std::string& path) {
   return status;
 }
 
-inline bool exists(const std::string& path) { return lstatOf(path).has_value(); }
+inline bool exists(const std::string& path) {
+  return lstatOf(path).has_value();
+}
 
 inline std::optional<std::string> xattrOf(const std::string& path, const char* name) {
   char buffer[4096];
@@ -85,6 +87,8 @@ inline void expectPOSIXError(const platform::Error& error, int code, const std::
 }
 
 // An error record that a successful call must leave as it was.
-inline platform::Error untouchedSentinel() { return platform::Error("Sentinel", 99); }
+inline platform::Error untouchedSentinel() {
+  return platform::Error("Sentinel", 99);
+}
 
 }  // namespace qstest

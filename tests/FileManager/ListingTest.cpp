@@ -9,6 +9,7 @@
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
+#include "Shared/FileManager/QuillsetAdditions.h"
 
 namespace {
 
@@ -40,8 +41,8 @@ TEST_F(FileManagerListing, ListsChildrenWithDirectoryFlagOnlyOnRealDirectories) 
   Error error = qstest::untouchedSentinel();
   auto urls = fm.urlsForItemsInDirectoryAtURL(fileURL(dir.path(), true), false, &error);
   ASSERT_TRUE(urls.has_value());
-  EXPECT_EQ(flags(*urls), (std::map<std::string, bool>{
-                              {"file", false}, {"sub", true}, {"link-to-dir", false}, {"dangling", false}}));
+  EXPECT_EQ(flags(*urls),
+            (std::map<std::string, bool>{{"file", false}, {"sub", true}, {"link-to-dir", false}, {"dangling", false}}));
   for (const URL& u : *urls) EXPECT_EQ(u.deletingLastPathComponent().path(), dir.path());
   EXPECT_TRUE(error.is("Sentinel", 99));
 }
@@ -104,8 +105,8 @@ TEST_F(FileManagerListing, RegularFileAndMissingPathFailWithTheirErrorNumbers) {
                            kListFn);
   qstest::LogCapture log;
   EXPECT_FALSE(fm.urlsForItemsInDirectoryAtURL(fileURL(dir / "none"), false, &error).has_value());
-  qstest::expectPOSIXError(
-      error, ENOENT, "_IterateDirectory for " + dir.path() + "/none returned No such file or directory", kListFn);
+  qstest::expectPOSIXError(error, ENOENT,
+                           "_IterateDirectory for " + dir.path() + "/none returned No such file or directory", kListFn);
   EXPECT_TRUE(log.systemLines().empty()) << "listing failures are not logged";
 }
 
@@ -119,6 +120,23 @@ TEST_F(FileManagerListing, UnreadableDirectoryFailsWithPermissionDenied) {
     return error.localizedDescription() == "_IterateDirectory for " + path + " returned Permission denied" ? 0 : 3;
   });
   EXPECT_EQ(status, 0);
+}
+
+TEST(QuillsetAdditions, NameConversionKeepsExactlyTheGivenBytes) {
+  const char bytes[] = {'a', '\0', '\xff', 'b', 'c'};
+  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation(bytes, 4), std::string(bytes, 4));
+  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation("ab\xfe"), "ab\xfe");
+  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation("name", 2), "na") << "no terminator is needed";
+  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation(nullptr), "");
+}
+
+TEST(QuillsetAdditions, DotDotCountsOnlyAsAWholeComponent) {
+  for (const char* path : {"..", "a/../b", "/..", "../a", "a/..", "a//../"}) {
+    EXPECT_TRUE(QuillsetAdditions::containsDotDotPathComponents(path)) << path;
+  }
+  for (const char* path : {"", "a/...b", "...", "..a", "a..", "a/.b/.", "/a/b/"}) {
+    EXPECT_FALSE(QuillsetAdditions::containsDotDotPathComponents(path)) << path;
+  }
 }
 
 }  // namespace

@@ -78,8 +78,8 @@ TEST_F(FileManagerRemoval, ImmutableDirectoryKeepsFirstErrorAndRemovesTheRest) {
   ASSERT_TRUE(qstest::setImmutable(dir / "tree/locked", false));
 
   EXPECT_FALSE(removed);
-  qstest::expectPOSIXError(error, EPERM, "removefile of file://" + dir.path() + "/tree/ failed: Operation not permitted",
-                           kRemoveFn);
+  qstest::expectPOSIXError(error, EPERM,
+                           "removefile of file://" + dir.path() + "/tree/ failed: Operation not permitted", kRemoveFn);
   auto lines = log.systemLines();
   ASSERT_EQ(lines.size(), 3u);
   EXPECT_EQ(lines[0].message, "removefile hit error for " + dir.path() + "/tree/locked/file : Operation not permitted");
