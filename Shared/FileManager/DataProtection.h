@@ -26,9 +26,10 @@ inline constexpr int32_t kUnsetDataProtectionClass = 0;
 [[nodiscard]] int getDataProtectionClass(int fd, int32_t* dataProtectionClass);
 
 // Stores `dataProtectionClass` on the item open at `fd`, replacing any class
-// it had. kQSNoDataProtectionClass (-1, "no class to set") is refused with EINVAL; other failures are fsetxattr's
-// (EPERM on an immutable item, ENOTSUP where the file system has no user attributes). A failure leaves the stored class
-// as it was.
+// it had. kQSNoDataProtectionClass (-1, "no class to set") is refused with
+// EINVAL; other failures are fsetxattr's (EPERM on an immutable item, ENOTSUP
+// where the file system has no user attributes). A failure leaves the stored
+// class as it was.
 [[nodiscard]] int setDataProtectionClass(int fd, int32_t dataProtectionClass);
 
 }  // namespace qsfs

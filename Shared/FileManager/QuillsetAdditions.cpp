@@ -2,10 +2,11 @@
 
 #include <cstring>
 
+#include "Shared/FileManager/DirectoryReader.h"
+
 namespace QuillsetAdditions {
 
 namespace {
-constexpr std::string_view kParentDirectoryComponent = "..";
 constexpr char kPathSeparator = '/';
 }  // namespace
 
@@ -26,7 +27,7 @@ bool containsDotDotPathComponents(std::string_view path) {
   while (start <= path.size()) {
     size_t end = path.find(kPathSeparator, start);
     if (end == std::string_view::npos) end = path.size();
-    if (path.substr(start, end - start) == kParentDirectoryComponent) return true;
+    if (path.substr(start, end - start) == qsfs::kParentDirectoryName) return true;
     start = end + 1;
   }
   return false;

@@ -183,6 +183,56 @@ TEST_F(RemoveTree, WithoutCallbackStopsAtFirstFailure) {
   EXPECT_TRUE(qstest::exists(dir / "tree/locked/file"));
 }
 
+// While the walk is deep below it, a directory whose descriptor the walk has
+// already closed is moved elsewhere. The walk must find its way back up to
+// the directories still in place, remove them, and leave the moved one alone.
+struct MoveOnFirstFailure {
+  std::string from, to;
+  std::vector<int> numbers;
+};
+
+qsfs::RemovalDecision moveAwayAndProceed(const qsfs::RemovalState& state, const char* path, void* context) {
+  (void)path;
+  auto* move = static_cast<MoveOnFirstFailure*>(context);
+  int errnum = 0;
+  EXPECT_EQ(state.errorNumber(&errnum), 0);
+  if (move->numbers.empty()) {
+    EXPECT_EQ(rename(move->from.c_str(), move->to.c_str()), 0);
+  }
+  move->numbers.push_back(errnum);
+  return qsfs::RemovalDecision::Proceed;
+}
+
+TEST_F(RemoveTree, DirectoryMovedAwayDuringTheWalkIsLeftWhereItWent) {
+  constexpr int kDepth = 300;
+  constexpr int kMovedLevel = 20;  // its descriptor is closed when the walk is at the bottom
+  static_assert(kDepth - kMovedLevel > static_cast<int>(qsfs::kMaxOpenDirectories));
+  qstest::ShmDir shm;
+  ASSERT_TRUE(qstest::makeDirs(shm / "root"));
+  ASSERT_NO_FATAL_FAILURE(makeChain(shm / "root", kDepth));
+  std::string chain;
+  for (int i = 0; i < kDepth; ++i) chain += "/d";
+  const std::string bottomFile = shm / "root" + chain + "/locked";
+  ASSERT_TRUE(qstest::writeFile(bottomFile, "x"));
+  ASSERT_TRUE(qstest::setImmutable(bottomFile, true));
+
+  MoveOnFirstFailure move{shm / "root" + chain.substr(0, 2 * kMovedLevel), shm / "moved", {}};
+  qsfs::RemovalState state;
+  ASSERT_EQ(state.setErrorCallback(moveAwayAndProceed), 0);
+  ASSERT_EQ(state.setErrorContext(&move), 0);
+  int result = qsfs::removeTree((shm / "root").c_str(), state);
+
+  const std::string movedFile = shm / "moved" + chain.substr(2 * kMovedLevel) + "/locked";
+  EXPECT_TRUE(qstest::exists(movedFile));
+  if (qstest::exists(movedFile)) {
+    ASSERT_TRUE(qstest::setImmutable(movedFile, false));
+  }
+  EXPECT_EQ(result, 0);
+  ASSERT_FALSE(move.numbers.empty());
+  EXPECT_EQ(move.numbers.front(), EPERM);
+  EXPECT_FALSE(qstest::exists(shm / "root"));
+}
+
 TEST_F(RemoveTree, MissingRootReportsNoSuchFile) {
   qsfs::RemovalState state;
   EXPECT_EQ(qsfs::removeTree((dir / "none").c_str(), state), ENOENT);
