@@ -9,6 +9,7 @@
 #include <string>
 #include <string_view>
 
+#include "Platform/Foundation/Error.h"
 #include "Platform/Foundation/Value.h"
 
 namespace platform {
@@ -29,13 +30,21 @@ class FilePreferenceStore final : public PreferenceStore {
   std::optional<Value> copyValue(std::string_view key, std::string_view domain) override;
   // Where `domain` is kept.
   std::string pathForDomain(std::string_view domain) const;
+  // The whole domain, or none with *error (kFileErrorDomain, as
+  // plist::readDictionary reports it; 256 for a domain name that is empty or
+  // holds a separator or NUL) when its file cannot be read as a dictionary.
+  std::optional<Dictionary> copyDomain(std::string_view domain, Error* error = nullptr) const;
 
  private:
   std::string systemRoot_;
 };
 
 // The system root named by QS_SYSTEM_ROOT, without a trailing separator ("" for
-// "/"), read once per process.
+// "/" and when the variable is unset), read once per process; safe to call
+// from any thread.
 const std::string& systemRootFromEnvironment();
+
+// `root` without trailing separators ("/" and "///" give "").
+std::string normalizedSystemRoot(std::string_view root);
 
 }  // namespace platform

@@ -5,6 +5,7 @@
 #include <optional>
 #include <string>
 
+#include "Platform/Foundation/Error.h"
 #include "Platform/Foundation/Value.h"
 
 namespace platform {
@@ -20,10 +21,16 @@ class SystemVersionSource {
   virtual std::optional<Dictionary> systemVersionDictionary() = 0;
 };
 
+// Reads the file afresh on every call; thread-safe. `systemRoot` is "" or "/"
+// for the real root.
 class FileSystemVersionSource final : public SystemVersionSource {
  public:
-  explicit FileSystemVersionSource(std::string systemRoot) : systemRoot_(std::move(systemRoot)) {}
+  explicit FileSystemVersionSource(std::string systemRoot);
   std::optional<Dictionary> systemVersionDictionary() override;
+  // The same, with the reason in *error (kFileErrorDomain, as
+  // plist::readDictionary reports it) when the file is missing, unreadable or
+  // its root is not a dictionary.
+  std::optional<Dictionary> readSystemVersionDictionary(Error* error) const;
   std::string path() const;
 
  private:

@@ -1,0 +1,180 @@
+// Whole-file reading and (atomic) writing of bytes: readFileBytes and
+// writeFileBytes of PropertyList.h.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <string>
+#include <vector>
+
+#include "Platform/Foundation/FileErrors.h"
+#include "Platform/Foundation/PropertyList.h"
+
+namespace platform::plist {
+
+namespace {
+
+// Permissions of a file that did not exist before it was written.
+constexpr mode_t kNewFileMode = 0644;
+constexpr mode_t kPermissionBits = 07777;
+constexpr size_t kReadChunk = 64 * 1024;
+// The temporary file is "." + the target's name (cut to this length) + a
+// unique suffix, so that it stays within NAME_MAX and is hidden.
+constexpr size_t kTempNameStemLimit = 200;
+constexpr char kTempSuffix[] = ".XXXXXX";
+
+// An owned descriptor, closed on destruction (the close error of a write
+// must be checked: use close()).
+class UniqueFd {
+ public:
+  explicit UniqueFd(int fd = -1) : fd_(fd) {}
+  ~UniqueFd() {
+    if (fd_ >= 0) ::close(fd_);
+  }
+  UniqueFd(const UniqueFd&) = delete;
+  UniqueFd& operator=(const UniqueFd&) = delete;
+  int get() const { return fd_; }
+  bool valid() const { return fd_ >= 0; }
+  // Closes now; false with errno set when close reports an error.
+  bool close() {
+    int fd = fd_;
+    fd_ = -1;
+    return ::close(fd) == 0;
+  }
+
+ private:
+  int fd_;
+};
+
+// A file that is unlinked when the object goes away, unless kept.
+class TempFileGuard {
+ public:
+  explicit TempFileGuard(std::string path) : path_(std::move(path)) {}
+  ~TempFileGuard() {
+    if (!path_.empty()) ::unlink(path_.c_str());
+  }
+  TempFileGuard(const TempFileGuard&) = delete;
+  TempFileGuard& operator=(const TempFileGuard&) = delete;
+  const std::string& path() const { return path_; }
+  void keep() { path_.clear(); }
+
+ private:
+  std::string path_;
+};
+
+// A failed call: the POSIX record of `call` on `path` wrapped in the write
+// failure of `url`.
+bool writeFailure(Error* error, const URL& url, const char* call, const std::string& path) {
+  int errnum = errno;
+  Error posix = POSIXCallError(errnum, call, path);
+  return failWith(error, FileWriteError(url, std::string(call) + " failed: " + errnoText(errnum), &posix));
+}
+
+std::optional<Data> readFailure(Error* error, const URL& url, const char* call, int errnum) {
+  Error posix = POSIXCallError(errnum, call, url.path());
+  std::string reason = errnum == ENOENT ? "no such file" : std::string(call) + " failed: " + errnoText(errnum);
+  failWith(error, FileReadError(url, reason, &posix));
+  return std::nullopt;
+}
+
+// Writes every byte, retrying interrupted and partial writes. errno is set
+// on failure.
+bool writeAll(int fd, const Data& data) {
+  size_t done = 0;
+  while (done < data.size()) {
+    ssize_t n = ::write(fd, data.data() + done, data.size() - done);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    done += static_cast<size_t>(n);
+  }
+  return true;
+}
+
+// The permissions the written file gets: those of the file it replaces, or
+// the default for a new one.
+mode_t modeForReplacing(const std::string& path) {
+  struct stat st;
+  if (::stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode)) return st.st_mode & kPermissionBits;
+  return kNewFileMode;
+}
+
+std::string tempTemplateFor(const URL& url) {
+  std::string stem = "." + url.lastPathComponent().substr(0, kTempNameStemLimit);
+  return path::join(url.deletingLastPathComponent().path(), stem + kTempSuffix);
+}
+
+// Flushes the directory so that the rename itself survives a crash. A file
+// system that cannot flush directories (EINVAL) has nothing to flush.
+bool syncDirectory(const std::string& directory) {
+  UniqueFd dir(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dir.valid()) return false;
+  return ::fsync(dir.get()) == 0 || errno == EINVAL;
+}
+
+bool writeAtomically(const Data& data, const URL& url, Error* error) {
+  std::string tmpl = tempTemplateFor(url);
+  UniqueFd fd(::mkostemp(tmpl.data(), O_CLOEXEC));
+  if (!fd.valid()) return writeFailure(error, url, "mkstemp", tmpl);
+  TempFileGuard temp(tmpl);
+
+  if (!writeAll(fd.get(), data)) return writeFailure(error, url, "write", temp.path());
+  if (::fchmod(fd.get(), modeForReplacing(url.path())) != 0) return writeFailure(error, url, "fchmod", temp.path());
+  if (::fsync(fd.get()) != 0) return writeFailure(error, url, "fsync", temp.path());
+  if (!fd.close()) return writeFailure(error, url, "close", temp.path());
+  if (::rename(temp.path().c_str(), url.fileSystemRepresentation()) != 0) {
+    return writeFailure(error, url, "rename", url.path());
+  }
+  temp.keep();
+  const std::string directory = url.deletingLastPathComponent().path();
+  if (!syncDirectory(directory)) return writeFailure(error, url, "fsync", directory);
+  return true;
+}
+
+bool writeInPlace(const Data& data, const URL& url, Error* error) {
+  UniqueFd fd(::open(url.fileSystemRepresentation(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kNewFileMode));
+  if (!fd.valid()) return writeFailure(error, url, "open", url.path());
+  if (!writeAll(fd.get(), data)) return writeFailure(error, url, "write", url.path());
+  if (!fd.close()) return writeFailure(error, url, "close", url.path());
+  return true;
+}
+
+}  // namespace
+
+std::optional<Data> readFileBytes(const URL& url, Error* error) {
+  // O_NONBLOCK keeps a FIFO from blocking the open; only regular files are
+  // read (a device could be endless).
+  UniqueFd fd(::open(url.fileSystemRepresentation(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  if (!fd.valid()) return readFailure(error, url, "open", errno);
+  struct stat st;
+  if (::fstat(fd.get(), &st) != 0) return readFailure(error, url, "fstat", errno);
+  if (S_ISDIR(st.st_mode)) return readFailure(error, url, "read", EISDIR);
+  if (!S_ISREG(st.st_mode)) {
+    failWith(error, FileReadError(url, "not a regular file"));
+    return std::nullopt;
+  }
+
+  Data bytes;
+  bytes.reserve(static_cast<size_t>(st.st_size) + kReadChunk);
+  for (;;) {
+    size_t used = bytes.size();
+    bytes.resize(used + kReadChunk);
+    ssize_t n = ::read(fd.get(), bytes.data() + used, kReadChunk);
+    if (n < 0 && errno == EINTR) {
+      bytes.resize(used);
+      continue;
+    }
+    if (n < 0) return readFailure(error, url, "read", errno);
+    bytes.resize(used + static_cast<size_t>(n));
+    if (n == 0) return bytes;
+  }
+}
+
+bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error) {
+  if (url.empty()) return failWith(error, FileWriteError(url, "no path given"));
+  return atomically ? writeAtomically(data, url, error) : writeInPlace(data, url, error);
+}
+
+}  // namespace platform::plist

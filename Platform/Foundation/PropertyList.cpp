@@ -1,0 +1,409 @@
+// Property lists through the libplist C API.
+//
+// libplist has one integer node type and keeps no sign for the nodes it
+// creates: a node made from UINT64_MAX is written as -1. A node read from a
+// document does remember that it held an unsigned value above INT64_MAX
+// (that is the only difference plist_compare_node_value sees between it and
+// a created node of the same bits). Reading therefore tells the two apart by
+// comparison, and writing makes nodes for such values by reading them from a
+// one-element document.
+#include "Platform/Foundation/PropertyList.h"
+
+#include <plist/plist.h>
+
+#include <cmath>
+#include <cstdint>
+#include <cstdlib>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "Platform/Foundation/FileErrors.h"
+#include "Platform/Foundation/PropertyListXMLCheck.h"
+
+namespace platform::plist {
+
+namespace {
+
+using detail::kMaxNestingDepth;
+
+constexpr std::string_view kUTF8ByteOrderMark = "\xEF\xBB\xBF";
+constexpr std::string_view kBinaryMagic = "bplist";
+// Keyed archives hold UIDs; they read as a dictionary with this one key, as
+// in the XML form of such archives.
+constexpr char kUIDKey[] = "CF$UID";
+constexpr double kMicrosecondsPerSecond = 1e6;
+// libplist's dates carry whole seconds in 32 bits.
+constexpr double kEarliestDate = static_cast<double>(INT32_MIN);
+constexpr double kLatestDate = static_cast<double>(INT32_MAX);
+
+struct PlistFree {
+  void operator()(void* node) const { plist_free(static_cast<plist_t>(node)); }
+};
+using PlistPtr = std::unique_ptr<void, PlistFree>;
+
+struct MallocFree {
+  void operator()(void* p) const { std::free(p); }
+};
+using MallocPtr = std::unique_ptr<char, MallocFree>;
+
+struct XMLFree {
+  void operator()(char* p) const { plist_to_xml_free(p); }
+};
+struct BinaryFree {
+  void operator()(char* p) const { plist_to_bin_free(p); }
+};
+
+std::string_view formatName(Format format) { return format == Format::XML ? "XML" : "binary"; }
+
+// Whether `s` is well-formed UTF-8 (no overlong forms, no surrogates, nothing
+// beyond U+10FFFF): binary property lists store text as ASCII or UTF-16 and
+// cannot keep other bytes.
+bool isValidUTF8(std::string_view s) {
+  size_t i = 0;
+  while (i < s.size()) {
+    unsigned char c = static_cast<unsigned char>(s[i]);
+    size_t extra = c < 0x80 ? 0 : (c >> 5) == 0x6 ? 1 : (c >> 4) == 0xE ? 2 : (c >> 3) == 0x1E ? 3 : 4;
+    if (extra == 4 || s.size() - i <= extra) return false;
+    uint32_t code = extra == 0 ? c : c & (0x3F >> extra);
+    for (size_t k = 1; k <= extra; ++k) {
+      unsigned char next = static_cast<unsigned char>(s[i + k]);
+      if ((next & 0xC0) != 0x80) return false;
+      code = (code << 6) | (next & 0x3F);
+    }
+    static constexpr uint32_t kSmallest[] = {0, 0x80, 0x800, 0x10000};
+    if (code < kSmallest[extra] || code > 0x10FFFF || (code >= 0xD800 && code <= 0xDFFF)) return false;
+    i += extra + 1;
+  }
+  return true;
+}
+
+// ---- libplist nodes to Values ----
+
+class NodeReader {
+ public:
+  std::optional<Value> read(plist_t node, int depth) {
+    if (depth > kMaxNestingDepth) return fail("nesting deeper than " + std::to_string(kMaxNestingDepth) + " levels");
+    switch (plist_get_node_type(node)) {
+      case PLIST_BOOLEAN: {
+        uint8_t b = 0;
+        plist_get_bool_val(node, &b);
+        return Value(b != 0);
+      }
+      case PLIST_UINT: return integer(node);
+      case PLIST_REAL: {
+        double d = 0;
+        plist_get_real_val(node, &d);
+        return Value(d);
+      }
+      case PLIST_STRING: {
+        uint64_t length = 0;
+        const char* text = plist_get_string_ptr(node, &length);
+        return Value(std::string(text ? text : "", text ? length : 0));
+      }
+      case PLIST_KEY: {
+        char* raw = nullptr;
+        plist_get_key_val(node, &raw);
+        MallocPtr key(raw);
+        return Value(std::string(key ? key.get() : ""));
+      }
+      case PLIST_DATA: {
+        uint64_t length = 0;
+        const char* bytes = plist_get_data_ptr(node, &length);
+        const uint8_t* begin = reinterpret_cast<const uint8_t*>(bytes);
+        return Value(bytes ? Data(begin, begin + length) : Data());
+      }
+      case PLIST_DATE: return date(node);
+      case PLIST_ARRAY: return array(node, depth);
+      case PLIST_DICT: return dictionary(node, depth);
+      case PLIST_UID: {
+        uint64_t uid = 0;
+        plist_get_uid_val(node, &uid);
+        return Value(Dictionary{{kUIDKey, Value(uid)}});
+      }
+      default: return fail("an element of unknown type");
+    }
+  }
+
+  const std::string& problem() const { return problem_; }
+
+ private:
+  std::optional<Value> fail(std::string problem) {
+    if (problem_.empty()) problem_ = std::move(problem);
+    return std::nullopt;
+  }
+
+  static Value integer(plist_t node) {
+    uint64_t bits = 0;
+    plist_get_uint_val(node, &bits);
+    if (bits <= static_cast<uint64_t>(INT64_MAX)) return Value(static_cast<int64_t>(bits));
+    PlistPtr created(plist_new_uint(bits));
+    const bool createdAlike = plist_compare_node_value(node, created.get());
+    return createdAlike ? Value(static_cast<int64_t>(bits)) : Value(bits);
+  }
+
+  static Value date(plist_t node) {
+    // libplist splits the time into whole seconds rounded towards zero and
+    // the magnitude of the remaining microseconds.
+    int32_t seconds = 0, microseconds = 0;
+    plist_get_date_val(node, &seconds, &microseconds);
+    double fraction = microseconds / kMicrosecondsPerSecond;
+    return Value(Date{seconds < 0 ? seconds - fraction : seconds + fraction});
+  }
+
+  std::optional<Value> array(plist_t node, int depth) {
+    Array items;
+    items.reserve(plist_array_get_size(node));
+    plist_array_iter rawIter = nullptr;
+    plist_array_new_iter(node, &rawIter);
+    std::unique_ptr<void, MallocFree> iter(rawIter);
+    for (;;) {
+      plist_t item = nullptr;
+      plist_array_next_item(node, iter.get(), &item);
+      if (!item) break;
+      std::optional<Value> value = read(item, depth + 1);
+      if (!value) return std::nullopt;
+      items.push_back(std::move(*value));
+    }
+    return Value(std::move(items));
+  }
+
+  std::optional<Value> dictionary(plist_t node, int depth) {
+    Dictionary entries;
+    plist_dict_iter rawIter = nullptr;
+    plist_dict_new_iter(node, &rawIter);
+    std::unique_ptr<void, MallocFree> iter(rawIter);
+    for (;;) {
+      char* rawKey = nullptr;
+      plist_t item = nullptr;
+      plist_dict_next_item(node, iter.get(), &rawKey, &item);
+      MallocPtr key(rawKey);
+      if (!item) break;
+      std::optional<Value> value = read(item, depth + 1);
+      if (!value) return std::nullopt;
+      // A repeated key keeps its last value.
+      entries.insert_or_assign(std::string(key ? key.get() : ""), std::move(*value));
+    }
+    return Value(std::move(entries));
+  }
+
+  std::string problem_;
+};
+
+// Parses `bytes`; on failure returns none and says why in *problem.
+std::optional<Value> parseBytes(std::string_view bytes, std::string* problem) {
+  if (bytes.starts_with(kUTF8ByteOrderMark)) bytes.remove_prefix(kUTF8ByteOrderMark.size());
+  if (bytes.empty()) {
+    *problem = "the document is empty";
+    return std::nullopt;
+  }
+  if (bytes.size() > UINT32_MAX) {
+    *problem = "the document is larger than 4 GiB";
+    return std::nullopt;
+  }
+  plist_t raw = nullptr;  // libplist leaves a non-null output untouched
+  const auto length = static_cast<uint32_t>(bytes.size());
+  if (bytes.starts_with(kBinaryMagic)) {
+    plist_from_bin(bytes.data(), length, &raw);
+  } else if (std::optional<std::string> xmlProblem = detail::checkXMLPropertyList(bytes)) {
+    *problem = std::move(*xmlProblem);
+    return std::nullopt;
+  } else {
+    plist_from_xml(bytes.data(), length, &raw);
+  }
+  PlistPtr root(raw);
+  if (!root) {
+    *problem = bytes.starts_with(kBinaryMagic) ? "malformed binary property list" : "malformed XML property list";
+    return std::nullopt;
+  }
+  NodeReader reader;
+  std::optional<Value> value = reader.read(root.get(), 0);
+  if (!value) *problem = reader.problem();
+  return value;
+}
+
+// ---- Values to libplist nodes ----
+
+class NodeWriter {
+ public:
+  explicit NodeWriter(Format format) : format_(format) {}
+
+  PlistPtr write(const Value& value, int depth) {
+    if (depth > kMaxNestingDepth) return fail("nesting deeper than " + std::to_string(kMaxNestingDepth) + " levels");
+    switch (value.type()) {
+      case Value::Type::Null: return fail("a null value cannot be written");
+      case Value::Type::Boolean: return PlistPtr(plist_new_bool(value.boolValue() ? 1 : 0));
+      case Value::Type::Integer: return PlistPtr(plist_new_uint(static_cast<uint64_t>(value.int64Value())));
+      case Value::Type::Unsigned: return unsignedInteger(value.uint64Value());
+      case Value::Type::Real: return PlistPtr(plist_new_real(value.doubleValue()));
+      case Value::Type::String: return string(*value.asString());
+      case Value::Type::Data: {
+        const Data& data = *value.asData();
+        return PlistPtr(plist_new_data(reinterpret_cast<const char*>(data.data()), data.size()));
+      }
+      case Value::Type::Date: return date(value.asDate()->secondsSinceReferenceDate);
+      case Value::Type::Array: return array(*value.asArray(), depth);
+      case Value::Type::Dictionary: return dictionary(*value.asDictionary(), depth);
+      case Value::Type::URL:
+        if (depth == 0) return fail("a URL is not a property-list value");
+        return string(value.asURL()->path());
+      case Value::Type::Error: return fail("an error record cannot be written");
+    }
+    return fail("a value of unknown type");
+  }
+
+  const std::string& problem() const { return problem_; }
+
+ private:
+  PlistPtr fail(std::string problem) {
+    if (problem_.empty()) problem_ = std::move(problem);
+    return nullptr;
+  }
+
+  // Text libplist can store without loss: no NUL (it takes C strings) and,
+  // for the binary form, well-formed UTF-8.
+  bool checkText(std::string_view s, const char* what) {
+    if (s.find('\0') != std::string_view::npos) {
+      fail(std::string(what) + " \"" + std::string(s.substr(0, s.find('\0'))) + "\" contains a NUL character");
+      return false;
+    }
+    if (format_ == Format::Binary && !isValidUTF8(s)) {
+      fail(std::string(what) + " \"" + std::string(s) + "\" is not UTF-8, which a binary property list requires");
+      return false;
+    }
+    return true;
+  }
+
+  PlistPtr string(const std::string& s) {
+    if (!checkText(s, "string")) return nullptr;
+    return PlistPtr(plist_new_string(s.c_str()));
+  }
+
+  PlistPtr unsignedInteger(uint64_t u) {
+    if (u <= static_cast<uint64_t>(INT64_MAX)) return PlistPtr(plist_new_uint(u));
+    // Only a node read from a document keeps the value unsigned.
+    std::string document = "<plist><integer>" + std::to_string(u) + "</integer></plist>";
+    plist_t raw = nullptr;
+    plist_from_xml(document.data(), static_cast<uint32_t>(document.size()), &raw);
+    PlistPtr node(raw);
+    if (!node) return fail("libplist could not represent the integer " + std::to_string(u));
+    return node;
+  }
+
+  PlistPtr date(double seconds) {
+    double whole = std::floor(seconds);
+    if (!std::isfinite(seconds) || whole < kEarliestDate || whole > kLatestDate) {
+      return fail("the date " + std::to_string(seconds) + " is outside the range a property list can hold");
+    }
+    double microseconds = std::round((seconds - whole) * kMicrosecondsPerSecond);
+    if (microseconds >= kMicrosecondsPerSecond) {  // rounded up to the next second
+      microseconds = whole < kLatestDate ? 0 : kMicrosecondsPerSecond - 1;
+      if (whole < kLatestDate) whole += 1;
+    }
+    return PlistPtr(plist_new_date(static_cast<int32_t>(whole), static_cast<int32_t>(microseconds)));
+  }
+
+  PlistPtr array(const Array& items, int depth) {
+    PlistPtr node(plist_new_array());
+    for (const Value& item : items) {
+      PlistPtr child = write(item, depth + 1);
+      if (!child) return nullptr;
+      plist_array_append_item(node.get(), child.release());
+    }
+    return node;
+  }
+
+  PlistPtr dictionary(const Dictionary& entries, int depth) {
+    PlistPtr node(plist_new_dict());
+    for (const auto& [key, item] : entries) {
+      if (!checkText(key, "key")) return nullptr;
+      PlistPtr child = write(item, depth + 1);
+      if (!child) return nullptr;
+      plist_dict_set_item(node.get(), key.c_str(), child.release());
+    }
+    return node;
+  }
+
+  Format format_;
+  std::string problem_;
+};
+
+// Serialises `value`; on failure returns none and says why in *problem.
+std::optional<Data> serializeValue(const Value& value, Format format, std::string* problem) {
+  NodeWriter writer(format);
+  PlistPtr root = writer.write(value, 0);
+  if (!root) {
+    *problem = writer.problem();
+    return std::nullopt;
+  }
+  char* raw = nullptr;  // libplist leaves a non-null output untouched
+  uint32_t length = 0;
+  Data out;
+  if (format == Format::XML) {
+    plist_to_xml(root.get(), &raw, &length);
+    std::unique_ptr<char, XMLFree> buffer(raw);
+    if (buffer) out.assign(buffer.get(), buffer.get() + length);
+  } else {
+    plist_to_bin(root.get(), &raw, &length);
+    std::unique_ptr<char, BinaryFree> buffer(raw);
+    if (buffer) out.assign(buffer.get(), buffer.get() + length);
+  }
+  if (!raw) {
+    *problem = "libplist could not produce the " + std::string(formatName(format)) + " form";
+    return std::nullopt;
+  }
+  return out;
+}
+
+}  // namespace
+
+std::optional<Value> parse(const void* bytes, size_t length, Error* error) {
+  std::string problem;
+  std::optional<Value> value =
+      parseBytes(std::string_view(bytes ? static_cast<const char*>(bytes) : "", bytes ? length : 0), &problem);
+  if (!value) {
+    failWith(error, Error(kFileErrorDomain, kFileReadUnknownError,
+                          Dictionary{{kLocalizedDescriptionKey, Value("Not a valid property list: " + problem)}}));
+  }
+  return value;
+}
+
+std::optional<Value> readFile(const URL& url, Error* error) {
+  std::optional<Data> bytes = readFileBytes(url, error);
+  if (!bytes) return std::nullopt;
+  std::string problem;
+  std::optional<Value> value =
+      parseBytes(std::string_view(reinterpret_cast<const char*>(bytes->data()), bytes->size()), &problem);
+  if (!value) failWith(error, FileReadError(url, "not a valid property list: " + problem));
+  return value;
+}
+
+std::optional<Dictionary> readDictionary(const URL& url, Error* error) {
+  std::optional<Value> value = readFile(url, error);
+  if (!value) return std::nullopt;
+  if (Dictionary* dictionary = value->asDictionary()) return std::move(*dictionary);
+  std::string_view type = value->typeName();
+  const char* article = std::string_view("aeiouAEIOU").find(type.front()) == std::string_view::npos ? "a " : "an ";
+  failWith(error, FileReadError(url, "the property list's root is " + std::string(article) + std::string(type) +
+                                         ", not a dictionary"));
+  return std::nullopt;
+}
+
+std::optional<Data> serialize(const Value& value, Format format, Error* error) {
+  std::string problem;
+  std::optional<Data> data = serializeValue(value, format, &problem);
+  if (!data) {
+    failWith(error, Error(kFileErrorDomain, kFileWriteUnknownError,
+                          Dictionary{{kLocalizedDescriptionKey, Value("Cannot write a property list: " + problem)}}));
+  }
+  return data;
+}
+
+bool writeFile(const Value& value, const URL& url, Format format, bool atomically, Error* error) {
+  std::string problem;
+  std::optional<Data> data = serializeValue(value, format, &problem);
+  if (!data) return failWith(error, FileWriteError(url, problem));
+  return writeFileBytes(*data, url, atomically, error);
+}
+
+}  // namespace platform::plist
