@@ -19,7 +19,7 @@
 #include <string_view>
 
 #include "Platform/Foundation/FileErrors.h"
-#include "Platform/Foundation/PropertyListXMLCheck.h"
+#include "Platform/Foundation/PropertyListCheck.h"
 
 namespace platform::plist {
 
@@ -203,17 +203,21 @@ std::optional<Value> parseBytes(std::string_view bytes, std::string* problem) {
   }
   plist_t raw = nullptr;  // libplist leaves a non-null output untouched
   const auto length = static_cast<uint32_t>(bytes.size());
-  if (bytes.starts_with(kBinaryMagic)) {
-    plist_from_bin(bytes.data(), length, &raw);
-  } else if (std::optional<std::string> xmlProblem = detail::checkXMLPropertyList(bytes)) {
-    *problem = std::move(*xmlProblem);
+  const bool binary = bytes.starts_with(kBinaryMagic);
+  std::optional<std::string> found =
+      binary ? detail::checkBinaryPropertyList(bytes) : detail::checkXMLPropertyList(bytes);
+  if (found) {
+    *problem = std::move(*found);
     return std::nullopt;
+  }
+  if (binary) {
+    plist_from_bin(bytes.data(), length, &raw);
   } else {
     plist_from_xml(bytes.data(), length, &raw);
   }
   PlistPtr root(raw);
   if (!root) {
-    *problem = bytes.starts_with(kBinaryMagic) ? "malformed binary property list" : "malformed XML property list";
+    *problem = binary ? "malformed binary property list" : "malformed XML property list";
     return std::nullopt;
   }
   NodeReader reader;

@@ -1,4 +1,4 @@
-// Structural check of an XML property-list document.
+// Checks of property-list documents before libplist reads them.
 //
 // libplist's XML reader lets malformed documents through: an integer element
 // whose text is not a number reads as 0, a dictionary key without a value is
@@ -8,11 +8,19 @@
 // a document type declaration (with an internal subset), comments, processing
 // instructions, CDATA sections, character and the predefined entity
 // references, attributes, empty-element tags, and a root value with or
-// without the enclosing <plist> element.
+// without the enclosing <plist> element. A NUL character, which XML does not
+// allow, is refused too.
+//
+// libplist's binary reader aborts the process (a failed assertion) when
+// asked for a dictionary key that holds a NUL character (and cuts other
+// strings short at one), overflows the stack
+// on deep nesting and expands every shared object once per reference. The
+// binary check refuses such documents first.
 //
 // Internal to the property-list reader. Thread safety: pure function.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -22,10 +30,19 @@ namespace platform::plist::detail {
 // Deepest nesting of arrays and dictionaries that a document may have; deeper
 // documents are refused before any recursive reader sees them.
 inline constexpr int kMaxNestingDepth = 512;
+// Most values a binary document may expand to when its shared objects are
+// read once per reference.
+inline constexpr uint64_t kMaxExpandedObjects = uint64_t{1} << 22;
 
 // Checks `text` (without a byte-order mark). Returns none when the document is
 // a well-formed property list, otherwise what is wrong and where ("integer
 // element holds \"abc\", not a number (byte 120)").
 std::optional<std::string> checkXMLPropertyList(std::string_view text);
+
+// Checks a binary ("bplist00") document for strings that hold a NUL
+// character, for containers that contain themselves, nesting deeper than
+// kMaxNestingDepth and more than kMaxExpandedObjects values in all. Returns
+// none when there is none of these; other damage is left for libplist.
+std::optional<std::string> checkBinaryPropertyList(std::string_view bytes);
 
 }  // namespace platform::plist::detail
