@@ -29,7 +29,8 @@ struct QSTraversalEntry {
   enum class Kind { DirectoryPre, DirectoryPost, RegularFile, SymbolicLink, Other };
   std::string path;         // root path followed by the path inside the tree
   Kind kind = Kind::Other;
-  int errorNumber = 0;      // the error the walk met for this entry, 0 if none
+  int errorNumber = 0;      // the error the walk met for this entry, 0 if none; a directory
+                            // that cannot be read comes as DirectoryPost with its error
   struct stat status {};    // lstat of the item (for DirectoryPost: the one taken at DirectoryPre)
 };
 
@@ -43,6 +44,10 @@ using QSDataProtectionPredicate = std::function<bool(int32_t currentClass)>;
 
 // "No class to set" for directory creation.
 inline constexpr int32_t kQSNoDataProtectionClass = -1;
+
+// Extended attributes kept on application bundles (user namespace).
+inline constexpr char kQSPlaceholderAttributeName[] = "user.com.vantrel.quilld.placeholder";
+inline constexpr char kQSInstallTypeAttributeName[] = "user.com.vantrel.quilld.installType";
 
 class QSFileManager {
  public:

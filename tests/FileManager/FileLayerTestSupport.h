@@ -86,6 +86,11 @@ inline void expectPOSIXError(const platform::Error& error, int code, const std::
   EXPECT_EQ(functionNameOf(error), function);
 }
 
+// Creates a symbolic link at `at` holding `text`; fails the test otherwise.
+inline void makeSymlink(const std::string& text, const std::string& at) {
+  ASSERT_EQ(symlink(text.c_str(), at.c_str()), 0) << at << ": " << strerror(errno);
+}
+
 // An error record that a successful call must leave as it was.
 inline platform::Error untouchedSentinel() {
   return platform::Error("Sentinel", 99);
