@@ -96,8 +96,11 @@ Value& Value::operator=(const Value& other) {
 }
 Value& Value::operator=(Value&& other) noexcept {
   if (this != &other) {
+    // `other` may live inside this Value (v = std::move((*v.asArray())[0])):
+    // take it out before destroying what holds it.
+    Value taken(std::move(other));
     destroy();
-    moveFrom(std::move(other));
+    moveFrom(std::move(taken));
   }
   return *this;
 }
@@ -249,7 +252,6 @@ std::string Value::description() const {
       for (const auto& [k, v] : *payload<Dictionary>(p_)) {
         out += quoteIfNeeded(k) + " = " + describeNested(v) + "; ";
       }
-      if (out.size() > 1) out.pop_back();
       return out + "}";
     }
     case Type::URL: return payload<URL>(p_)->description();
