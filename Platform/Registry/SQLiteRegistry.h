@@ -2,6 +2,28 @@
 // of the Linux platform, kept in an SQLite database under
 // <root>/private/var/db/appregistry/.
 //
+// Layout under the system root:
+//   private/var/db/appregistry/registry.sqlite      the database (WAL mode)
+//   private/var/db/appregistry/install.lock         serialises changes across processes
+//   private/var/containers/Bundle/Application/<UUID>/<name>.app
+//                                                   bundle containers (store metadata beside the bundle)
+//   private/var/mobile/Containers/Data/Application/<UUID>/      data containers of applications
+//   private/var/mobile/Containers/Data/PluginKitPlugin/<UUID>/  data containers of VPN plug-ins
+//   private/var/mobile/Containers/Shared/AppGroup/<UUID>/       group containers, one per group identifier
+//   Applications/*.app                               built-in applications (read only)
+// UUIDs are random (getrandom), upper-case, 8-4-4-4-12.
+//
+// Installation (installPackage) runs on a worker thread that delivers every
+// progress report; the call joins it before returning. A package is its
+// "Payload" directory (exactly one *.app and at most one *.vpnplugin, or a
+// single *.vpnplugin alone) and store-metadata items beside "Payload", which
+// are kept beside the bundle in its new container. After a successful
+// installation, and after an "ApplicationAlreadyInstalled" refusal, the
+// package directory is removed; after any other refusal it is left as it was.
+// The registry remembers the package path each identifier was last installed
+// from: installing that package again once its Payload no longer holds a
+// bundle succeeds without change, so that an interrupted caller can finish.
+//
 // Thread safety: every operation may be called from any thread; each opens
 // its statements on a connection guarded by the object's own lock. Several
 // processes may open the same registry; SQLite serialises their changes.
@@ -10,6 +32,7 @@
 // registry as before or after the change (recovered on the next open).
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <string>
 #include <vector>
@@ -19,6 +42,36 @@
 #include "Platform/Registry/InstallationDaemon.h"
 
 namespace platform {
+
+// Codes of kRegistryErrorDomain. Every error carries a kLocalizedDescriptionKey
+// message naming the path concerned and, where there is one, the POSIX or
+// database error under kUnderlyingErrorKey.
+inline constexpr int64_t kRegistryErrorDatabase = 1;          // the database cannot be opened, read or written
+inline constexpr int64_t kRegistryErrorInvalidPackage = 2;    // no package, no Payload, wrong Payload contents
+inline constexpr int64_t kRegistryErrorInvalidInfoPlist = 3;  // Info.plist unreadable, not a dictionary, no identifier
+inline constexpr int64_t kRegistryErrorIdentifierMismatch = 4;  // the bundle is not the identifier of the options
+inline constexpr int64_t kRegistryErrorAlreadyInstalled = 5;    // a built-in copy is equal or newer
+inline constexpr int64_t kRegistryErrorFileOperation = 6;       // a container could not be made or filled
+inline constexpr int64_t kRegistryErrorInvalidOptions = 7;      // options the call does not support
+inline constexpr int64_t kRegistryErrorNotReplaceable = 8;      // a placeholder for an installed application
+
+// Values of kRegistryProgressStatusKey, in the order an installation reports
+// them. "RegisteringApplication" comes after the files are in place and before
+// the record is committed; "CleaningUp" after the commit, before the package
+// directory and the replaced bundle container are removed.
+inline constexpr char kRegistryStatusVerifying[] = "VerifyingApplication";
+inline constexpr char kRegistryStatusStaging[] = "StagingFiles";
+inline constexpr char kRegistryStatusRegistering[] = "RegisteringApplication";
+inline constexpr char kRegistryStatusCleaningUp[] = "CleaningUp";
+inline constexpr char kRegistryStatusComplete[] = "Complete";
+// A replay of a package that was already installed from.
+inline constexpr char kRegistryStatusAlreadyInstalledFromPackage[] = "AlreadyInstalledFromPackage";
+inline constexpr char kRegistryStatusFailed[] = "Failed";
+
+// The xattr holding an item's data-protection class (4 bytes, native order),
+// and the class the migrator's update gives system data containers.
+inline constexpr char kProtectionClassAttributeName[] = "user.com.vantrel.quilld.protection-class";
+inline constexpr int32_t kSystemDataContainerProtectionClass = 3;
 
 struct SafeHarborRecord {
   std::string identifier;

@@ -1,0 +1,186 @@
+#include "Platform/Registry/RegistryDatabase.h"
+
+#include "Platform/Foundation/Format.h"
+#include "Platform/Registry/SQLiteRegistry.h"
+
+namespace platform::registry {
+
+namespace {
+
+// How long a change waits for another process's transaction to end.
+constexpr int kBusyTimeoutMilliseconds = 10000;
+constexpr char kSQLiteResultCodeKey[] = "SQLiteResultCode";
+
+constexpr char kConnectionSetup[] =
+    "PRAGMA journal_mode=WAL;"
+    "PRAGMA synchronous=FULL;"
+    "PRAGMA foreign_keys=ON;";
+
+// Group containers are shared by every application of a group, so a group's
+// container lives in its own table; record_groups says which groups a record
+// has. A record's has_group_dictionary is 0 for placeholders.
+constexpr char kSchema[] =
+    "CREATE TABLE IF NOT EXISTS records("
+    "  identifier TEXT PRIMARY KEY,"
+    "  bundle_type TEXT NOT NULL,"
+    "  bundle_path TEXT NOT NULL,"
+    "  bundle_container TEXT NOT NULL,"
+    "  data_container TEXT,"
+    "  is_placeholder INTEGER NOT NULL,"
+    "  has_group_dictionary INTEGER NOT NULL,"
+    "  version TEXT NOT NULL,"
+    "  display_name TEXT NOT NULL,"
+    "  package_path TEXT);"
+    "CREATE TABLE IF NOT EXISTS group_containers("
+    "  group_id TEXT PRIMARY KEY,"
+    "  path TEXT NOT NULL);"
+    "CREATE TABLE IF NOT EXISTS record_groups("
+    "  identifier TEXT NOT NULL REFERENCES records(identifier) ON DELETE CASCADE,"
+    "  group_id TEXT NOT NULL REFERENCES group_containers(group_id),"
+    "  PRIMARY KEY(identifier, group_id));"
+    "CREATE TABLE IF NOT EXISTS system_data_containers("
+    "  identifier TEXT PRIMARY KEY,"
+    "  path TEXT NOT NULL);"
+    "CREATE TABLE IF NOT EXISTS safe_harbors("
+    "  identifier TEXT PRIMARY KEY,"
+    "  path TEXT NOT NULL,"
+    "  container_type INTEGER NOT NULL);"
+    "CREATE TABLE IF NOT EXISTS install_journal("
+    "  seq INTEGER PRIMARY KEY AUTOINCREMENT,"
+    "  kind TEXT NOT NULL,"
+    "  source TEXT NOT NULL,"
+    "  destination TEXT NOT NULL);";
+
+Error sqliteFailure(const std::string& path, const std::string& what, int resultCode, const char* message) {
+  Dictionary info{
+      {kLocalizedDescriptionKey, Value(Format("registry database %s: %s: %s", path, what, message ? message : ""))},
+      {kSQLiteResultCodeKey, Value(resultCode)}};
+  return Error(kRegistryErrorDomain, kRegistryErrorDatabase, std::move(info));
+}
+
+}  // namespace
+
+std::unique_ptr<Database> Database::open(const std::string& path, Error* error) {
+  sqlite3* handle = nullptr;
+  int rc = sqlite3_open_v2(path.c_str(), &handle, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_FULLMUTEX,
+                           nullptr);
+  if (rc != SQLITE_OK) {
+    if (error) *error = sqliteFailure(path, "open", rc, handle ? sqlite3_errmsg(handle) : sqlite3_errstr(rc));
+    sqlite3_close(handle);
+    return nullptr;
+  }
+  std::unique_ptr<Database> db(new Database(handle, path));
+  sqlite3_extended_result_codes(handle, 1);
+  sqlite3_busy_timeout(handle, kBusyTimeoutMilliseconds);
+  if (!db->execute(kConnectionSetup, error)) return nullptr;
+  // journal_mode=WAL reports the mode it got rather than failing.
+  auto mode = db->prepare("PRAGMA journal_mode;", error);
+  bool failed = false;
+  if (!mode || !mode->step(&failed, error)) return nullptr;
+  if (mode->text(0) != "wal") {
+    if (error)
+      *error = sqliteFailure(path, "enable WAL", SQLITE_CANTOPEN, ("journal mode is " + mode->text(0)).c_str());
+    return nullptr;
+  }
+  if (!db->execute(kSchema, error)) return nullptr;
+  return db;
+}
+
+Database::~Database() {
+  sqlite3_close_v2(handle_);
+}
+
+bool Database::execute(const char* sql, Error* error) {
+  char* message = nullptr;
+  int rc = sqlite3_exec(handle_, sql, nullptr, nullptr, &message);
+  if (rc == SQLITE_OK) return true;
+  if (error) *error = sqliteFailure(path_, Format("run \"%s\"", sql), rc, message);
+  sqlite3_free(message);
+  return false;
+}
+
+std::optional<Statement> Database::prepare(const char* sql, Error* error) {
+  sqlite3_stmt* stmt = nullptr;
+  int rc = sqlite3_prepare_v2(handle_, sql, -1, &stmt, nullptr);
+  if (rc != SQLITE_OK) {
+    if (error) *error = failure(Format("prepare \"%s\"", sql));
+    sqlite3_finalize(stmt);
+    return std::nullopt;
+  }
+  return Statement(this, stmt);
+}
+
+Error Database::failure(const std::string& what) const {
+  return sqliteFailure(path_, what, sqlite3_extended_errcode(handle_), sqlite3_errmsg(handle_));
+}
+
+Statement::~Statement() {
+  sqlite3_finalize(stmt_);
+}
+
+Statement& Statement::bind(int index, const std::string& text) {
+  sqlite3_bind_text(stmt_, index, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
+  return *this;
+}
+
+Statement& Statement::bind(int index, int64_t number) {
+  sqlite3_bind_int64(stmt_, index, number);
+  return *this;
+}
+
+Statement& Statement::bind(int index, const std::optional<std::string>& textOrNull) {
+  if (textOrNull) return bind(index, *textOrNull);
+  sqlite3_bind_null(stmt_, index);
+  return *this;
+}
+
+bool Statement::step(bool* failed, Error* error) {
+  int rc = sqlite3_step(stmt_);
+  *failed = false;
+  if (rc == SQLITE_ROW) return true;
+  if (rc == SQLITE_DONE) return false;
+  *failed = true;
+  if (error) *error = db_->failure(Format("step \"%s\"", sqlite3_sql(stmt_)));
+  return false;
+}
+
+bool Statement::run(Error* error) {
+  bool failed = false;
+  while (step(&failed, error)) {
+  }
+  sqlite3_reset(stmt_);
+  return !failed;
+}
+
+std::string Statement::text(int column) const {
+  const unsigned char* bytes = sqlite3_column_text(stmt_, column);
+  return bytes ? std::string(reinterpret_cast<const char*>(bytes),
+                             static_cast<size_t>(sqlite3_column_bytes(stmt_, column)))
+               : std::string();
+}
+
+std::optional<std::string> Statement::optionalText(int column) const {
+  if (sqlite3_column_type(stmt_, column) == SQLITE_NULL) return std::nullopt;
+  return text(column);
+}
+
+int64_t Statement::integer(int column) const {
+  return sqlite3_column_int64(stmt_, column);
+}
+
+std::optional<Transaction> Transaction::begin(Database& db, Error* error) {
+  if (!db.execute("BEGIN IMMEDIATE;", error)) return std::nullopt;
+  return Transaction(&db);
+}
+
+Transaction::~Transaction() {
+  if (db_) (void)db_->execute("ROLLBACK;", nullptr);  // nothing more can be done about a failed rollback
+}
+
+bool Transaction::commit(Error* error) {
+  if (!db_->execute("COMMIT;", error)) return false;  // the destructor rolls back
+  db_ = nullptr;
+  return true;
+}
+
+}  // namespace platform::registry

@@ -1,0 +1,95 @@
+// The registry's SQLite database: an owned connection, prepared statements and
+// transactions, and the schema.
+//
+// Every failure becomes an error record of kRegistryErrorDomain,
+// kRegistryErrorDatabase, whose message names the database file, what was being
+// done and SQLite's own message. Out-parameters are written only on failure.
+//
+// Thread safety: a Database is NOT safe for concurrent use; its owner
+// serialises access (SQLiteApplicationRegistry holds its own lock around
+// every use).
+#pragma once
+
+#include <sqlite3.h>
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Platform/Foundation/Error.h"
+
+namespace platform::registry {
+
+class Statement;
+
+class Database {
+ public:
+  // Opens (creating when needed) the database at `path` in WAL mode with
+  // synchronous=FULL and creates the schema. Null on failure.
+  static std::unique_ptr<Database> open(const std::string& path, Error* error);
+  ~Database();
+  Database(const Database&) = delete;
+  Database& operator=(const Database&) = delete;
+
+  // Runs one or more statements without results.
+  bool execute(const char* sql, Error* error);
+  std::optional<Statement> prepare(const char* sql, Error* error);
+  const std::string& path() const { return path_; }
+  // The record for the connection's last failure while `what`.
+  Error failure(const std::string& what) const;
+
+ private:
+  Database(sqlite3* handle, std::string path) : handle_(handle), path_(std::move(path)) {}
+  friend class Statement;
+  sqlite3* handle_;
+  std::string path_;
+};
+
+// A prepared statement; parameters are bound by position (1-based).
+class Statement {
+ public:
+  Statement(Statement&& other) noexcept : db_(other.db_), stmt_(other.stmt_) { other.stmt_ = nullptr; }
+  Statement& operator=(Statement&&) = delete;
+  Statement(const Statement&) = delete;
+  ~Statement();
+
+  Statement& bind(int index, const std::string& text);
+  Statement& bind(int index, int64_t number);
+  Statement& bind(int index, const std::optional<std::string>& textOrNull);
+
+  // Advances: true with a row, false at the end; on failure false with *error.
+  // `failed` distinguishes the end from a failure.
+  bool step(bool* failed, Error* error);
+  // Runs a statement that returns no rows, then resets it so that it can be
+  // bound and run again.
+  bool run(Error* error);
+
+  std::string text(int column) const;
+  std::optional<std::string> optionalText(int column) const;
+  int64_t integer(int column) const;
+
+ private:
+  friend class Database;
+  Statement(Database* db, sqlite3_stmt* stmt) : db_(db), stmt_(stmt) {}
+  Database* db_;
+  sqlite3_stmt* stmt_;
+};
+
+// BEGIN IMMEDIATE on construction; rolled back on destruction unless
+// committed.
+class Transaction {
+ public:
+  static std::optional<Transaction> begin(Database& db, Error* error);
+  Transaction(Transaction&& other) noexcept : db_(other.db_) { other.db_ = nullptr; }
+  Transaction& operator=(Transaction&&) = delete;
+  Transaction(const Transaction&) = delete;
+  ~Transaction();
+  bool commit(Error* error);
+
+ private:
+  explicit Transaction(Database* db) : db_(db) {}
+  Database* db_;
+};
+
+}  // namespace platform::registry

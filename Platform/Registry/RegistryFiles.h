@@ -1,0 +1,70 @@
+// File-system work of the registry: containers are made, filled, moved and
+// removed here, and every POSIX failure becomes an error record of
+// kRegistryErrorDomain (kRegistryErrorFileOperation) naming the operation and
+// the path, with the POSIX error underneath.
+//
+// Out-parameter contract: `error` is written if and only if the call fails.
+// Thread safety: every function may be called from any thread; none keeps
+// state.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Platform/Foundation/Error.h"
+
+namespace platform::registry {
+
+// The record for a failed POSIX call: kRegistryErrorDomain, `code`, message
+// "<what> <path>: <strerror>", the POSIX error (errnum) underneath.
+Error posixFailure(int64_t code, const std::string& what, const std::string& path, int errnum);
+// A registry error without an underlying error.
+Error registryError(int64_t code, const std::string& message);
+
+bool isDirectory(const std::string& path);
+bool exists(const std::string& path);  // without following a final symbolic link
+
+// Names in a directory, "." and ".." excluded, sorted. Fails when the
+// directory cannot be opened or read.
+std::optional<std::vector<std::string>> listDirectory(const std::string& path, Error* error);
+
+// mkdir -p with mode 0755; an existing directory is success.
+bool makeDirectories(const std::string& path, Error* error);
+// Makes the missing parents of `path` and then `path` itself, which must not
+// exist yet (so that undoing it can never remove something older).
+bool createNewDirectory(const std::string& path, Error* error);
+// Removes the item at `path` and everything under it; nothing there is success.
+bool removeTree(const std::string& path, Error* error);
+// Copies the tree at `source` to `destination` (which must not exist):
+// directories, regular files (with their modes) and symbolic links.
+bool copyTree(const std::string& source, const std::string& destination, Error* error);
+// Renames `source` to `destination`. Only a rename can be undone after a crash,
+// so there is no copying fallback: across file systems this fails (EXDEV).
+bool moveItem(const std::string& source, const std::string& destination, Error* error);
+// Writes `bytes` to a new file at `path` and flushes it.
+bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error);
+// Sets the data-protection class attribute of the directory at `path`.
+bool setProtectionClass(const std::string& path, int32_t protectionClass, Error* error);
+
+// A random UUID in upper-case 8-4-4-4-12 form (version 4).
+std::optional<std::string> newUUID(Error* error);
+
+// An exclusive flock(2) on a lock file, released when the object goes away.
+// Locks taken through distinct objects exclude each other, also inside one
+// process.
+class FileLock {
+ public:
+  // Blocks until the lock is held; none when the lock file cannot be opened.
+  static std::optional<FileLock> acquire(const std::string& path, Error* error);
+  FileLock(FileLock&& other) noexcept : fd_(other.fd_) { other.fd_ = -1; }
+  FileLock& operator=(FileLock&&) = delete;
+  FileLock(const FileLock&) = delete;
+  ~FileLock();
+
+ private:
+  explicit FileLock(int fd) : fd_(fd) {}
+  int fd_;
+};
+
+}  // namespace platform::registry
