@@ -1,0 +1,119 @@
+#include "Platform/RegistryFixture.h"
+
+#include <dirent.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+
+#include "Platform/BundleReader.h"
+
+namespace qstest {
+
+using platform::Dictionary;
+using platform::Value;
+
+std::string infoPlistXML(const BundleSpec& spec) {
+  std::string xml =
+      "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
+      "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" \"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
+      "<plist version=\"1.0\">\n<dict>\n";
+  if (!spec.identifier.empty()) xml += "<key>RkBundleIdentifier</key><string>" + spec.identifier + "</string>\n";
+  if (!spec.version.empty()) xml += "<key>RkBundleVersion</key><string>" + spec.version + "</string>\n";
+  if (!spec.displayName.empty()) xml += "<key>RkBundleDisplayName</key><string>" + spec.displayName + "</string>\n";
+  if (!spec.groups.empty()) {
+    xml += "<key>RkApplicationGroups</key><array>";
+    for (const std::string& group : spec.groups) xml += "<string>" + group + "</string>";
+    xml += "</array>\n";
+  }
+  if (spec.noDataContainer) xml += "<key>RkNoDataContainer</key><true/>\n";
+  xml += "<key>RkBundleExecutable</key><string>main</string>\n</dict>\n</plist>\n";
+  return xml;
+}
+
+std::unique_ptr<platform::SQLiteApplicationRegistry> RegistryTest::openRegistry() {
+  platform::Error error;
+  auto registry = platform::SQLiteApplicationRegistry::open(root(), &error);
+  EXPECT_TRUE(registry) << error.description();
+  return registry;
+}
+
+void RegistryTest::makeBundle(const std::string& path, const BundleSpec& spec) {
+  ASSERT_TRUE(makeDirs(path));
+  ASSERT_TRUE(writeFile(path + "/" + platform::kInfoPlistFileName, infoPlistXML(spec)));
+  ASSERT_TRUE(writeFile(path + "/main", "executable of " + spec.identifier));
+}
+
+std::string RegistryTest::makePackage(const std::string& name, const BundleSpec& app, const BundleSpec& plugin,
+                                      const std::vector<std::string>& metadataFiles) {
+  std::string package = at("packages/" + name);
+  EXPECT_TRUE(makeDirs(package + "/Payload"));
+  if (!app.identifier.empty()) makeBundle(package + "/Payload/App.app", app);
+  if (!plugin.identifier.empty()) makeBundle(package + "/Payload/Tunnel.vpnplugin", plugin);
+  for (const std::string& file : metadataFiles) EXPECT_TRUE(writeFile(package + "/" + file, "metadata " + file));
+  return package;
+}
+
+std::string RegistryTest::makeBuiltIn(const std::string& name, const BundleSpec& spec) {
+  std::string path = at("Applications/" + name);
+  makeBundle(path, spec);
+  return path;
+}
+
+bool RegistryTest::install(platform::SQLiteApplicationRegistry& registry, const std::string& package,
+                           const std::string& identifier, platform::Error* error) {
+  reports_.clear();
+  return registry.installPackage(
+      platform::URL::fileURL(package, true), customerOptions(identifier),
+      [this](const Dictionary& report) { reports_.push_back(report); }, error);
+}
+
+std::vector<std::string> RegistryTest::entries(const std::string& directory) {
+  std::vector<std::string> names;
+  DIR* dir = opendir(directory.c_str());
+  if (!dir) return names;
+  while (const dirent* entry = readdir(dir)) {
+    std::string name = entry->d_name;
+    if (name != "." && name != "..") names.push_back(name);
+  }
+  closedir(dir);
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+bool RegistryTest::isDirectory(const std::string& path) {
+  struct stat st;
+  return stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
+bool RegistryTest::exists(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0;
+}
+
+Dictionary customerOptions(const std::string& identifier) {
+  return Dictionary{{platform::kRegistryInstallTypeKey, Value(6u)},
+                    {platform::kRegistryPackageTypeKey, Value(platform::kRegistryPackageTypeCustomer)},
+                    {"VerifyForMigrator", Value(true)},
+                    {"SkipBlacklist", Value(true)},
+                    {platform::kBundleIdentifierKey, Value(identifier)}};
+}
+
+std::vector<std::string> statuses(const std::vector<Dictionary>& reports) {
+  std::vector<std::string> out;
+  for (const Dictionary& report : reports) {
+    auto it = report.find(platform::kRegistryProgressStatusKey);
+    if (it != report.end() && it->second.asString()) out.push_back(*it->second.asString());
+  }
+  return out;
+}
+
+std::string reportedError(const std::vector<Dictionary>& reports) {
+  std::string name;
+  for (const Dictionary& report : reports) {
+    auto it = report.find(platform::kRegistryProgressErrorKey);
+    if (it != report.end() && it->second.asString()) name = *it->second.asString();
+  }
+  return name;
+}
+
+}  // namespace qstest

@@ -1,0 +1,97 @@
+// A fresh system root per test, with helpers that build bundles, packages and
+// built-in applications in it, and open the registry on it.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "Platform/Registry/SQLiteRegistry.h"
+#include "support/TestSupport.h"
+
+namespace qstest {
+
+// What goes into a test bundle's Info.plist.
+struct BundleSpec {
+  BundleSpec() = default;
+  explicit BundleSpec(std::string id) : identifier(std::move(id)) {}
+  BundleSpec&& withVersion(std::string v) && {
+    version = std::move(v);
+    return std::move(*this);
+  }
+  BundleSpec&& withGroups(std::vector<std::string> g) && {
+    groups = std::move(g);
+    return std::move(*this);
+  }
+  BundleSpec&& withDisplayName(std::string n) && {
+    displayName = std::move(n);
+    return std::move(*this);
+  }
+  BundleSpec&& withoutDataContainer() && {
+    noDataContainer = true;
+    return std::move(*this);
+  }
+
+  std::string identifier;
+  std::string version = "1.0";
+  std::vector<std::string> groups;
+  bool noDataContainer = false;
+  std::string displayName;
+};
+
+// Info.plist text in the XML form.
+std::string infoPlistXML(const BundleSpec& spec);
+
+class RegistryTest : public testing::Test {
+ protected:
+  const std::string& root() const { return root_.path(); }
+  std::string at(const std::string& relative) const { return root_ / relative; }
+
+  // Opens the registry of this test's root, failing the test when it cannot.
+  std::unique_ptr<platform::SQLiteApplicationRegistry> openRegistry();
+
+  // A bundle directory at `path` with an Info.plist and an executable file.
+  void makeBundle(const std::string& path, const BundleSpec& spec);
+  // A package directory "<name>" under the test's "packages" folder:
+  // Payload/<appName> for the application (when `app` has an identifier),
+  // Payload/<pluginName> for the plug-in (when `plugin` has one), and
+  // store-metadata files beside Payload.
+  std::string makePackage(const std::string& name, const BundleSpec& app, const BundleSpec& plugin = {},
+                          const std::vector<std::string>& metadataFiles = {});
+  // A built-in application <root>/Applications/<name>.
+  std::string makeBuiltIn(const std::string& name, const BundleSpec& spec);
+
+  // Installs a package with the migrator's options for `identifier`,
+  // collecting the progress reports.
+  bool install(platform::SQLiteApplicationRegistry& registry, const std::string& package, const std::string& identifier,
+               platform::Error* error = nullptr);
+
+  std::vector<platform::Dictionary> reports_;
+
+  // Paths of the layout.
+  std::string bundleContainers() const { return at("private/var/containers/Bundle/Application"); }
+  std::string appDataContainers() const { return at("private/var/mobile/Containers/Data/Application"); }
+  std::string pluginDataContainers() const { return at("private/var/mobile/Containers/Data/PluginKitPlugin"); }
+  std::string groupContainers() const { return at("private/var/mobile/Containers/Shared/AppGroup"); }
+  std::string databaseDirectory() const { return at("private/var/db/appregistry"); }
+
+  // Entries of a directory (none when it is missing), sorted.
+  static std::vector<std::string> entries(const std::string& directory);
+  static bool isDirectory(const std::string& path);
+  static bool exists(const std::string& path);
+
+ private:
+  TempDir root_{"registry"};
+};
+
+// The install options the migrator passes for a staged application.
+platform::Dictionary customerOptions(const std::string& identifier);
+
+// The Status values of a list of progress reports, in order.
+std::vector<std::string> statuses(const std::vector<platform::Dictionary>& reports);
+// The "Error" value of the last report that has one, or "".
+std::string reportedError(const std::vector<platform::Dictionary>& reports);
+
+}  // namespace qstest

@@ -1,0 +1,264 @@
+// Installing packages: containers, records, groups, VPN plug-ins, refusals and
+// replays.
+#include <thread>
+
+#include "Platform/BundleReader.h"
+#include "Platform/Foundation/Error.h"
+#include "Platform/RegistryFixture.h"
+
+namespace qstest {
+namespace {
+
+using platform::BundleRecord;
+using platform::Error;
+
+using RegistryInstall = RegistryTest;
+
+TEST_F(RegistryInstall, MovesBundleIntoNewContainersAndRemovesPackage) {
+  auto registry = openRegistry();
+  std::string package =
+      makePackage("notes", BundleSpec("com.example.notes").withVersion("1.2").withDisplayName("Notes"), {},
+                  {"VendraMetadata.plist", "Manifest.plist"});
+  std::thread::id caller = std::this_thread::get_id();
+  std::vector<std::thread::id> reporters;
+  Error error;
+  ASSERT_TRUE(registry->installPackage(
+      platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
+      [&](const platform::Dictionary& report) {
+        reports_.push_back(report);
+        reporters.push_back(std::this_thread::get_id());
+      },
+      &error))
+      << error.description();
+
+  EXPECT_EQ(statuses(reports_), (std::vector<std::string>{"VerifyingApplication", "StagingFiles",
+                                                          "RegisteringApplication", "CleaningUp", "Complete"}));
+  for (std::thread::id id : reporters) EXPECT_NE(id, caller) << "reports come from the registry's worker thread";
+  EXPECT_FALSE(exists(package));
+
+  std::optional<BundleRecord> record = registry->recordForIdentifier("com.example.notes");
+  ASSERT_TRUE(record);
+  EXPECT_EQ(record->bundleType, platform::kBundleTypeUser);
+  EXPECT_EQ(record->version, "1.2");
+  EXPECT_EQ(record->displayName, "Notes");
+  EXPECT_FALSE(record->isPlaceholder);
+  EXPECT_TRUE(record->foundBackingBundle);
+  EXPECT_EQ(record->bundleContainerURL.deletingLastPathComponent().path(), bundleContainers());
+  EXPECT_EQ(record->bundleURL.path(), record->bundleContainerURL.path() + "/App.app");
+  EXPECT_EQ(readFile(record->bundleURL.path() + "/main"), "executable of com.example.notes");
+  EXPECT_EQ(readFile(record->bundleContainerURL.path() + "/VendraMetadata.plist"), "metadata VendraMetadata.plist");
+  EXPECT_EQ(readFile(record->bundleContainerURL.path() + "/Manifest.plist"), "metadata Manifest.plist");
+  ASSERT_TRUE(record->dataContainerURL);
+  EXPECT_EQ(record->dataContainerURL->deletingLastPathComponent().path(), appDataContainers());
+  EXPECT_TRUE(isDirectory(record->dataContainerURL->path()));
+  ASSERT_TRUE(record->groupContainerURLs) << "an installed bundle always has a group dictionary";
+  EXPECT_TRUE(record->groupContainerURLs->empty());
+  EXPECT_TRUE(registry->isInstalled("com.example.notes"));
+  EXPECT_FALSE(registry->isInstalled("com.example.other"));
+}
+
+TEST_F(RegistryInstall, ContainerNamesAreRandomUUIDs) {
+  auto registry = openRegistry();
+  ASSERT_TRUE(install(*registry, makePackage("a", BundleSpec("com.example.a")), "com.example.a"));
+  std::string name = registry->recordForIdentifier("com.example.a")->bundleContainerURL.lastPathComponent();
+  ASSERT_EQ(name.size(), 36u) << name;
+  for (size_t i : {8u, 13u, 18u, 23u}) EXPECT_EQ(name[i], '-') << name;
+  EXPECT_EQ(name[14], '4') << "version 4 UUID: " << name;
+  EXPECT_NE(name, registry->recordForIdentifier("com.example.a")->dataContainerURL->lastPathComponent());
+}
+
+TEST_F(RegistryInstall, ReinstallKeepsDataContainerAndRemovesOldBundleContainer) {
+  auto registry = openRegistry();
+  ASSERT_TRUE(
+      install(*registry, makePackage("v1", BundleSpec("com.example.mail").withVersion("1")), "com.example.mail"));
+  BundleRecord first = *registry->recordForIdentifier("com.example.mail");
+  ASSERT_TRUE(writeFile(first.dataContainerURL->path() + "/inbox", "user data"));
+
+  ASSERT_TRUE(
+      install(*registry, makePackage("v2", BundleSpec("com.example.mail").withVersion("2")), "com.example.mail"));
+  BundleRecord second = *registry->recordForIdentifier("com.example.mail");
+  EXPECT_EQ(second.version, "2");
+  EXPECT_EQ(second.dataContainerURL->path(), first.dataContainerURL->path());
+  EXPECT_EQ(readFile(second.dataContainerURL->path() + "/inbox"), "user data");
+  EXPECT_NE(second.bundleContainerURL.path(), first.bundleContainerURL.path());
+  EXPECT_FALSE(exists(first.bundleContainerURL.path()));
+  EXPECT_EQ(entries(bundleContainers()).size(), 1u);
+}
+
+TEST_F(RegistryInstall, GroupContainerIsSharedByApplicationsOfTheGroup) {
+  auto registry = openRegistry();
+  ASSERT_TRUE(install(*registry, makePackage("a", BundleSpec("com.example.a").withGroups({"group.shared", "group.a"})),
+                      "com.example.a"));
+  ASSERT_TRUE(
+      install(*registry, makePackage("b", BundleSpec("com.example.b").withGroups({"group.shared"})), "com.example.b"));
+  auto a = *registry->recordForIdentifier("com.example.a")->groupContainerURLs;
+  auto b = *registry->recordForIdentifier("com.example.b")->groupContainerURLs;
+  ASSERT_EQ(a.size(), 2u);
+  ASSERT_EQ(b.size(), 1u);
+  EXPECT_EQ(b.at("group.shared").path(), a.at("group.shared").path());
+  EXPECT_NE(a.at("group.a").path(), a.at("group.shared").path());
+  EXPECT_TRUE(isDirectory(a.at("group.shared").path()));
+  EXPECT_TRUE(isDirectory(a.at("group.a").path()));
+  EXPECT_EQ(a.at("group.a").deletingLastPathComponent().path(), groupContainers());
+  EXPECT_EQ(entries(groupContainers()).size(), 2u);
+}
+
+TEST_F(RegistryInstall, VPNPluginInTheSamePayloadGetsARecordOfItsOwn) {
+  auto registry = openRegistry();
+  ASSERT_TRUE(install(*registry,
+                      makePackage("vpn", BundleSpec("com.example.vpn"), BundleSpec("com.example.vpn.tunnel")),
+                      "com.example.vpn"));
+  BundleRecord app = *registry->recordForIdentifier("com.example.vpn");
+  std::optional<BundleRecord> plugin = registry->recordForIdentifier("com.example.vpn.tunnel");
+  ASSERT_TRUE(plugin);
+  EXPECT_EQ(app.bundleType, platform::kBundleTypeUser);
+  EXPECT_EQ(plugin->bundleType, platform::kBundleTypeVPNPlugin);
+  EXPECT_EQ(plugin->bundleURL.lastPathComponent(), "Tunnel.vpnplugin");
+  EXPECT_TRUE(isDirectory(plugin->bundleURL.path()));
+  ASSERT_TRUE(plugin->dataContainerURL);
+  EXPECT_EQ(plugin->dataContainerURL->deletingLastPathComponent().path(), pluginDataContainers());
+  EXPECT_NE(plugin->dataContainerURL->path(), app.dataContainerURL->path());
+  EXPECT_TRUE(plugin->groupContainerURLs);
+}
+
+TEST_F(RegistryInstall, PayloadHoldingOnlyAVPNPluginInstallsThePlugin) {
+  auto registry = openRegistry();
+  ASSERT_TRUE(install(*registry, makePackage("tunnel", {}, BundleSpec("com.example.tunnel")), "com.example.tunnel"));
+  std::optional<BundleRecord> plugin = registry->recordForIdentifier("com.example.tunnel");
+  ASSERT_TRUE(plugin);
+  EXPECT_EQ(plugin->bundleType, platform::kBundleTypeVPNPlugin);
+  EXPECT_EQ(plugin->dataContainerURL->deletingLastPathComponent().path(), pluginDataContainers());
+}
+
+TEST_F(RegistryInstall, OlderThanBuiltInIsRefusedAsAlreadyInstalledAndPackageRemoved) {
+  makeBuiltIn("Clock.app", BundleSpec("com.example.clock").withVersion("2.10"));
+  auto registry = openRegistry();
+  std::string package = makePackage("clock", BundleSpec("com.example.clock").withVersion("2.9"));
+  Error error;
+  EXPECT_FALSE(install(*registry, package, "com.example.clock", &error));
+  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorAlreadyInstalled))
+      << error.description();
+  EXPECT_EQ(reportedError(reports_), "ApplicationAlreadyInstalled");
+  EXPECT_FALSE(exists(package));
+  EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeSystem);
+  EXPECT_TRUE(entries(bundleContainers()).empty());
+}
+
+TEST_F(RegistryInstall, EqualToBuiltInIsRefusedAndNewerIsInstalled) {
+  makeBuiltIn("Clock.app", BundleSpec("com.example.clock").withVersion("2.10"));
+  auto registry = openRegistry();
+  EXPECT_FALSE(install(*registry, makePackage("same", BundleSpec("com.example.clock").withVersion("2.10.0")),
+                       "com.example.clock"));
+  EXPECT_EQ(reportedError(reports_), "ApplicationAlreadyInstalled");
+  Error error;
+  ASSERT_TRUE(install(*registry, makePackage("newer", BundleSpec("com.example.clock").withVersion("2.10.1")),
+                      "com.example.clock", &error))
+      << error.description();
+  EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeUser);
+}
+
+// A refusal other than "already installed" leaves the package as it was and
+// makes no container.
+class RegistryRefusal : public RegistryTest {
+ protected:
+  void expectRefused(const std::string& package, const std::string& identifier, int64_t code, const std::string& name) {
+    auto registry = openRegistry();
+    std::vector<std::string> before = entries(package + "/Payload");
+    Error error;
+    EXPECT_FALSE(install(*registry, package, identifier, &error));
+    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, code)) << error.description();
+    EXPECT_FALSE(error.localizedDescription().empty());
+    EXPECT_EQ(reportedError(reports_), name);
+    EXPECT_EQ(statuses(reports_).back(), "Failed");
+    EXPECT_EQ(entries(package + "/Payload"), before);
+    EXPECT_TRUE(entries(bundleContainers()).empty());
+    EXPECT_TRUE(entries(appDataContainers()).empty());
+    EXPECT_FALSE(registry->isInstalled(identifier));
+  }
+};
+
+TEST_F(RegistryRefusal, IdentifierDifferentFromOptions) {
+  std::string package = makePackage("p", BundleSpec("com.example.real"));
+  expectRefused(package, "com.example.claimed", platform::kRegistryErrorIdentifierMismatch, "BundleIdentifierMismatch");
+  EXPECT_TRUE(exists(package + "/Payload/App.app/Info.plist"));
+}
+
+TEST_F(RegistryRefusal, MissingPayload) {
+  ASSERT_TRUE(makeDirs(at("packages/empty")));
+  expectRefused(at("packages/empty"), "com.example.x", platform::kRegistryErrorInvalidPackage, "InvalidPackage");
+  EXPECT_TRUE(isDirectory(at("packages/empty")));
+}
+
+TEST_F(RegistryRefusal, UnreadableInfoPlist) {
+  std::string package = makePackage("p", BundleSpec("com.example.x"));
+  ASSERT_TRUE(writeFile(package + "/Payload/App.app/Info.plist", "<plist><dict><key>RkBundle"));
+  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist");
+}
+
+TEST_F(RegistryRefusal, InfoPlistWhoseRootIsNotADictionary) {
+  std::string package = makePackage("p", BundleSpec("com.example.x"));
+  ASSERT_TRUE(writeFile(package + "/Payload/App.app/Info.plist",
+                        "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>"));
+  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist");
+}
+
+TEST_F(RegistryRefusal, MissingInfoPlist) {
+  std::string package = makePackage("p", BundleSpec("com.example.x"));
+  ASSERT_EQ(unlink((package + "/Payload/App.app/Info.plist").c_str()), 0);
+  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist");
+}
+
+TEST_F(RegistryRefusal, TwoApplicationsInPayload) {
+  std::string package = makePackage("p", BundleSpec("com.example.x"));
+  makeBundle(package + "/Payload/Second.app", BundleSpec("com.example.x"));
+  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidPackage, "InvalidPackage");
+}
+
+TEST_F(RegistryRefusal, PlaceholderPackageType) {
+  std::string package = makePackage("p", BundleSpec("com.example.x"));
+  auto registry = openRegistry();
+  platform::Dictionary options = customerOptions("com.example.x");
+  options[platform::kRegistryPackageTypeKey] = platform::Value(platform::kRegistryPackageTypePlaceholder);
+  Error error;
+  EXPECT_FALSE(registry->installPackage(platform::URL::fileURL(package, true), options, {}, &error));
+  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidOptions)) << error.description();
+  EXPECT_TRUE(exists(package + "/Payload/App.app"));
+}
+
+using RegistryReplay = RegistryTest;
+
+TEST_F(RegistryReplay, InstalledPackageWithEmptiedPayloadSucceedsWithoutChange) {
+  auto registry = openRegistry();
+  std::string package = makePackage("notes", BundleSpec("com.example.notes"));
+  ASSERT_TRUE(install(*registry, package, "com.example.notes"));
+  BundleRecord before = *registry->recordForIdentifier("com.example.notes");
+
+  // An interrupted caller staged again: the bundle has already gone.
+  ASSERT_TRUE(makeDirs(package + "/Payload"));
+  Error error;
+  ASSERT_TRUE(install(*registry, package, "com.example.notes", &error)) << error.description();
+  EXPECT_EQ(statuses(reports_).back(), "AlreadyInstalledFromPackage");
+  EXPECT_FALSE(exists(package));
+  BundleRecord after = *registry->recordForIdentifier("com.example.notes");
+  EXPECT_EQ(after.bundleContainerURL.path(), before.bundleContainerURL.path());
+  EXPECT_TRUE(after.foundBackingBundle);
+
+  // Without a package directory at all it is the same.
+  ASSERT_TRUE(install(*registry, package, "com.example.notes", &error)) << error.description();
+}
+
+TEST_F(RegistryReplay, OtherPackagePathOrIdentifierIsRefused) {
+  auto registry = openRegistry();
+  ASSERT_TRUE(install(*registry, makePackage("notes", BundleSpec("com.example.notes")), "com.example.notes"));
+  ASSERT_TRUE(makeDirs(at("packages/elsewhere/Payload")));
+  Error error;
+  EXPECT_FALSE(install(*registry, at("packages/elsewhere"), "com.example.notes", &error));
+  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage));
+  ASSERT_TRUE(makeDirs(at("packages/notes/Payload")));
+  EXPECT_FALSE(install(*registry, at("packages/notes"), "com.example.other", &error));
+  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage));
+  EXPECT_TRUE(isDirectory(at("packages/notes/Payload")));
+}
+
+}  // namespace
+}  // namespace qstest
