@@ -2,16 +2,27 @@
 // request) of Values through libplist.
 //
 // Reading validates what libplist lets pass: an empty file, a truncated or
-// malformed document, trailing garbage, a missing "</plist>" and an integer
-// element whose text is not a number are errors, never crashes. A UTF-8
-// byte-order mark is accepted. Errors are in kFileErrorDomain (code 260 for a
-// missing file, 256 for any other read failure, with the underlying POSIX
-// error where there is one) and say what was wrong.
+// malformed document, trailing garbage, a missing "</plist>", a dictionary
+// key without a value and an integer element whose text is not a number are
+// errors, never crashes. So are binary documents that would bring libplist
+// down: strings holding a NUL character, nesting deeper than 512 levels and
+// shared objects that expand to millions of values. A UTF-8 byte-order mark
+// is accepted. Errors are in kFileErrorDomain (code 260 for a missing file,
+// 256 for any other read failure, with the underlying POSIX error where there
+// is one, and the path under kFilePathErrorKey) and say what was wrong.
+// Integers up to INT64_MAX read as signed, larger ones as unsigned; a keyed
+// archive's UID reads as the dictionary {"CF$UID" = n}.
 //
 // Writing: with `atomically`, the data goes to a temporary file in the same
-// directory, is flushed to disk and renamed over the target, so the target is
-// either the old file or the new one, whole. Unsigned integers above
-// INT64_MAX are written so that they read back unsigned.
+// directory, is flushed to disk and renamed over the target (which keeps its
+// permissions; a new file gets 0644), and the directory is flushed, so the
+// target is either the old file or the new one, whole; on failure the
+// temporary file is removed. Failures are kFileErrorDomain 512 with the POSIX
+// error of the failed call underneath. Unsigned integers above INT64_MAX are
+// written so that they read back unsigned. Dates must lie within 2^31 seconds
+// of 2001-01-01; the XML form keeps whole seconds only, the binary form
+// microseconds. Text holding a NUL character cannot be written, and the
+// binary form needs well-formed UTF-8 (the XML form keeps any bytes).
 //
 // Thread safety: all functions may be called from any thread.
 #pragma once
@@ -19,6 +30,7 @@
 #include <optional>
 
 #include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/FileErrors.h"
 #include "Platform/Foundation/URL.h"
 #include "Platform/Foundation/Value.h"
 

@@ -4,12 +4,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cmath>
 #include <cstdint>
 #include <limits>
 #include <random>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -219,6 +221,24 @@ TEST(PropertyListFormats, TooDeepNestingIsRefusedBothWays) {
   Error readError;
   EXPECT_FALSE(parseText(text, &readError));
   EXPECT_NE(readError.localizedDescription().find("nesting deeper"), std::string::npos) << readError.description();
+}
+
+TEST(PropertyListThreads, ConcurrentRoundTripsAgree) {
+  const Value original(everyType());
+  std::vector<std::thread> threads;
+  std::atomic<int> failures{0};
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&, t] {
+      const plist::Format format = t % 2 ? plist::Format::Binary : plist::Format::XML;
+      for (int i = 0; i < 100; ++i) {
+        std::optional<Data> bytes = plist::serialize(original, format);
+        std::optional<Value> back = bytes ? plist::parse(bytes->data(), bytes->size()) : std::nullopt;
+        if (!back || *back != original) failures.fetch_add(1);
+      }
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(failures.load(), 0);
 }
 
 // ---- Leniency of libplist that the reader must not inherit ----
