@@ -204,16 +204,21 @@ std::optional<Value> parseBytes(std::string_view bytes, std::string* problem) {
   plist_t raw = nullptr;  // libplist leaves a non-null output untouched
   const auto length = static_cast<uint32_t>(bytes.size());
   const bool binary = bytes.starts_with(kBinaryMagic);
-  std::optional<std::string> found =
-      binary ? detail::checkBinaryPropertyList(bytes) : detail::checkXMLPropertyList(bytes);
-  if (found) {
-    *problem = std::move(*found);
+  detail::XMLCheck check;
+  if (binary) {
+    check.problem = detail::checkBinaryPropertyList(bytes);
+  } else {
+    check = detail::checkXMLPropertyList(bytes);
+  }
+  if (check.problem) {
+    *problem = std::move(*check.problem);
     return std::nullopt;
   }
   if (binary) {
     plist_from_bin(bytes.data(), length, &raw);
   } else {
-    plist_from_xml(bytes.data(), length, &raw);
+    std::string_view text = check.rewritten.empty() ? bytes : std::string_view(check.rewritten);
+    plist_from_xml(text.data(), static_cast<uint32_t>(text.size()), &raw);
   }
   PlistPtr root(raw);
   if (!root) {

@@ -129,16 +129,16 @@ class Checker {
  public:
   explicit Checker(std::string_view text) : s_(text) {}
 
-  std::optional<std::string> run() {
-    if (trim(s_).empty()) return std::string("the document is empty");
+  XMLCheck run() {
+    if (trim(s_).empty()) return {std::string("the document is empty"), {}};
     if (size_t nul = s_.find('\0'); nul != std::string_view::npos) {
-      return "a NUL character (byte " + std::to_string(nul) + ")";
+      return {"a NUL character (byte " + std::to_string(nul) + ")", {}};
     }
     if (skipMisc() && skipDoctype() && skipMisc() && document() && skipMisc()) {
-      if (pos_ == s_.size()) return std::nullopt;
+      if (pos_ == s_.size()) return {std::nullopt, rewritten()};
       fail("content after the end of the property list");
     }
-    return problem_ + " (byte " + std::to_string(problemOffset_) + ")";
+    return {problem_ + " (byte " + std::to_string(problemOffset_) + ")", {}};
   }
 
  private:
@@ -329,10 +329,28 @@ class Checker {
     return fail("unexpected end of the document");
   }
 
-  // The text of a leaf element whose start tag has been read.
-  bool leafText(const Tag& tag, std::string* text) {
+  // The text of a leaf element whose start tag has been read, and the raw
+  // bytes it came from.
+  bool leafText(const Tag& tag, std::string* text, std::string_view* raw = nullptr) {
     if (tag.empty) return true;
-    return readText(text) && expectClosing(tag.name);
+    size_t start = pos_;
+    if (!readText(text)) return false;
+    if (raw) *raw = s_.substr(start, pos_ - start);
+    return expectClosing(tag.name);
+  }
+
+  // libplist reads integers with strtoull's automatic base, so "010" would
+  // be octal 8 and "08" would be 0. A plain decimal with leading zeros is
+  // noted for rewriting without them.
+  void noteLeadingZeros(std::string_view raw) {
+    if (raw.find_first_of("&<") != std::string_view::npos) return;
+    std::string_view content = trim(raw);
+    size_t digits = !content.empty() && (content.front() == '-' || content.front() == '+') ? 1 : 0;
+    size_t first = digits;
+    while (first + 1 < content.size() && content[first] == '0' && isDigit(content[first + 1])) ++first;
+    if (first == digits) return;
+    size_t offset = static_cast<size_t>(content.data() - s_.data());
+    edits_.push_back({offset, content.size(), std::string(content.substr(0, digits)) + std::string(content.substr(first))});
   }
 
   bool document() {
@@ -367,7 +385,8 @@ class Checker {
     if (name != "integer" && name != "real" && name != "date" && name != "data") {
       return fail("unknown element <" + std::string(name) + ">");
     }
-    if (!leafText(tag, &text)) return false;
+    std::string_view raw;
+    if (!leafText(tag, &text, &raw)) return false;
     std::string_view content = trim(text);
     bool valid = name == "integer" ? isIntegerText(content)
                  : name == "real"  ? isRealText(content)
@@ -378,6 +397,7 @@ class Checker {
       return fail(std::string(name) + " element holds \"" + std::string(content.substr(0, kQuotedTextLimit)) +
                   "\", which is not valid");
     }
+    if (name == "integer") noteLeadingZeros(raw);
     return true;
   }
 
@@ -414,15 +434,37 @@ class Checker {
     }
   }
 
+  // The document with the noted edits applied, or "" when there are none.
+  std::string rewritten() const {
+    std::string out;
+    if (edits_.empty()) return out;
+    size_t copied = 0;
+    for (const Edit& edit : edits_) {
+      out.append(s_.substr(copied, edit.offset - copied));
+      out.append(edit.replacement);
+      copied = edit.offset + edit.length;
+    }
+    out.append(s_.substr(copied));
+    return out;
+  }
+
+  // A replacement of document bytes; edits are noted in document order.
+  struct Edit {
+    size_t offset;
+    size_t length;
+    std::string replacement;
+  };
+
   std::string_view s_;
   size_t pos_ = 0;
   std::string problem_;
   size_t problemOffset_ = 0;
+  std::vector<Edit> edits_;
 };
 
 }  // namespace
 
-std::optional<std::string> checkXMLPropertyList(std::string_view text) { return Checker(text).run(); }
+XMLCheck checkXMLPropertyList(std::string_view text) { return Checker(text).run(); }
 
 namespace {
 

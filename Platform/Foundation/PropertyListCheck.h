@@ -34,10 +34,20 @@ inline constexpr int kMaxNestingDepth = 512;
 // read once per reference.
 inline constexpr uint64_t kMaxExpandedObjects = uint64_t{1} << 22;
 
-// Checks `text` (without a byte-order mark). Returns none when the document is
-// a well-formed property list, otherwise what is wrong and where ("integer
-// element holds \"abc\", not a number (byte 120)").
-std::optional<std::string> checkXMLPropertyList(std::string_view text);
+struct XMLCheck {
+  // None when the document is a well-formed property list, otherwise what is
+  // wrong and where ("integer element holds \"abc\", which is not valid
+  // (byte 120)").
+  std::optional<std::string> problem;
+  // The text libplist is to read when it differs from the document: decimal
+  // integers written with leading zeros, which libplist would take for octal
+  // ("010" as 8, "08" as 0), rewritten without them. Empty when the document
+  // itself will do.
+  std::string rewritten;
+};
+
+// Checks `text` (without a byte-order mark).
+XMLCheck checkXMLPropertyList(std::string_view text);
 
 // Checks a binary ("bplist00") document for strings that hold a NUL
 // character, for containers that contain themselves, nesting deeper than

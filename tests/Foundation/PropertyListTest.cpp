@@ -329,6 +329,15 @@ TEST(PropertyListValidForms, AreReadWithTheirValues) {
        Value(Array{Value(""), Value(Dictionary{}), Value(Array{}), Value(Data{}), Value(true)})},
       {kHeader + "<plist version=\"1>0\" ><integer> 42 </integer></plist >", Value(42)},
       {kHeader + "<plist><integer>0x10</integer></plist>", Value(16)},
+      {kHeader + "<plist><integer>0x0F</integer></plist>", Value(15)},
+      // Leading zeros are decimal, not octal.
+      {kHeader + "<plist><array><integer>010</integer><integer>-007</integer><integer>08</integer>"
+                 "<integer>00</integer><integer> +09 </integer><integer>0</integer><string>010</string></array>"
+                 "</plist>",
+       Value(Array{Value(10), Value(-7), Value(8), Value(0), Value(9), Value(0), Value("010")})},
+      {kHeader + "<plist><dict><key>a</key><integer>0010</integer><key>b</key><string>x</string>"
+                 "<key>c</key><integer>\n0009\n</integer></dict></plist>",
+       Value(Dictionary{{"a", Value(10)}, {"b", Value("x")}, {"c", Value(9)}})},
       {kHeader + "<plist><integer>-9223372036854775808</integer></plist>", Value(INT64_MIN)},
       {kHeader + "<plist><real>-1.5e3</real></plist>", Value(-1500.0)},
       {kHeader + "<plist><real>+infinity</real></plist>", Value(std::numeric_limits<double>::infinity())},
