@@ -190,6 +190,14 @@ class NodeReader {
   std::string problem_;
 };
 
+// Runs one of libplist's readers on `text` (at most 4 GiB); null when it
+// refuses the text.
+PlistPtr libplistRead(std::string_view text, void (*reader)(const char*, uint32_t, plist_t*)) {
+  plist_t raw = nullptr;  // libplist leaves a non-null output untouched
+  reader(text.data(), static_cast<uint32_t>(text.size()), &raw);
+  return PlistPtr(raw);
+}
+
 // Parses `bytes`; on failure returns none and says why in *problem.
 std::optional<Value> parseBytes(std::string_view bytes, std::string* problem) {
   if (bytes.starts_with(kUTF8ByteOrderMark)) bytes.remove_prefix(kUTF8ByteOrderMark.size());
@@ -201,8 +209,6 @@ std::optional<Value> parseBytes(std::string_view bytes, std::string* problem) {
     *problem = "the document is larger than 4 GiB";
     return std::nullopt;
   }
-  plist_t raw = nullptr;  // libplist leaves a non-null output untouched
-  const auto length = static_cast<uint32_t>(bytes.size());
   const bool binary = bytes.starts_with(kBinaryMagic);
   detail::XMLCheck check;
   if (binary) {
@@ -214,13 +220,8 @@ std::optional<Value> parseBytes(std::string_view bytes, std::string* problem) {
     *problem = std::move(*check.problem);
     return std::nullopt;
   }
-  if (binary) {
-    plist_from_bin(bytes.data(), length, &raw);
-  } else {
-    std::string_view text = check.rewritten.empty() ? bytes : std::string_view(check.rewritten);
-    plist_from_xml(text.data(), static_cast<uint32_t>(text.size()), &raw);
-  }
-  PlistPtr root(raw);
+  PlistPtr root = binary ? libplistRead(bytes, plist_from_bin)
+                         : libplistRead(check.rewritten.empty() ? bytes : check.rewritten, plist_from_xml);
   if (!root) {
     *problem = binary ? "malformed binary property list" : "malformed XML property list";
     return std::nullopt;
@@ -337,6 +338,17 @@ class NodeWriter {
   std::string problem_;
 };
 
+// Runs one of libplist's writers on `root`; none when it produces nothing.
+template <class Free>
+std::optional<Data> libplistWrite(plist_t root, void (*writer)(plist_t, char**, uint32_t*)) {
+  char* raw = nullptr;  // libplist leaves a non-null output untouched
+  uint32_t length = 0;
+  writer(root, &raw, &length);
+  std::unique_ptr<char, Free> buffer(raw);
+  if (!buffer) return std::nullopt;
+  return Data(buffer.get(), buffer.get() + length);
+}
+
 // Serialises `value`; on failure returns none and says why in *problem.
 std::optional<Data> serializeValue(const Value& value, Format format, std::string* problem) {
   NodeWriter writer(format);
@@ -345,22 +357,9 @@ std::optional<Data> serializeValue(const Value& value, Format format, std::strin
     *problem = writer.problem();
     return std::nullopt;
   }
-  char* raw = nullptr;  // libplist leaves a non-null output untouched
-  uint32_t length = 0;
-  Data out;
-  if (format == Format::XML) {
-    plist_to_xml(root.get(), &raw, &length);
-    std::unique_ptr<char, XMLFree> buffer(raw);
-    if (buffer) out.assign(buffer.get(), buffer.get() + length);
-  } else {
-    plist_to_bin(root.get(), &raw, &length);
-    std::unique_ptr<char, BinaryFree> buffer(raw);
-    if (buffer) out.assign(buffer.get(), buffer.get() + length);
-  }
-  if (!raw) {
-    *problem = "libplist could not produce the " + std::string(formatName(format)) + " form";
-    return std::nullopt;
-  }
+  std::optional<Data> out = format == Format::XML ? libplistWrite<XMLFree>(root.get(), plist_to_xml)
+                                                  : libplistWrite<BinaryFree>(root.get(), plist_to_bin);
+  if (!out) *problem = "libplist could not produce the " + std::string(formatName(format)) + " form";
   return out;
 }
 

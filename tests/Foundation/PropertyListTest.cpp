@@ -184,6 +184,22 @@ TEST(PropertyListFormats, NonUTF8StringSurvivesXMLAndIsRefusedForBinary) {
   EXPECT_NE(error.localizedDescription().find("not UTF-8"), std::string::npos) << error.description();
 }
 
+TEST(PropertyListFormats, BinaryFormAcceptsOnlyWellFormedUTF8) {
+  const std::string refused[] = {"\xC0\xAF", "\xED\xA0\x80", "\xE2\x82", "\xF4\x90\x80\x80", "\x80", "\xF8\x88\x80\x80\x80"};
+  for (const std::string& text : refused) {
+    EXPECT_FALSE(plist::serialize(Value(text), plist::Format::Binary)) << testing::PrintToString(text);
+    EXPECT_FALSE(plist::serialize(Value(Dictionary{{text, Value(1)}}), plist::Format::Binary));
+  }
+  const std::string accepted[] = {"\xC2\xA9", "\xE2\x82\xAC", "\xF4\x8F\xBF\xBF", "\x7F", ""};
+  for (const std::string& text : accepted) {
+    std::optional<Data> bytes = plist::serialize(Value(Dictionary{{text, Value(text)}}), plist::Format::Binary);
+    ASSERT_TRUE(bytes) << testing::PrintToString(text);
+    std::optional<Value> back = plist::parse(bytes->data(), bytes->size());
+    ASSERT_TRUE(back);
+    EXPECT_EQ(*back, Value(Dictionary{{text, Value(text)}}));
+  }
+}
+
 TEST(PropertyListFormats, UnwritableValuesAreRefused) {
   struct Case {
     Value value;
