@@ -99,11 +99,22 @@ class QSFileManager {
                                          platform::Error* error = nullptr) const;
 
   // --- Tree walk, ownership, symbolic links -----------------------------------
+  // Hands every entry of the tree at `root` to `withBlock` (directories before
+  // and after their contents), never following a link and never leaving the
+  // root's file system. Stops at the first entry the walk cannot stat (POSIX
+  // record) or the step refuses (the step's record, if it wrote one). Nothing
+  // is logged. A missing step only visits.
   bool _traverseDirectory(const platform::URL& root, platform::Error* error, const QSTraversalBlock& withBlock) const;
+  // Gives every item of the tree `toUID`:`GID`, directories mode 0755 and the
+  // rest 0644 (a link's own mode is left as it is: Linux cannot change it).
+  // Items that cannot be changed are logged and passed over; with
+  // `validateSymlinks`, a link that leads outside the tree stops the walk with
+  // code 70. Changes made before a failure stay.
   bool standardizeOwnershipAtURL(const platform::URL& url, uint32_t toUID, uint32_t GID, bool validateSymlinks,
                                  platform::Error* error = nullptr) const;
   bool createSymbolicLinkAtURL(const platform::URL& url, const platform::URL& withDestinationURL,
                                platform::Error* error = nullptr) const;
+  // The link's text (at most 1024 bytes) as an unresolved URL.
   std::optional<platform::URL> destinationOfSymbolicLinkAtURL(const platform::URL& url,
                                                               platform::Error* error = nullptr) const;
 
@@ -118,6 +129,11 @@ class QSFileManager {
   bool _validateSymlink(const std::string* path, uint32_t withStartingDepth, uint32_t* andEndingDepth) const;
 
   // --- Data-protection classes and extended attributes ------------------------
+  // Classes are read and set through a descriptor opened without following a
+  // link (a link at the path fails the open). Attribute calls work on the item
+  // at the path itself; attribute write and read failures are logged records
+  // of code 4 with the POSIX error underneath. A missing install type reads 0;
+  // bundleAtURLIsPlaceholder never fails and never logs.
   bool dataProtectionClassOfItemAtURL(const platform::URL& url, int32_t* dataProtectionClass,
                                       platform::Error* error = nullptr) const;
   bool setDataProtectionClassOfItemAtURL(const platform::URL& url, int32_t toClass,
@@ -131,6 +147,9 @@ class QSFileManager {
                                                       platform::Error* error = nullptr) const;
 
   // --- Store data ----------------------------------------------------------------
+  // Copies or moves the four store items (those present) from `source` into
+  // the existing `toDirectory`. Each failure is logged (code 24, keyed by the
+  // item); it ends the capture only when `failureIsFatal`. Nothing is undone.
   bool captureStoreDataFromDirectory(const platform::URL& source, const platform::URL& toDirectory, bool doCopy,
                                      bool failureIsFatal, platform::Error* withError = nullptr) const;
 

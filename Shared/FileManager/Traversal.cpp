@@ -113,7 +113,8 @@ bool QSFileManager::_traverseDirectory(const URL& root, Error* error, const QSTr
     entry.errorNumber = ent->fts_errno;
     if (ent->fts_statp) entry.status = *ent->fts_statp;
     Error stepError;
-    if (!withBlock(entry, &stepError)) {
+    // A walk without a step only visits.
+    if (withBlock && !withBlock(entry, &stepError)) {
       if (stepWroteError(stepError)) failure = std::move(stepError);
       stopped = true;
       break;

@@ -131,6 +131,14 @@ TEST_F(TraversalWalk, RefusingStepWithoutAnErrorLeavesTheOutParameterAlone) {
   EXPECT_TRUE(error.is("Untouched", 1));
 }
 
+TEST_F(TraversalWalk, WalkWithoutAStepOnlyVisits) {
+  ASSERT_TRUE(qstest::makeDirs(root_ + "/a/b"));
+  EXPECT_TRUE(fm_._traverseDirectory(rootURL(), nullptr, QSTraversalBlock()));
+  Error error;
+  EXPECT_FALSE(fm_._traverseDirectory(URL::fileURL(tmp_ / "absent", true), &error, QSTraversalBlock()));
+  EXPECT_TRUE(error.isPOSIX(ENOENT));
+}
+
 TEST_F(TraversalWalk, MissingRootIsAnErrorEntry) {
   std::string missing = tmp_ / "absent";
   Error error;
