@@ -334,10 +334,11 @@ bool readPackage(const std::string& package, PackageContents* contents, bool* no
   for (const std::string& name : *names) {
     std::string extension = extensionOf(name);
     std::string item = path::join(payload, name);
-    if (extension == kApplicationExtension && isDirectory(item)) {
+    // A symbolic link is no bundle: moving it would install the link.
+    if (extension == kApplicationExtension && isDirectoryNoFollow(item)) {
       ++applications;
       contents->application = item;
-    } else if (extension == kVPNPluginExtension && isDirectory(item)) {
+    } else if (extension == kVPNPluginExtension && isDirectoryNoFollow(item)) {
       ++plugins;
       contents->plugin = item;
     }
@@ -364,6 +365,12 @@ bool requireInfoIdentifier(const BundleInfo& info, const std::string& bundle, Er
   if (!info.identifier.empty()) return true;
   return failWith(error, kRegistryErrorInvalidInfoPlist,
                   Format("Info.plist of %s has no %s", bundle, kBundleIdentifierKey));
+}
+
+// Relative locations would depend on the working directory of whoever calls.
+bool requireAbsolute(const std::string& location, Error* error) {
+  if (!location.empty() && location.front() == '/') return true;
+  return failWith(error, kRegistryErrorInvalidPackage, Format("Location \"%s\" is not an absolute path", location));
 }
 
 // Reads a bundle's Info.plist and requires an identifier.
@@ -434,7 +441,8 @@ bool installPackageLocked(RegistryState& state, const std::string& package, cons
                           const Reporter& reporter, Error* error) {
   std::string packageType;
   std::optional<std::string> identifier;
-  if (!optionPackageType(options, {kRegistryPackageTypeCustomer}, &packageType, error) ||
+  if (!requireAbsolute(package, error) ||
+      !optionPackageType(options, {kRegistryPackageTypeCustomer}, &packageType, error) ||
       !optionIdentifier(options, &identifier, error)) {
     return false;
   }
@@ -507,7 +515,8 @@ bool requireReplaceableByPlaceholder(RegistryState& state, const std::string& id
 bool installBundleLocked(RegistryState& state, const std::string& bundle, const Dictionary& options, Error* error) {
   std::string packageType;
   std::optional<std::string> identifier;
-  if (!optionPackageType(options, {kRegistryPackageTypeCustomer, kRegistryPackageTypePlaceholder}, &packageType,
+  if (!requireAbsolute(bundle, error) ||
+      !optionPackageType(options, {kRegistryPackageTypeCustomer, kRegistryPackageTypePlaceholder}, &packageType,
                          error) ||
       !optionIdentifier(options, &identifier, error)) {
     return false;

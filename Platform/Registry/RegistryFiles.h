@@ -23,6 +23,8 @@ Error posixFailure(int64_t code, const std::string& what, const std::string& pat
 Error registryError(int64_t code, const std::string& message);
 
 bool isDirectory(const std::string& path);
+// A directory itself, not a symbolic link to one.
+bool isDirectoryNoFollow(const std::string& path);
 bool exists(const std::string& path);  // without following a final symbolic link
 
 // Names in a directory, "." and ".." excluded, sorted. Fails when the

@@ -1,5 +1,7 @@
 // Installing packages: containers, records, groups, VPN plug-ins, refusals and
 // replays.
+#include <unistd.h>
+
 #include <thread>
 
 #include "Platform/BundleReader.h"
@@ -212,6 +214,24 @@ TEST_F(RegistryRefusal, TwoApplicationsInPayload) {
   std::string package = makePackage("p", BundleSpec("com.example.x"));
   makeBundle(package + "/Payload/Second.app", BundleSpec("com.example.x"));
   expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidPackage, "InvalidPackage");
+}
+
+TEST_F(RegistryRefusal, SymbolicLinkToABundleInPayload) {
+  makeBundle(at("elsewhere/Real.app"), BundleSpec("com.example.x"));
+  ASSERT_TRUE(makeDirs(at("packages/p/Payload")));
+  ASSERT_EQ(symlink(at("elsewhere/Real.app").c_str(), at("packages/p/Payload/App.app").c_str()), 0);
+  expectRefused(at("packages/p"), "com.example.x", platform::kRegistryErrorInvalidPackage, "InvalidPackage");
+  EXPECT_TRUE(exists(at("elsewhere/Real.app/Info.plist")));
+}
+
+TEST_F(RegistryRefusal, RelativeLocations) {
+  auto registry = openRegistry();
+  Error error;
+  EXPECT_FALSE(registry->installPackage(platform::URL::fileURL("packages/p", true), customerOptions("com.example.x"),
+                                        {}, &error));
+  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage)) << error.description();
+  EXPECT_FALSE(registry->installBundle(platform::URL(), {}, &error));
+  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage)) << error.description();
 }
 
 TEST_F(RegistryRefusal, PlaceholderPackageType) {
