@@ -4,7 +4,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -114,21 +116,76 @@ bool syncDirectory(const std::string& directory) {
   return ::fsync(dir.get()) == 0 || errno == EINVAL;
 }
 
-bool writeAtomically(const Data& data, const URL& url, Error* error) {
+// Fills `fd` with the data and the target's permissions and flushes it.
+bool fillAndFlush(int fd, const Data& data, const URL& url, const std::string& shownPath, Error* error) {
+  if (!writeAll(fd, data)) return writeFailure(error, url, "write", shownPath);
+  if (::fchmod(fd, modeForReplacing(url.path())) != 0) return writeFailure(error, url, "fchmod", shownPath);
+  if (::fsync(fd) != 0) return writeFailure(error, url, "fsync", shownPath);
+  return true;
+}
+
+// The portable way: a named temporary file, renamed over the target. A
+// process killed before the rename leaves the temporary file behind.
+bool writeThroughNamedTempFile(const Data& data, const URL& url, Error* error) {
   std::string tmpl = tempTemplateFor(url);
   UniqueFd fd(::mkostemp(tmpl.data(), O_CLOEXEC));
   if (!fd.valid()) return writeFailure(error, url, "mkstemp", tmpl);
   TempFileGuard temp(tmpl);
 
-  if (!writeAll(fd.get(), data)) return writeFailure(error, url, "write", temp.path());
-  if (::fchmod(fd.get(), modeForReplacing(url.path())) != 0) return writeFailure(error, url, "fchmod", temp.path());
-  if (::fsync(fd.get()) != 0) return writeFailure(error, url, "fsync", temp.path());
+  if (!fillAndFlush(fd.get(), data, url, temp.path(), error)) return false;
   if (!fd.close()) return writeFailure(error, url, "close", temp.path());
   if (::rename(temp.path().c_str(), url.fileSystemRepresentation()) != 0) {
     return writeFailure(error, url, "rename", url.path());
   }
   temp.keep();
   const std::string directory = url.deletingLastPathComponent().path();
+  if (!syncDirectory(directory)) return writeFailure(error, url, "fsync", directory);
+  return true;
+}
+
+// A fresh name for the temporary link of a replacing write.
+std::string uniqueTempName(const URL& url) {
+  static std::atomic<uint64_t> counter{0};
+  std::string name = tempTemplateFor(url);
+  name.resize(name.size() - (sizeof kTempSuffix - 2));
+  return name + std::to_string(::getpid()) + "-" + std::to_string(counter.fetch_add(1));
+}
+
+// The data goes into an unnamed file in the target's directory (O_TMPFILE),
+// which vanishes by itself if the process dies before it is done. It is
+// linked in place when the target does not exist yet; otherwise it gets a
+// unique name only for the instant between the link and the rename over the
+// target. So a process killed while writing leaves no temporary file beside
+// the target (a stray file in an application container would otherwise count
+// as a missed item for ever). Falls back to a named temporary file where
+// unnamed files or /proc are not available.
+bool writeAtomically(const Data& data, const URL& url, Error* error) {
+  const std::string directory = url.deletingLastPathComponent().path();
+  UniqueFd fd(::open(directory.c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, kNewFileMode));
+  if (!fd.valid()) {
+    if (errno == EOPNOTSUPP || errno == EISDIR) return writeThroughNamedTempFile(data, url, error);
+    return writeFailure(error, url, "open", directory);
+  }
+  if (!fillAndFlush(fd.get(), data, url, directory, error)) return false;
+  const std::string procPath = "/proc/self/fd/" + std::to_string(fd.get());
+  auto linkTo = [&](const std::string& path) {
+    return ::linkat(AT_FDCWD, procPath.c_str(), AT_FDCWD, path.c_str(), AT_SYMLINK_FOLLOW) == 0;
+  };
+  if (!linkTo(url.path())) {
+    if (errno == ENOENT) return writeThroughNamedTempFile(data, url, error);  // no /proc
+    if (errno != EEXIST) return writeFailure(error, url, "linkat", url.path());
+    std::string tempPath = uniqueTempName(url);
+    while (!linkTo(tempPath)) {
+      if (errno != EEXIST) return writeFailure(error, url, "linkat", tempPath);
+      tempPath = uniqueTempName(url);
+    }
+    TempFileGuard temp(tempPath);
+    if (::rename(temp.path().c_str(), url.fileSystemRepresentation()) != 0) {
+      return writeFailure(error, url, "rename", url.path());
+    }
+    temp.keep();
+  }
+  if (!fd.close()) return writeFailure(error, url, "close", directory);
   if (!syncDirectory(directory)) return writeFailure(error, url, "fsync", directory);
   return true;
 }
