@@ -10,8 +10,13 @@
 //   private/var/mobile/Containers/Data/Application/<UUID>/      data containers of applications
 //   private/var/mobile/Containers/Data/PluginKitPlugin/<UUID>/  data containers of VPN plug-ins
 //   private/var/mobile/Containers/Shared/AppGroup/<UUID>/       group containers, one per group identifier
-//   Applications/*.app                               built-in applications (read only)
+//   Applications/*.app                               built-in applications (read only); their
+//                                                   records name Applications/ as bundle container
 // UUIDs are random (getrandom), upper-case, 8-4-4-4-12.
+//
+// Built-in applications are found by reading Applications/ again whenever its
+// modification time changes; their data and group containers are made on
+// their first lookup (allRecords and the data-protection update look up).
 //
 // Installation (installPackage) runs on a worker thread that delivers every
 // progress report; the call joins it before returning. A package is its
@@ -25,8 +30,12 @@
 // bundle succeeds without change, so that an interrupted caller can finish.
 //
 // Thread safety: every operation may be called from any thread; each opens
-// its statements on a connection guarded by the object's own lock. Several
-// processes may open the same registry; SQLite serialises their changes.
+// its statements on a connection guarded by the object's own lock, which is
+// never held while files move, so lookups go on during an installation and
+// see the records as before or after it. Installations (through this object,
+// others of the same root, or other processes) run one at a time under the
+// install lock; open() waits for a running one to end. A progress callback
+// may look records up, but must not install through the same registry.
 // Crash safety: each change is one transaction, and the file-system part of a
 // change is journalled so that a process killed at any instant leaves the
 // registry as before or after the change (recovered on the next open).
@@ -82,7 +91,9 @@ struct SafeHarborRecord {
 class SQLiteApplicationRegistry final : public ApplicationRegistry, public InstallationDaemonClient {
  public:
   // Opens (creating when needed) the registry of the system under
-  // `systemRoot` ("" for "/"). Null with *error on failure.
+  // `systemRoot` ("" for "/") and undoes what an interrupted installation
+  // left. Null with *error (kRegistryErrorDatabase) when the database cannot
+  // be created, opened or written.
   static std::unique_ptr<SQLiteApplicationRegistry> open(const std::string& systemRoot, Error* error = nullptr);
   ~SQLiteApplicationRegistry() override;
 
@@ -97,7 +108,9 @@ class SQLiteApplicationRegistry final : public ApplicationRegistry, public Insta
   bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const Dictionary& options) override;
 
   // Inspection (tools and tests): every record, built-in applications
-  // included, ordered by identifier; every registered safe harbor.
+  // included, ordered by identifier; every registered safe harbor, ordered by
+  // identifier. A database that cannot be read gives what could be read,
+  // and a level-3 system log line.
   std::vector<BundleRecord> allRecords();
   std::vector<SafeHarborRecord> safeHarbors();
 
