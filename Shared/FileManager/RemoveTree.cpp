@@ -64,7 +64,6 @@ class TreeRemover {
   int run(const char* root) {
     struct stat status {};
     if (fstatat(AT_FDCWD, root, &status, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-    path_ = root;
     removeEntry(AT_FDCWD, root, S_ISDIR(status.st_mode) ? DT_DIR : DT_UNKNOWN);
     while (!frames_.empty() && stopError_ == 0) step();
     return stopError_;
@@ -139,7 +138,12 @@ class TreeRemover {
     frame.inode = status.st_ino;
     frame.fd = std::move(fd);
     frame.name = name;
-    path_ = childPath(name);
+    if (frames_.empty()) {
+      path_ = name;
+    } else {
+      path_ += kPathSeparator;
+      path_ += name;
+    }
     frame.pathLength = path_.size();
     frames_.push_back(std::move(frame));
     if (frames_.size() > kMaxOpenDirectories) frames_[frames_.size() - 1 - kMaxOpenDirectories].fd.reset();
