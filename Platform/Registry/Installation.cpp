@@ -89,6 +89,11 @@ std::string lastComponent(const std::string& path) {
   return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
+std::string parentOf(const std::string& path) {
+  size_t slash = path.find_last_of('/');
+  return slash == std::string::npos || slash == 0 ? std::string("/") : path.substr(0, slash);
+}
+
 // A bundle to install and where it goes.
 struct BundlePlan {
   std::string source;
@@ -124,6 +129,7 @@ class Installation {
   bool planGroups(BundlePlan* plan, Error* error);
   void planCreation(const std::string& path);
   bool takeFileActions(Error* error);
+  bool syncTouchedDirectories(Error* error) const;
   bool commit(Error* error);
   void rollBack();
   void cleanUp();
@@ -252,8 +258,23 @@ bool Installation::takeFileActions(Error* error) {
       if (!copyTree(plan.source, plan.bundlePath, error)) return false;
     }
   }
-  if (storeMetadata_) {
-    return writeNewFile(path::join(bundles_.front().container, kStoreMetadataFileName), *storeMetadata_, error);
+  if (storeMetadata_ &&
+      !writeNewFile(path::join(bundles_.front().container, kStoreMetadataFileName), *storeMetadata_, error)) {
+    return false;
+  }
+  return syncTouchedDirectories(error);
+}
+
+// The commit must not become durable before the file actions it records.
+bool Installation::syncTouchedDirectories(Error* error) const {
+  std::set<std::string> directories;
+  for (const JournalEntry& entry : journal_) {
+    directories.insert(parentOf(entry.destination));
+    if (entry.kind == JournalKind::Move) directories.insert(parentOf(entry.source));
+  }
+  for (const BundlePlan& plan : bundles_) directories.insert(plan.container);
+  for (const std::string& directory : directories) {
+    if (!syncDirectory(directory, error)) return false;
   }
   return true;
 }

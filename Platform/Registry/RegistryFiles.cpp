@@ -231,6 +231,12 @@ bool moveItem(const std::string& source, const std::string& destination, Error* 
          fail(error, "rename", source + " to " + destination, errno);
 }
 
+bool syncDirectory(const std::string& path, Error* error) {
+  Descriptor fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!fd.valid()) return fail(error, "open", path, errno);
+  return fsync(fd.get()) == 0 || fail(error, "fsync", path, errno);
+}
+
 bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error) {
   Descriptor fd(open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kFileMode));
   if (!fd.valid()) return fail(error, "create", path, errno);

@@ -44,6 +44,9 @@ bool copyTree(const std::string& source, const std::string& destination, Error* 
 // Renames `source` to `destination`. Only a rename can be undone after a crash,
 // so there is no copying fallback: across file systems this fails (EXDEV).
 bool moveItem(const std::string& source, const std::string& destination, Error* error);
+// Flushes a directory's entries (fsync on the directory), so that the renames
+// and creations in it survive a power loss.
+bool syncDirectory(const std::string& path, Error* error);
 // Writes `bytes` to a new file at `path` and flushes it.
 bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error);
 // Sets the data-protection class attribute of the directory at `path`.
