@@ -2,18 +2,10 @@
 
 #include <sys/stat.h>
 
+#include "Platform/Foundation/URL.h"
 #include "Platform/Registry/RegistryFiles.h"
 
 namespace platform::registry {
-
-namespace {
-constexpr char kApplicationExtension[] = ".app";
-
-bool hasApplicationExtension(const std::string& name) {
-  constexpr size_t length = sizeof kApplicationExtension - 1;
-  return name.size() > length && name.compare(name.size() - length, length, kApplicationExtension) == 0;
-}
-}  // namespace
 
 std::optional<BuiltInApplication> BuiltInApplications::find(const std::string& identifier) {
   std::lock_guard lock(mutex_);
@@ -43,8 +35,8 @@ void BuiltInApplications::refreshLocked() {
   byIdentifier_.clear();
   std::optional<std::vector<std::string>> names = listDirectory(directory_, nullptr);
   for (const std::string& name : names.value_or(std::vector<std::string>())) {
-    if (!hasApplicationExtension(name)) continue;
-    std::string bundlePath = directory_ + "/" + name;
+    std::string bundlePath = path::join(directory_, name);
+    if (URL::fileURL(bundlePath).pathExtension() != kApplicationBundleExtension) continue;
     // A bundle without a readable Info.plist is no application the registry
     // can report.
     std::optional<BundleInfo> info = readBundleInfo(bundlePath, nullptr);

@@ -13,6 +13,10 @@
 
 namespace platform::registry {
 
+// Path extensions of the bundles the registry installs.
+inline constexpr char kApplicationBundleExtension[] = "app";
+inline constexpr char kVPNPluginBundleExtension[] = "vpnplugin";
+
 struct BundleInfo {
   std::string identifier;
   std::string version;              // RkBundleVersion, "" when absent

@@ -17,8 +17,6 @@ constexpr char kInstallPackageFunction[] = "SQLiteApplicationRegistry::installPa
 constexpr char kInstallBundleFunction[] = "SQLiteApplicationRegistry::installBundle";
 
 constexpr char kPayloadDirectoryName[] = "Payload";
-constexpr char kApplicationExtension[] = "app";
-constexpr char kVPNPluginExtension[] = "vpnplugin";
 // A placeholder's store metadata, kept beside its bundle.
 constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
 
@@ -79,19 +77,12 @@ bool failWith(Error* error, int64_t code, const std::string& message) {
   return false;
 }
 
-std::string extensionOf(const std::string& name) {
-  size_t dot = name.find_last_of('.');
-  return (dot == std::string::npos || dot == 0) ? std::string() : name.substr(dot + 1);
-}
-
 std::string lastComponent(const std::string& path) {
-  size_t slash = path.find_last_of('/');
-  return slash == std::string::npos ? path : path.substr(slash + 1);
+  return URL::fileURL(path).lastPathComponent();
 }
 
 std::string parentOf(const std::string& path) {
-  size_t slash = path.find_last_of('/');
-  return slash == std::string::npos || slash == 0 ? std::string("/") : path.substr(0, slash);
+  return URL::fileURL(path).deletingLastPathComponent().path();
 }
 
 // A bundle to install and where it goes.
@@ -353,13 +344,13 @@ bool readPackage(const std::string& package, PackageContents* contents, bool* no
   if (!names) return false;
   size_t applications = 0, plugins = 0;
   for (const std::string& name : *names) {
-    std::string extension = extensionOf(name);
     std::string item = path::join(payload, name);
+    std::string extension = URL::fileURL(item).pathExtension();
     // A symbolic link is no bundle: moving it would install the link.
-    if (extension == kApplicationExtension && isDirectoryNoFollow(item)) {
+    if (extension == kApplicationBundleExtension && isDirectoryNoFollow(item)) {
       ++applications;
       contents->application = item;
-    } else if (extension == kVPNPluginExtension && isDirectoryNoFollow(item)) {
+    } else if (extension == kVPNPluginBundleExtension && isDirectoryNoFollow(item)) {
       ++plugins;
       contents->plugin = item;
     }
