@@ -1,0 +1,48 @@
+// Capture of the store-supplied items that travel beside a bundle.
+#include <array>
+
+#include "Shared/FileManager/QSFileManager.h"
+#include "Shared/Support/QSError.h"
+
+using platform::Error;
+using platform::URL;
+
+namespace {
+
+constexpr char kCaptureStoreDataFn[] =
+    "-[QSFileManager captureStoreDataFromDirectory:toDirectory:doCopy:failureIsFatal:withError:]";
+
+// The store items in the order they are captured, each with the key that
+// names its failure. The same four names make up the configuration's list of
+// an application's store-metadata items.
+struct StoreItem {
+  const char* name;
+  const char* failureKey;
+};
+constexpr std::array<StoreItem, 4> kStoreItems = {{
+    {"Manifest.plist", "ManifestCaptureFailed"},
+    {"VendraArtwork", "VendraArtworkCaptureFailed"},
+    {"VendraMetadata.plist", "VendraMetadataCaptureFailed"},
+    {"GeoJSON", "GeoJSONCaptureFailed"},
+}};
+
+}  // namespace
+
+bool QSFileManager::captureStoreDataFromDirectory(const URL& source, const URL& toDirectory, bool doCopy,
+                                                  bool failureIsFatal, Error* withError) const {
+  for (const StoreItem& item : kStoreItems) {
+    const URL from = source.appending(item.name);
+    const URL to = toDirectory.appending(item.name);
+    Error failure;
+    const bool captured =
+        doCopy ? copyItemIfExistsAtURL(from, to, &failure) : moveItemIfExistsAtURL(from, to, &failure);
+    if (captured) continue;
+
+    platform::Dictionary info{{kQSLegacyErrorStringKey, platform::Value(item.failureKey)}};
+    Error error =
+        _CreateAndLogError(kCaptureStoreDataFn, __LINE__, QSInstallerErrorDomain, kQSErrorCodeStoreDataCaptureFailed,
+                           &failure, &info, doCopy ? "Failed to copy %@ to %@" : "Failed to move %@ to %@", from, to);
+    if (failureIsFatal) return QSFail(withError, std::move(error));
+  }
+  return true;
+}
