@@ -10,8 +10,8 @@
 #include <string>
 #include <vector>
 
-#include "Shared/FileManager/DirectoryReader.h"
 #include "Shared/FileManager/PosixHandles.h"
+#include "Shared/FileManager/TreeWalk.h"
 
 namespace qsfs {
 
@@ -202,7 +202,8 @@ int copyNode(const Location& from, const Location& to, const struct stat& status
 struct Frame {
   ScopedFD source;
   ScopedFD destination;
-  struct stat status {};
+  struct stat status {};             // of the source directory
+  struct stat destinationStatus {};  // of the directory the copy made
   std::vector<DirectoryEntry> entries;
   size_t next = 0;
 };
@@ -256,9 +257,26 @@ class TreeCopier {
     if (mkdirat(to.directoryFD, to.name.c_str(), kPrivateDirectoryMode) != 0) return errno;
     frame.destination.reset(openat(to.directoryFD, to.name.c_str(), kOpenDirectoryFlags));
     if (!frame.destination.valid()) return errno;
-    if (frames_.empty() && fstat(frame.destination.get(), &copyRoot_) != 0) return errno;
+    if (fstat(frame.destination.get(), &frame.destinationStatus) != 0) return errno;
+    if (frames_.empty()) copyRoot_ = frame.destinationStatus;
     if (int errnum = readDirectoryEntries(frame.source.get(), frame.entries); errnum != 0) return errnum;
     frames_.push_back(std::move(frame));
+    if (frames_.size() > kMaxOpenDirectories) {
+      Frame& distant = frames_[frames_.size() - 1 - kMaxOpenDirectories];
+      distant.source.reset();
+      distant.destination.reset();
+    }
+    return 0;
+  }
+
+  // Reopens both directories of `parent` from those of its child. A source
+  // or destination directory moved away meanwhile fails the copy (EAGAIN).
+  static int reopenParent(Frame& parent, const Frame& child) {
+    parent.source.reset(openParentDirectory(child.source.get(), parent.status.st_dev, parent.status.st_ino));
+    if (!parent.source.valid()) return errno;
+    parent.destination.reset(
+        openParentDirectory(child.destination.get(), parent.destinationStatus.st_dev, parent.destinationStatus.st_ino));
+    if (!parent.destination.valid()) return errno;
     return 0;
   }
 
@@ -268,6 +286,9 @@ class TreeCopier {
   int leaveDirectory() {
     Frame done = std::move(frames_.back());
     frames_.pop_back();
+    if (!frames_.empty() && !frames_.back().source.valid()) {
+      if (int errnum = reopenParent(frames_.back(), done); errnum != 0) return errnum;
+    }
     int errnum = copyExtendedAttributes({done.source.get(), {}}, {done.destination.get(), {}});
     if (errnum != 0) return errnum;
     return applyStatus(done.destination.get(), done.status);

@@ -11,9 +11,10 @@
 // had copied so far. Entries of the source that vanish while the copy runs
 // are left out. Copying a directory into itself fails with EINVAL.
 //
-// The walk iterates instead of recursing and holds two descriptors per level
-// of the tree, so a tree deeper than half the process's descriptor limit
-// fails with EMFILE.
+// The walk iterates instead of recursing and bounds its open descriptors (see
+// TreeWalk.h), so trees of any depth can be copied. A directory of the source
+// or the copy that is moved away while the walk is below it fails the copy
+// with EAGAIN.
 //
 // Returns 0 or the error number of the failure. Thread-safe; nothing shared.
 #pragma once

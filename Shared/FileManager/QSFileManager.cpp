@@ -8,9 +8,9 @@
 #include <cerrno>
 #include <cstring>
 
-#include "Shared/FileManager/DirectoryReader.h"
 #include "Shared/FileManager/PosixHandles.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
+#include "Shared/FileManager/TreeWalk.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 

@@ -2,7 +2,7 @@
 
 #include <cstring>
 
-#include "Shared/FileManager/DirectoryReader.h"
+#include "Shared/FileManager/TreeWalk.h"
 
 namespace QuillsetAdditions {
 

@@ -8,8 +8,8 @@
 #include <string>
 #include <vector>
 
-#include "Shared/FileManager/DirectoryReader.h"
 #include "Shared/FileManager/PosixHandles.h"
+#include "Shared/FileManager/TreeWalk.h"
 
 namespace qsfs {
 
@@ -49,11 +49,6 @@ struct Frame {
   size_t next = 0;
   bool vanished = false;  // moved away or removed by someone else while we worked
 };
-
-bool sameDirectory(int fd, const Frame& frame) {
-  struct stat status {};
-  return fstat(fd, &status) == 0 && status.st_dev == frame.device && status.st_ino == frame.inode;
-}
 
 }  // namespace
 
@@ -176,11 +171,8 @@ class TreeRemover {
     // Fast way: up from the child, which is open.
     const Frame& child = frames_[index + 1];
     if (child.fd.valid()) {
-      ScopedFD up(openat(child.fd.get(), kParentDirectoryName, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-      if (up.valid() && sameDirectory(up.get(), frame)) {
-        frame.fd = std::move(up);
-        return true;
-      }
+      frame.fd.reset(openParentDirectory(child.fd.get(), frame.device, frame.inode));
+      if (frame.fd.valid()) return true;
     }
     // The child was moved elsewhere: walk down again by name from the nearest
     // ancestor still open, checking every step.
@@ -190,7 +182,7 @@ class TreeRemover {
     for (size_t i = start; i <= index; ++i) {
       int parentFD = i == 0 ? AT_FDCWD : (i == start ? frames_[i - 1].fd.get() : current.get());
       ScopedFD next(openat(parentFD, frames_[i].name.c_str(), kOpenDirectoryFlags));
-      if (!next.valid() || !sameDirectory(next.get(), frames_[i])) return false;
+      if (!next.valid() || !isSameItem(next.get(), frames_[i].device, frames_[i].inode)) return false;
       current = std::move(next);
     }
     frame.fd = std::move(current);

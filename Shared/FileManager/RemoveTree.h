@@ -3,8 +3,8 @@
 // removeTree removes the item at a path: a directory with everything in it,
 // or a single item of any other kind. Symbolic links are removed as links and
 // never followed. The walk works relative to directory descriptors (so path
-// length does not matter), iterates instead of recursing and keeps at most
-// kMaxOpenDirectories descriptors open, so trees of any depth can be removed.
+// length does not matter) and, as the walks of TreeWalk.h do, iterates and
+// bounds its open descriptors, so trees of any depth can be removed.
 // Entries that vanish while the walk runs count as removed.
 //
 // Each item that cannot be removed is handed to the state's error callback
@@ -18,9 +18,9 @@
 
 #include <cstddef>
 
-namespace qsfs {
+#include "Shared/FileManager/TreeWalk.h"
 
-inline constexpr size_t kMaxOpenDirectories = 128;
+namespace qsfs {
 
 enum class RemovalDecision { Proceed, Stop };
 

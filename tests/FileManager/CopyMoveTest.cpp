@@ -10,6 +10,7 @@
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
+#include "Shared/FileManager/TreeWalk.h"
 
 namespace {
 
@@ -204,6 +205,33 @@ TEST_F(FileManagerCopy, SourceStatusFailureIsReportedByTheIfExistsForm) {
     return 0;
   });
   EXPECT_EQ(status, 0);
+}
+
+TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitIsCopied) {
+  constexpr int kDepth = 1000;
+  // The copy keeps two descriptors for each of its open levels; one pair per
+  // level of this tree would need 2,000.
+  constexpr rlim_t kDescriptorLimit = 2 * qsfs::kMaxOpenDirectories + 64;
+  qstest::ShmDir shm;
+  ASSERT_TRUE(qstest::makeDirs(shm / "src"));
+  ASSERT_NO_FATAL_FAILURE(qstest::makeChain(shm / "src", kDepth));
+  std::string chain;
+  for (int i = 0; i < kDepth; ++i) chain += "/d";
+  ASSERT_TRUE(qstest::writeFile(shm / "src" + chain + "/bottom", "deep"));
+  ASSERT_EQ(chmod((shm / "src" + chain.substr(0, 100)).c_str(), 0705), 0);
+  const std::string src = shm / "src";
+  const std::string dst = shm / "dst";
+  int status = qstest::runWithDescriptorLimit(kDescriptorLimit, [&] {
+    return QSFileManager::defaultManager().copyItemAtURL(fileURL(src, true), fileURL(dst, true)) ? 0 : 1;
+  });
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(qstest::readFile(dst + chain + "/bottom"), "deep");
+  EXPECT_EQ(qstest::readFile(dst + chain.substr(0, 1000) + "/f"), "");
+  auto copiedMode = qstest::lstatOf(dst + chain.substr(0, 100));
+  ASSERT_TRUE(copiedMode);
+  EXPECT_EQ(copiedMode->st_mode & 07777, 0705u) << "status is applied to levels that were reopened";
+  EXPECT_TRUE(fm.removeItemAtURL(fileURL(dst, true)));
+  EXPECT_TRUE(fm.removeItemAtURL(fileURL(src, true)));
 }
 
 class FileManagerMove : public FileManagerCopy {};

@@ -2,14 +2,18 @@
 // cross-device moves), status and attribute probes, and error-record checks.
 #pragma once
 
+#include <fcntl.h>
 #include <ftw.h>
 #include <stdlib.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
+#include <functional>
 #include <optional>
 #include <string>
 
@@ -17,6 +21,7 @@
 
 #include "Platform/Foundation/Error.h"
 #include "Platform/Foundation/URL.h"
+#include "Shared/FileManager/PosixHandles.h"
 #include "Shared/Support/QSError.h"
 #include "support/TestSupport.h"
 
@@ -89,6 +94,38 @@ inline void expectPOSIXError(const platform::Error& error, int code, const std::
 // Creates a symbolic link at `at` holding `text`; fails the test otherwise.
 inline void makeSymlink(const std::string& text, const std::string& at) {
   ASSERT_EQ(symlink(text.c_str(), at.c_str()), 0) << at << ": " << strerror(errno);
+}
+
+// Runs `fn` in a forked child whose descriptor limit is `limit`; returns the
+// child's exit status (fn's result), or -1 when the child died otherwise.
+inline int runWithDescriptorLimit(rlim_t limit, const std::function<int()>& fn) {
+  pid_t pid = fork();
+  if (pid < 0) return -1;
+  if (pid == 0) {
+    const rlimit lowered{limit, limit};
+    if (setrlimit(RLIMIT_NOFILE, &lowered) != 0) _exit(125);
+    _exit(fn());
+  }
+  int status = 0;
+  if (waitpid(pid, &status, 0) != pid) return -1;
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+// Builds a chain of `depth` directories named "d" below `root` without ever
+// naming the whole path (it is far longer than PATH_MAX).
+inline void makeChain(const std::string& root, int depth) {
+  qsfs::ScopedFD current(open(root.c_str(), O_RDONLY | O_DIRECTORY));
+  ASSERT_TRUE(current.valid());
+  for (int i = 0; i < depth; ++i) {
+    ASSERT_EQ(mkdirat(current.get(), "d", 0755), 0) << "level " << i;
+    if (i % 100 == 0) {
+      int fd = openat(current.get(), "f", O_WRONLY | O_CREAT, 0644);
+      ASSERT_GE(fd, 0);
+      close(fd);
+    }
+    current.reset(openat(current.get(), "d", O_RDONLY | O_DIRECTORY));
+    ASSERT_TRUE(current.valid());
+  }
 }
 
 // An error record that a successful call must leave as it was.

@@ -1,7 +1,8 @@
-#include "Shared/FileManager/DirectoryReader.h"
+#include "Shared/FileManager/TreeWalk.h"
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <cstring>
@@ -13,6 +14,21 @@ namespace qsfs {
 
 bool isDotOrDotDot(const char* name) {
   return std::strcmp(name, kCurrentDirectoryName) == 0 || std::strcmp(name, kParentDirectoryName) == 0;
+}
+
+bool isSameItem(int fd, dev_t device, ino_t inode) {
+  struct stat status {};
+  return fstat(fd, &status) == 0 && status.st_dev == device && status.st_ino == inode;
+}
+
+int openParentDirectory(int childFD, dev_t device, ino_t inode) {
+  ScopedFD parent(openat(childFD, kParentDirectoryName, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!parent.valid()) return -1;
+  if (!isSameItem(parent.get(), device, inode)) {
+    errno = EAGAIN;
+    return -1;
+  }
+  return parent.release();
 }
 
 int readDirectoryEntries(int directoryFD, std::vector<DirectoryEntry>& entries) {
