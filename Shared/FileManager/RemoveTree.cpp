@@ -147,11 +147,13 @@ class TreeRemover {
   // The current directory is done: remove it from its parent and go back up.
   void leaveDirectory() {
     size_t index = frames_.size() - 1;
-    bool parentReachable = index == 0 || reopen(index - 1);
+    int reopenError = index == 0 ? 0 : reopen(index - 1);
+    if (reopenError > 0) report(path_.substr(0, frames_[index - 1].pathLength), reopenError);
     Frame done = std::move(frames_.back());
     frames_.pop_back();
     path_.resize(frames_.empty() ? 0 : frames_.back().pathLength);
-    if (!parentReachable) {
+    if (reopenError != 0) {
+      // The rest of the parent cannot be reached; what we emptied stays.
       frames_.back().vanished = true;
       return;
     }
@@ -164,15 +166,18 @@ class TreeRemover {
   }
 
   // Makes sure frames_[index] has an open descriptor on the same directory it
-  // had when it was entered. False when that directory is no longer there.
-  bool reopen(size_t index) {
+  // had when it was entered. Returns 0 when it has, kGone when that directory
+  // is no longer where it was, or the error number that kept it from being
+  // opened.
+  static constexpr int kGone = -1;
+  int reopen(size_t index) {
     Frame& frame = frames_[index];
-    if (frame.fd.valid()) return true;
+    if (frame.fd.valid()) return 0;
     // Fast way: up from the child, which is open.
     const Frame& child = frames_[index + 1];
     if (child.fd.valid()) {
       frame.fd.reset(openParentDirectory(child.fd.get(), frame.device, frame.inode));
-      if (frame.fd.valid()) return true;
+      if (frame.fd.valid()) return 0;
     }
     // The child was moved elsewhere: walk down again by name from the nearest
     // ancestor still open, checking every step.
@@ -182,11 +187,12 @@ class TreeRemover {
     for (size_t i = start; i <= index; ++i) {
       int parentFD = i == 0 ? AT_FDCWD : (i == start ? frames_[i - 1].fd.get() : current.get());
       ScopedFD next(openat(parentFD, frames_[i].name.c_str(), kOpenDirectoryFlags));
-      if (!next.valid() || !isSameItem(next.get(), frames_[i].device, frames_[i].inode)) return false;
+      if (!next.valid()) return (errno == ENOENT || errno == ENOTDIR || errno == ELOOP) ? kGone : errno;
+      if (!isSameItem(next.get(), frames_[i].device, frames_[i].inode)) return kGone;
       current = std::move(next);
     }
     frame.fd = std::move(current);
-    return true;
+    return 0;
   }
 
   RemovalState& state_;
