@@ -6,16 +6,15 @@
 // level-3 line saying why; no error record is created.
 #include <limits.h>
 #include <stdlib.h>
-#include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
+#include "Shared/FileManager/SymlinkText.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -35,9 +34,6 @@ constexpr std::string_view kPrivateComponent = "private";
 constexpr std::string_view kRootComponent = "/";
 constexpr std::string_view kCurrentComponent = ".";
 constexpr std::string_view kParentComponent = "..";
-
-// Longest link text read, as on the platform the layout comes from.
-constexpr size_t kMaxLinkTextLength = 1024;
 
 // A real path has at least the root and one name.
 constexpr size_t kMinRealComponentCount = 2;
@@ -78,15 +74,12 @@ enum class LinkCheck { NotALink, AcceptedLink, Rejected };
 // Reads `suspicious` as a symbolic link and, when it is one, checks that its
 // text is relative and never climbs above the base directory.
 LinkCheck checkLink(const QSFileManager& fm, const std::string& suspicious, const std::string& base) {
-  char text[kMaxLinkTextLength + 1] = {};
-  ssize_t length = readlink(suspicious.c_str(), text, kMaxLinkTextLength);
-  if (length < 0) {
-    int err = errno;
+  std::string linkText;
+  if (int err = qsfs::readSymlinkText(suspicious.c_str(), &linkText); err != 0) {
     if (err == EINVAL || err == ENOENT) return LinkCheck::NotALink;
     QS_SYSLOG(kQSLogLevelError, kRealPathForURLFn, "Readlink failed: %s", QSErrorText(err));
     return LinkCheck::Rejected;
   }
-  std::string linkText = QuillsetAdditions::stringWithFileSystemRepresentation(text, static_cast<size_t>(length));
   if (!linkText.empty() && linkText.front() == '/') {
     QS_SYSLOG(kQSLogLevelError, kRealPathForURLFn, "Rejecting %@ -> %s, as absolute symlinks are not allowed",
               suspicious, linkText);

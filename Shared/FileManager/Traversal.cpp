@@ -8,6 +8,7 @@
 
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
+#include "Shared/FileManager/SymlinkText.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -29,9 +30,6 @@ constexpr int kWalkOptions = FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV;
 constexpr mode_t kPermissionBits = 07777;
 constexpr mode_t kStandardDirectoryMode = 0755;
 constexpr mode_t kStandardItemMode = 0644;
-
-// Longest link text read, as on the platform the layout comes from.
-constexpr size_t kMaxLinkTextLength = 1024;
 
 // Owns an open walk. close() reports the outcome of fts_close; a walk still
 // open at destruction is closed with the outcome ignored (an earlier failure
@@ -178,13 +176,11 @@ bool QSFileManager::createSymbolicLinkAtURL(const URL& url, const URL& withDesti
 }
 
 std::optional<URL> QSFileManager::destinationOfSymbolicLinkAtURL(const URL& url, Error* error) const {
-  char text[kMaxLinkTextLength + 1] = {};
-  ssize_t length = readlink(url.fileSystemRepresentation(), text, kMaxLinkTextLength);
-  if (length < 0) {
-    int err = errno;
+  std::string text;
+  if (int err = qsfs::readSymlinkText(url.fileSystemRepresentation(), &text); err != 0) {
     QSFail(error, QSPOSIXError(kDestinationOfSymlinkFn, __LINE__, err, "Could not readlink %s : %s", url.path(),
                                QSErrorText(err)));
     return std::nullopt;
   }
-  return URL::fileURL(QuillsetAdditions::stringWithFileSystemRepresentation(text, static_cast<size_t>(length)));
+  return URL::fileURL(text);
 }
