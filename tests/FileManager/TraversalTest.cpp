@@ -109,6 +109,25 @@ TEST_F(TraversalWalk, LinksAreNeverFollowed) {
   EXPECT_EQ(paths, (std::vector<std::string>{root_, root_ + "/link", root_}));
 }
 
+TEST_F(TraversalWalk, OtherFileSystemsAreReportedButNotEntered) {
+  // /dev/shm is a file system of its own mounted inside /dev.
+  qstest::ShmDir shm;
+  ASSERT_TRUE(qstest::writeFile(shm / "inside", "x"));
+  struct stat dev = statusOf("/dev");
+  struct stat mount = statusOf("/dev/shm");
+  if (dev.st_dev == mount.st_dev) GTEST_SKIP() << "/dev/shm is not a mount point here";
+
+  std::vector<Kind> mountVisits;
+  bool entered = false;
+  ASSERT_TRUE(fm_._traverseDirectory(URL::fileURL("/dev", true), nullptr, [&](const QSTraversalEntry& e, Error*) {
+    if (e.path == "/dev/shm") mountVisits.push_back(e.kind);
+    if (e.path.rfind("/dev/shm/", 0) == 0) entered = true;
+    return true;
+  }));
+  EXPECT_EQ(mountVisits, (std::vector<Kind>{Kind::DirectoryPre, Kind::DirectoryPost}));
+  EXPECT_FALSE(entered);
+}
+
 TEST_F(TraversalWalk, RefusingStepStopsTheWalkWithItsError) {
   ASSERT_TRUE(qstest::makeDirs(root_ + "/a/b"));
   int calls = 0;
