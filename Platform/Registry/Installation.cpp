@@ -66,8 +66,16 @@ class Reporter {
   }
 
  private:
+  // The callback runs on the installation's worker thread, where an exception
+  // would end the process; a throwing callback loses that report only.
   void deliver(const Dictionary& report) const {
-    if (callback_ && *callback_) (*callback_)(report);
+    if (!callback_ || !*callback_) return;
+    try {
+      (*callback_)(report);
+    } catch (...) {
+      SystemLogWrite(nullptr, kFailureLevel, kInstallPackageFunction, "Progress callback threw on report %@; ignored",
+                     Value(report));
+    }
   }
   const InstallProgressCallback* callback_;
 };

@@ -2,6 +2,7 @@
 // replays.
 #include <unistd.h>
 
+#include <stdexcept>
 #include <thread>
 
 #include "Platform/BundleReader.h"
@@ -57,6 +58,19 @@ TEST_F(RegistryInstall, MovesBundleIntoNewContainersAndRemovesPackage) {
   EXPECT_TRUE(record->groupContainerURLs->empty());
   EXPECT_TRUE(registry->isInstalled("com.example.notes"));
   EXPECT_FALSE(registry->isInstalled("com.example.other"));
+}
+
+TEST_F(RegistryInstall, ThrowingProgressCallbackDoesNotStopTheInstallation) {
+  auto registry = openRegistry();
+  std::string package = makePackage("notes", BundleSpec("com.example.notes"));
+  LogCapture log;
+  Error error;
+  EXPECT_TRUE(registry->installPackage(
+      platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
+      [](const platform::Dictionary&) { throw std::runtime_error("callback failure"); }, &error))
+      << error.description();
+  EXPECT_EQ(log.count("Progress callback threw on report"), 5u);
+  EXPECT_TRUE(registry->recordForIdentifier("com.example.notes")->foundBackingBundle);
 }
 
 TEST_F(RegistryInstall, ContainerNamesAreRandomUUIDs) {
