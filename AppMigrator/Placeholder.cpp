@@ -23,8 +23,6 @@ constexpr char kIconFunction[] = "-[QSAppMigrator _writeIconForBundle:toURL:]";
 constexpr char kStagedPlaceholdersDirectoryName[] = "com.vantrel.quill.set.migrator";
 constexpr char kBundleExtension[] = "app";
 constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
-constexpr char kPlaceholderIconFileName[] = "Icon.png";
-constexpr mode_t kDirectoryMode = 0755;
 constexpr size_t kSingleImage = 1;
 
 // The keys a placeholder carries over from the application's info dictionary,
@@ -95,7 +93,7 @@ bool QSAppMigrator::_stageAndInstallPlaceholderForBundleAtURL(const URL& bundle,
 bool QSAppMigrator::_installPlaceholderStagedAtURL(const URL& staged, const URL& bundle, const std::string& identifier,
                                                    const URL& storeMetadataURL) {
   Error error;
-  if (!QSFileManager::defaultManager().createDirectoryAtURL(staged, true, kDirectoryMode, &error)) {
+  if (!QSFileManager::defaultManager().createDirectoryAtURL(staged, true, kQSNewDirectoryMode, &error)) {
     QSAM_LOG(kQSLogLevelError, kPlaceholderFunction,
              "QSAppMigrator: Failed to create staged placeholder directory at %@ : %@", staged.path(), error);
     return false;
@@ -115,9 +113,9 @@ bool QSAppMigrator::_installPlaceholderStagedAtURL(const URL& staged, const URL&
   }
   Dictionary info = placeholderInfo(*appInfo);
 
-  const URL iconURL = staged.appending(kPlaceholderIconFileName);
+  const URL iconURL = staged.appending(platform::kDefaultIconFileName);
   if (_writeIconForBundle(*appBundle, iconURL)) {
-    info.insert_or_assign(platform::kBundleIconFileKey, Value(kPlaceholderIconFileName));
+    info.insert_or_assign(platform::kBundleIconFileKey, Value(platform::kDefaultIconFileName));
   } else {
     QSAM_LOG(kQSLogLevelError, kPlaceholderFunction, "QSAppMigrator: Writing placeholder icon for app %@ to %@ failed",
              identifier, iconURL);

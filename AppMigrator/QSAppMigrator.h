@@ -163,3 +163,5 @@ inline const std::string* QSStringForKey(const platform::Dictionary& dictionary,
 inline constexpr uint64_t kQSMigratorInstallType = 6;
 inline constexpr char kQSInstallOptionSkipBlacklist[] = "SkipBlacklist";
 inline constexpr char kQSInstallOptionVerifyForMigrator[] = "VerifyForMigrator";
+// Mode of the directories the migrator creates.
+inline constexpr unsigned kQSNewDirectoryMode = 0755;

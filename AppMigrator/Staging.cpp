@@ -19,7 +19,6 @@ constexpr char kFunction[] =
     "-[QSAppMigrator _stageAndInstallBundleAtURL:withIdentifier:andVPNPluginAtURL:inContainerURL:]";
 constexpr char kPackageDirectoryName[] = "Staging";
 constexpr char kPayloadDirectoryName[] = "Payload";
-constexpr mode_t kDirectoryMode = 0755;
 
 Dictionary stagedInstallOptions(const std::string& identifier) {
   return Dictionary{
@@ -66,7 +65,7 @@ bool QSAppMigrator::_stageAndInstallBundleAtURL(const URL& bundle, const std::st
   const platform::InstallProgressCallback callback = progressCallback(bundle, alreadyInstalled);
 
   Error error;
-  if (!fm.createDirectoryAtURL(payload, true, kDirectoryMode, &error)) {
+  if (!fm.createDirectoryAtURL(payload, true, kQSNewDirectoryMode, &error)) {
     QSAM_LOG(kQSLogLevelError, kFunction, "QSAppMigrator: Failed to create %@ : %@", payload, error);
     return false;
   }
