@@ -1,0 +1,74 @@
+// appregistry: shows what the application registry of a system root holds.
+//
+//   appregistry list --root DIR [--json]
+//   appregistry show ID --root DIR [--json]
+//
+// Exit status: 0 success, 1 when the registry cannot be opened or `show`
+// finds no record, 64 usage error.
+#include <sys/stat.h>
+
+#include <cstdio>
+#include <string>
+
+#include <CLI/CLI.hpp>
+
+#include "Platform/Registry/SQLiteRegistry.h"
+#include "Tools/UTF8.h"
+#include "Tools/appregistry/RecordFormat.h"
+
+namespace {
+
+constexpr int kExitSuccess = 0;
+constexpr int kExitFailure = 1;
+constexpr int kExitUsage = 64;
+
+int fail(const std::string& message) {
+  fprintf(stderr, "appregistry: %s\n", tools::printable(message).c_str());
+  return kExitFailure;
+}
+
+void print(const std::string& text) { fwrite(text.data(), 1, text.size(), stdout); }
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  CLI::App app{"Shows the records and safe harbors of the application registry."};
+  app.require_subcommand(1);
+  std::string root;
+  bool json = false;
+  app.add_option("--root", root, "System root whose registry is shown")->required();
+  app.add_flag("--json", json, "Write JSON instead of a table");
+  CLI::App* list = app.add_subcommand("list", "Every record and every registered safe harbor");
+  CLI::App* show = app.add_subcommand("show", "One record");
+  std::string identifier;
+  show->add_option("ID", identifier, "Bundle identifier")->required();
+  list->fallthrough();
+  show->fallthrough();
+
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    const int status = app.exit(e);
+    return status == 0 ? kExitSuccess : kExitUsage;
+  }
+
+  // Opening creates a registry where there is none; never under a root
+  // that does not exist.
+  struct stat st;
+  if (stat(root.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return fail(root + " is not a directory");
+  platform::Error error;
+  std::unique_ptr<platform::SQLiteApplicationRegistry> registry =
+      platform::SQLiteApplicationRegistry::open(root, &error);
+  if (!registry) return fail("cannot open the registry under " + root + ": " + error.description());
+
+  if (list->parsed()) {
+    const auto records = registry->allRecords();
+    const auto harbors = registry->safeHarbors();
+    print(json ? appregistry::recordsJson(records, harbors) : appregistry::recordsTable(records, harbors));
+    return kExitSuccess;
+  }
+  const std::optional<platform::BundleRecord> record = registry->recordForIdentifier(identifier);
+  if (!record) return fail("no record for " + identifier);
+  print(json ? appregistry::recordJson(*record) : appregistry::recordDetails(*record));
+  return kExitSuccess;
+}

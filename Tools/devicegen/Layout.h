@@ -1,0 +1,75 @@
+// DeviceLayout: where the parts of a device image lie under its system root.
+// The migrator's own locations (old applications directory, old install map,
+// data directory, system applications, item-name lists) come from a
+// QSGlobalConfiguration built for the root, so that the tools and the
+// migrator cannot disagree; the names below are those of the files the
+// migrator reads and writes there, and the image's own additions.
+//
+// Thread safety: a DeviceLayout belongs to one thread (the configuration's
+// cached accessors take its own lock, but nothing here needs more).
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "Platform/Foundation/URL.h"
+#include "AppMigrator/QSAppMigrator.h"
+#include "Platform/Preferences.h"
+
+class QSGlobalConfiguration;
+
+namespace devicegen {
+
+// Files and keys the migrator reads and writes.
+inline constexpr char kInstallMapGroupContainersKey[] = "GroupContainers";
+inline constexpr char kInstallMapContainerKey[] = "Container";
+inline constexpr char kInstallMapUserKey[] = "User";
+inline constexpr char kHarborPathKey[] = "HarborPathKey";
+inline constexpr char kLastSystemVersionFileName[] = "AppMigratorLastSystemVersion.plist";
+inline constexpr char kOldApplicationsNoteFileName[] = "WhereDidMyApplicationsGo.txt";
+inline constexpr char kBundleExtensionApp[] = "app";
+inline constexpr char kBundleExtensionVPNPlugin[] = "vpnplugin";
+
+// The image's own additions, relative to the root.
+inline constexpr char kManifestFileName[] = "devicegen-manifest.plist";
+inline constexpr char kOldGroupContainersRelativePath[] = "private/var/mobile/Library/AppGroups";
+inline constexpr char kSafeHarborsRelativePath[] = "private/var/mobile/Library/SafeHarbors";
+
+class DeviceLayout {
+ public:
+  // `root`: an absolute path without a trailing separator ("" or "/" is the
+  // real root).
+  explicit DeviceLayout(std::string root);
+  ~DeviceLayout();
+  DeviceLayout(const DeviceLayout&) = delete;
+  DeviceLayout& operator=(const DeviceLayout&) = delete;
+
+  const std::string& root() const { return root_; }
+  // root + "/" + relative.
+  std::string absolute(std::string_view relative) const;
+  // The part of `path` below the root ("" when it is not below it).
+  std::string relative(std::string_view path) const;
+
+  std::string oldApplicationsDirectory() const;
+  std::string installMap() const;
+  std::string dataDirectory() const;
+  std::string safeHarborMap() const;
+  std::string lastSystemVersionRecord() const;
+  std::string systemVersionFile() const;
+  std::string systemApplicationsDirectory() const;
+  std::string oldGroupContainersDirectory() const;
+  std::string safeHarborsDirectory() const;
+  std::string manifest() const;
+
+  std::vector<std::string> userDataItemNames() const;
+  std::vector<std::string> storeMetadataItemNames() const;
+
+ private:
+  std::string root_;
+  platform::FilePreferenceStore preferences_;
+  std::unique_ptr<QSGlobalConfiguration> configuration_;
+};
+
+}  // namespace devicegen
