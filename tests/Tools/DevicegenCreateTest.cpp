@@ -255,7 +255,8 @@ TEST_F(DevicegenCreate, InstallMapAndSafeHarborMapPointAtExistingDirectories) {
     EXPECT_FALSE(tooltest::listDirectory(path).empty()) << group;
   }
   size_t shared = 0;
-  for (const Value& v : tooltest::arrayAt(manifest(root), "Groups")) {
+  const Dictionary m = manifest(root);
+  for (const Value& v : tooltest::arrayAt(m, "Groups")) {
     shared += tooltest::arrayAt(*v.asDictionary(), "Members").size() == 3;
   }
   EXPECT_GE(shared, 1u) << "a group shared by three applications";
@@ -271,7 +272,7 @@ TEST_F(DevicegenCreate, InstallMapAndSafeHarborMapPointAtExistingDirectories) {
   for (const char* key : {"BuildVersion", "ProductVersion", "ProductName"}) {
     EXPECT_FALSE(tooltest::stringAt(version, key).empty()) << key;
   }
-  EXPECT_EQ(Value(version), manifest(root).at("SystemVersion"));
+  EXPECT_EQ(Value(version), m.at("SystemVersion"));
 }
 
 TEST_F(DevicegenCreate, IconsArePNGOfSeveralSizesAndOneNameIsNotUTF8) {
