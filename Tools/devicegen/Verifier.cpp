@@ -16,6 +16,9 @@ namespace {
 
 using platform::BundleRecord;
 
+// Entries of a remaining old applications directory named one by one.
+constexpr size_t kListedLeftoverLimit = 10;
+
 constexpr const char* kProblemKindNames[] = {"missing", "changed", "left behind", "registry", "version"};
 static_assert(std::size(kProblemKindNames) == static_cast<size_t>(ProblemKind::Count));
 
@@ -181,8 +184,9 @@ class ImageVerifier {
     if (const auto entries = directoryEntries(oldApplications)) {
       result_.add(ProblemKind::LeftBehind, "old applications directory " + show(oldApplications) + " (" +
                                                std::to_string(entries->size()) + " entries)");
-      for (const std::string& name : *entries) {
-        result_.add(ProblemKind::LeftBehind, "old container " + show(oldApplications + "/" + name));
+      // Name the first few; the count above says how many there are.
+      for (size_t k = 0; k < entries->size() && k < kListedLeftoverLimit; ++k) {
+        result_.add(ProblemKind::LeftBehind, "old container " + show(oldApplications + "/" + (*entries)[k]));
       }
     } else {
       leftBehindIfPresent(oldApplications, "old applications directory");
