@@ -72,9 +72,10 @@ std::string freshRoot() {
 }
 
 std::vector<std::string> createArguments(const std::string& root) {
-  return {"create",         "--root",     root, "--apps",     kApplications, "--files-per-app", kFilesPerApp,
-          "--bytes-per-file", kBytesPerFile, "--vpn-only", "10", "--groups", "30", "--harbors", "5",
-          "--placeholders", "10", "--builtin-older", "5"};
+  return {"create",     "--root",           root,          "--apps",         kApplications, "--files-per-app",
+          kFilesPerApp, "--bytes-per-file", kBytesPerFile, "--vpn-only",     "10",          "--groups",
+          "30",         "--harbors",        "5",           "--placeholders", "10",          "--builtin-older",
+          "5"};
 }
 
 void BM_CreateThousandApplications(benchmark::State& state) {

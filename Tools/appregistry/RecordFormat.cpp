@@ -14,7 +14,9 @@ using platform::SafeHarborRecord;
 constexpr char kNone[] = "-";
 constexpr char kColumnGap[] = "  ";
 
-std::string yesNo(bool value) { return value ? "yes" : "no"; }
+std::string yesNo(bool value) {
+  return value ? "yes" : "no";
+}
 
 // Columns of a terminal a printable string takes: one per code point (wide
 // characters are rare in identifiers and paths; they only misalign).
@@ -54,7 +56,9 @@ class TextTable {
   std::vector<std::vector<std::string>> rows_;
 };
 
-std::string optionalPath(const std::optional<platform::URL>& url) { return url ? url->path() : kNone; }
+std::string optionalPath(const std::optional<platform::URL>& url) {
+  return url ? url->path() : kNone;
+}
 
 std::string groupCount(const BundleRecord& r) {
   return r.groupContainerURLs ? std::to_string(r.groupContainerURLs->size()) : kNone;
@@ -93,8 +97,8 @@ std::string recordsTable(const std::vector<BundleRecord>& records, const std::ve
   TextTable table;
   table.add({"IDENTIFIER", "TYPE", "VERSION", "PLACEHOLDER", "GROUPS", "DATA CONTAINER", "BUNDLE"});
   for (const BundleRecord& r : records) {
-    table.add({r.identifier, r.bundleType, r.version.empty() ? kNone : r.version, yesNo(r.isPlaceholder),
-               groupCount(r), optionalPath(r.dataContainerURL), r.bundleURL.path()});
+    table.add({r.identifier, r.bundleType, r.version.empty() ? kNone : r.version, yesNo(r.isPlaceholder), groupCount(r),
+               optionalPath(r.dataContainerURL), r.bundleURL.path()});
   }
   std::string out = table.render();
   out += std::to_string(records.size()) + (records.size() == 1 ? " record\n" : " records\n");

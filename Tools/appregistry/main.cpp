@@ -5,9 +5,11 @@
 //
 // Exit status: 0 success, 1 when the registry cannot be opened or `show`
 // finds no record, 64 usage error.
+#include <stdlib.h>
 #include <sys/stat.h>
 
 #include <cstdio>
+#include <memory>
 #include <string>
 
 #include <CLI/CLI.hpp>
@@ -27,7 +29,9 @@ int fail(const std::string& message) {
   return kExitFailure;
 }
 
-void print(const std::string& text) { fwrite(text.data(), 1, text.size(), stdout); }
+void print(const std::string& text) {
+  fwrite(text.data(), 1, text.size(), stdout);
+}
 
 }  // namespace
 
@@ -53,9 +57,12 @@ int main(int argc, char** argv) {
   }
 
   // Opening creates a registry where there is none; never under a root
-  // that does not exist.
+  // that does not exist. The records hold absolute paths, so the root is
+  // made absolute too.
+  std::unique_ptr<char, decltype(&free)> resolved(realpath(root.c_str(), nullptr), &free);
   struct stat st;
-  if (stat(root.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return fail(root + " is not a directory");
+  if (!resolved || stat(resolved.get(), &st) != 0 || !S_ISDIR(st.st_mode)) return fail(root + " is not a directory");
+  root = resolved.get();
   platform::Error error;
   std::unique_ptr<platform::SQLiteApplicationRegistry> registry =
       platform::SQLiteApplicationRegistry::open(root, &error);

@@ -26,8 +26,7 @@ constexpr char kPluginSuffix[] = "Tunnel";
 constexpr char kPluginIdentifierSuffix[] = ".tunnel";
 constexpr char kExecutableScript[] = "#!/bin/sh\nexit 0\n";
 constexpr char kProductName[] = "Quill OS";
-constexpr char kOldApplicationsNote[] =
-    "Applications now live in containers managed by the installation daemon.\n";
+constexpr char kOldApplicationsNote[] = "Applications now live in containers managed by the installation daemon.\n";
 constexpr char kGeoJSONDocument[] = "{\"type\":\"FeatureCollection\",\"features\":[]}\n";
 constexpr char kHarborKeptFile[] = "Documents/kept.txt";
 constexpr char kHarborKeptText[] = "kept in a safe harbor\n";
@@ -35,13 +34,18 @@ constexpr char kHarborKeptText[] = "kept in a safe harbor\n";
 // UTF-8), so that the migration is shown to carry names as bytes.
 constexpr char kInvalidUTF8Name[] = "raw-\xFF\xFE-bytes.bin";
 constexpr size_t kArtworkBytes = 2048;
+// Positions in the configuration's list of store-metadata item names.
+constexpr size_t kStoreManifestItem = 0;
+constexpr size_t kStoreArtworkItem = 1;
+constexpr size_t kStoreMetadataItem = 2;
+constexpr size_t kStoreGeoJSONItem = 3;
 constexpr int kIconSizes[] = {29, 40, 58, 60, 76, 87, 120, 152, 180};
 
-constexpr const char* kFirstWords[] = {"Pixel", "Quill",  "Harbor", "Amber", "Cobalt", "Drift", "Ember",
-                                       "Fable", "Glyph",  "Hollow", "Ivory", "Jolt",   "Kite",  "Lumen",
-                                       "Maple", "Nimbus", "Orbit",  "Pebble"};
-constexpr const char* kSecondWords[] = {"Notes",  "Maps",  "Camera", "Tasks",   "Radio", "Ledger",
-                                        "Garden", "Atlas", "Reader", "Studio",  "Chat",  "Budget",
+constexpr const char* kFirstWords[] = {"Pixel", "Quill", "Harbor", "Amber",  "Cobalt", "Drift",
+                                       "Ember", "Fable", "Glyph",  "Hollow", "Ivory",  "Jolt",
+                                       "Kite",  "Lumen", "Maple",  "Nimbus", "Orbit",  "Pebble"};
+constexpr const char* kSecondWords[] = {"Notes",  "Maps",  "Camera",  "Tasks",  "Radio", "Ledger",
+                                        "Garden", "Atlas", "Reader",  "Studio", "Chat",  "Budget",
                                         "Relay",  "Forge", "Recipes", "Journal"};
 
 // The built-in applications every image has, besides the newer copies of old
@@ -75,33 +79,32 @@ struct TreeShape {
 };
 
 const TreeShape& applicationDataShape() {
-  static const TreeShape* shape = new TreeShape{
-      {"Documents", "Library", "Library/Preferences", "Library/Caches", "tmp", "Tillbox"},
-      {"Tillbox/Drafts", "Library/Caches/Empty Cache"},
-      {{"Documents", "Note ", ".txt"},
-       {"Documents/Projects/2024", "Draft ", ".md"},
-       {"Library/Caches", "cache-", ".bin"},
-       {"tmp", "upload ", ".part"},
-       {"Tillbox/Inbox/Attachments", "photo-", ".jpg"},
-       {"Documents", "Caf\u00e9 menu ", ".txt"},
-       {"Tillbox/Inbox", "\u65e5\u672c\u8a9e ", ".txt"},
-       {"Library/Application Support", "state ", ".db"}},
-      "Library/Preferences",
-      "Documents/empty.dat",
-      {{"Documents/Latest", "empty.dat"}, {"Library/Documents Link", "../Documents"}}};
+  static const TreeShape* shape =
+      new TreeShape{{"Documents", "Library", "Library/Preferences", "Library/Caches", "tmp", "Tillbox"},
+                    {"Tillbox/Drafts", "Library/Caches/Empty Cache"},
+                    {{"Documents", "Note ", ".txt"},
+                     {"Documents/Projects/2024", "Draft ", ".md"},
+                     {"Library/Caches", "cache-", ".bin"},
+                     {"tmp", "upload ", ".part"},
+                     {"Tillbox/Inbox/Attachments", "photo-", ".jpg"},
+                     {"Documents", "Caf\u00e9 menu ", ".txt"},
+                     {"Tillbox/Inbox", "\u65e5\u672c\u8a9e ", ".txt"},
+                     {"Library/Application Support", "state ", ".db"}},
+                    "Library/Preferences",
+                    "Documents/empty.dat",
+                    {{"Documents/Latest", "empty.dat"}, {"Library/Documents Link", "../Documents"}}};
   return *shape;
 }
 
 const TreeShape& groupDataShape() {
-  static const TreeShape* shape = new TreeShape{
-      {"Library", "Library/Preferences", "Library/Caches", "Shared"},
-      {"Shared/Inbox"},
-      {{"Shared", "shared ", ".dat"},
-       {"Shared/Media/Albums", "Album ", ".json"},
-       {"Library/Caches", "group-cache-", ".bin"}},
-      "Library/Preferences",
-      "Shared/empty",
-      {{"Shared/Latest", "empty"}}};
+  static const TreeShape* shape = new TreeShape{{"Library", "Library/Preferences", "Library/Caches", "Shared"},
+                                                {"Shared/Inbox"},
+                                                {{"Shared", "shared ", ".dat"},
+                                                 {"Shared/Media/Albums", "Album ", ".json"},
+                                                 {"Library/Caches", "group-cache-", ".bin"}},
+                                                "Library/Preferences",
+                                                "Shared/empty",
+                                                {{"Shared/Latest", "empty"}}};
   return *shape;
 }
 
@@ -145,7 +148,9 @@ std::string lowercase(std::string text) {
   return text;
 }
 
-std::string join(const std::string& directory, const std::string& name) { return directory + "/" + name; }
+std::string join(const std::string& directory, const std::string& name) {
+  return directory + "/" + name;
+}
 
 class ImageWriter {
  public:
@@ -157,8 +162,8 @@ class ImageWriter {
     manifest_.seed = options_.seed;
     plan();
     return makeDirectories(why) && writeSystemVersion(why) && writeBuiltIns(why) && writeApplications(why) &&
-           writeVPNOnlyContainers(why) && writeGroups(why) && writeOldApplicationsNote(why) &&
-           writeInstallMap(why) && writeSafeHarbors(why) && writeManifest(manifest_, layout_.manifest(), why);
+           writeVPNOnlyContainers(why) && writeGroups(why) && writeOldApplicationsNote(why) && writeInstallMap(why) &&
+           writeSafeHarbors(why) && writeManifest(manifest_, layout_.manifest(), why);
   }
 
  private:
@@ -243,9 +248,15 @@ class ImageWriter {
 
   void planStoreMetadata(AppPlan& app) {
     switch (random_.between(0, 2)) {
-      case 0: app.storeMetadata = AppPlan::StoreMetadata::None; break;
-      case 1: app.storeMetadata = AppPlan::StoreMetadata::MetadataOnly; break;
-      default: app.storeMetadata = AppPlan::StoreMetadata::All; break;
+      case 0:
+        app.storeMetadata = AppPlan::StoreMetadata::None;
+        break;
+      case 1:
+        app.storeMetadata = AppPlan::StoreMetadata::MetadataOnly;
+        break;
+      default:
+        app.storeMetadata = AppPlan::StoreMetadata::All;
+        break;
     }
   }
 
@@ -266,10 +277,10 @@ class ImageWriter {
     const uint64_t major = random_.between(10, 19);
     const std::string build = std::to_string(major) + static_cast<char>('A' + random_.between(0, 5)) +
                               std::to_string(random_.between(100, 999));
-    manifest_.systemVersion = Dictionary{
-        {platform::kSystemVersionBuildVersionKey, build},
-        {platform::kSystemVersionProductVersionKey, std::to_string(major) + "." + std::to_string(random_.between(0, 4))},
-        {platform::kSystemVersionProductNameKey, kProductName}};
+    manifest_.systemVersion = Dictionary{{platform::kSystemVersionBuildVersionKey, build},
+                                         {platform::kSystemVersionProductVersionKey,
+                                          std::to_string(major) + "." + std::to_string(random_.between(0, 4))},
+                                         {platform::kSystemVersionProductNameKey, kProductName}};
     return writePlist(manifest_.systemVersion, layout_.systemVersionFile(), platform::plist::Format::XML, why);
   }
 
@@ -281,7 +292,8 @@ class ImageWriter {
     }
     for (const AppPlan& app : apps_) {
       if (app.role != Role::BuiltInOlder) continue;
-      const Dictionary info = bundleInfo(app.identifier, app.displayName, app.name, app.builtInVersion, app.shortVersion);
+      const Dictionary info =
+          bundleInfo(app.identifier, app.displayName, app.name, app.builtInVersion, app.shortVersion);
       if (!writeBuiltIn(app.name, app.identifier, app.builtInVersion, info, false, why)) return false;
     }
     return true;
@@ -359,20 +371,23 @@ class ImageWriter {
 
   bool writeStoreMetadata(const AppPlan& app, const std::string& container, std::string* why) {
     if (app.storeMetadata == AppPlan::StoreMetadata::None) return true;
-    const std::vector<std::string> names = layout_.storeMetadataItemNames();  // Manifest, Artwork, Metadata, GeoJSON
+    const std::vector<std::string> names = layout_.storeMetadataItemNames();
     const Dictionary metadata{{"itemId", Value(static_cast<unsigned long long>(100000 + app.index))},
                               {"itemName", app.displayName},
                               {"bundleVersion", app.version},
                               {"artistName", "Example Developer"}};
-    if (!writePlist(metadata, join(container, names.at(2)), platform::plist::Format::XML, why)) return false;
+    if (!writePlist(metadata, join(container, names.at(kStoreMetadataItem)), platform::plist::Format::XML, why))
+      return false;
     if (app.storeMetadata == AppPlan::StoreMetadata::MetadataOnly) return true;
     std::vector<uint8_t>& artwork = buffer(kArtworkBytes);
     random_.fill(artwork.data(), kArtworkBytes);
     const Dictionary packageManifest{{"Identifier", app.identifier}, {"Version", app.version}};
-    return writePlist(packageManifest, join(container, names.at(0)), platform::plist::Format::XML, why) &&
-           writeWholeFile(join(container, names.at(1)), artwork.data(), kArtworkBytes, kFileMode, why) &&
-           writeWholeFile(join(container, names.at(3)), kGeoJSONDocument, sizeof kGeoJSONDocument - 1, kFileMode,
-                          why);
+    return writePlist(packageManifest, join(container, names.at(kStoreManifestItem)), platform::plist::Format::XML,
+                      why) &&
+           writeWholeFile(join(container, names.at(kStoreArtworkItem)), artwork.data(), kArtworkBytes, kFileMode,
+                          why) &&
+           writeWholeFile(join(container, names.at(kStoreGeoJSONItem)), kGeoJSONDocument, sizeof kGeoJSONDocument - 1,
+                          kFileMode, why);
   }
 
   bool writeVPNOnlyContainers(std::string* why) {
@@ -409,8 +424,8 @@ class ImageWriter {
   }
 
   bool writeOldApplicationsNote(std::string* why) {
-    return writeWholeFile(join(layout_.oldApplicationsDirectory(), kOldApplicationsNoteFileName),
-                          kOldApplicationsNote, sizeof kOldApplicationsNote - 1, kFileMode, why);
+    return writeWholeFile(join(layout_.oldApplicationsDirectory(), kOldApplicationsNoteFileName), kOldApplicationsNote,
+                          sizeof kOldApplicationsNote - 1, kFileMode, why);
   }
 
   bool writeInstallMap(std::string* why) {
@@ -479,7 +494,8 @@ class ImageWriter {
       return false;
     }
     return writePreferences(container, owner, ownerId, shape, why) &&
-           writeBytes(container, owner, ownerId, shape.emptyFile, nullptr, 0, why) && writeLinks(container, owner, ownerId, shape, why);
+           writeBytes(container, owner, ownerId, shape.emptyFile, nullptr, 0, why) &&
+           writeLinks(container, owner, ownerId, shape, why);
   }
 
   uint64_t fileSize(uint64_t k) {
@@ -559,7 +575,8 @@ class ImageWriter {
 
   bool writeIcon(const std::string& bundle, int size, int hue, std::string* why) {
     const std::optional<std::vector<uint8_t>> png = encodeIcon(size, hue, why);
-    return png && writeWholeFile(join(bundle, platform::kDefaultIconFileName), png->data(), png->size(), kFileMode, why);
+    return png &&
+           writeWholeFile(join(bundle, platform::kDefaultIconFileName), png->data(), png->size(), kFileMode, why);
   }
 
   static bool writeExecutable(const std::string& path, std::string* why) {
@@ -610,8 +627,8 @@ std::string checkImageOptions(const ImageOptions& o) {
   }
   const uint64_t regular = o.applications - o.placeholders - o.builtInOlder;
   if (o.vpnOnly > regular) {
-    return "--vpn-only (" + std::to_string(o.vpnOnly) + ") needs as many ordinary applications to carry the plug-ins (" +
-           std::to_string(regular) + " available)";
+    return "--vpn-only (" + std::to_string(o.vpnOnly) +
+           ") needs as many ordinary applications to carry the plug-ins (" + std::to_string(regular) + " available)";
   }
   if (o.groups > 0 && regular == 0) return "--groups needs at least one ordinary application";
   return "";

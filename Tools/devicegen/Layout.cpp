@@ -30,33 +30,51 @@ std::string DeviceLayout::relative(std::string_view path) const {
   return std::string(path.substr(prefix.size()));
 }
 
-std::string DeviceLayout::oldApplicationsDirectory() const { return configuration_->oldContainerPath().path(); }
+std::string DeviceLayout::oldApplicationsDirectory() const {
+  return configuration_->oldContainerPath().path();
+}
 
-std::string DeviceLayout::installMap() const { return configuration_->oldInstallMapPath().path(); }
+std::string DeviceLayout::installMap() const {
+  return configuration_->oldInstallMapPath().path();
+}
 
 // The path, not the accessor that creates the directory: the layout only
 // looks, the image writer makes what it needs.
-std::string DeviceLayout::dataDirectory() const { return configuration_->dataDirectoryPath().path(); }
+std::string DeviceLayout::dataDirectory() const {
+  return configuration_->dataDirectoryPath().path();
+}
 
-std::string DeviceLayout::safeHarborMap() const { return dataDirectory() + "/" + kQSSafeHarborMapFileName; }
+std::string DeviceLayout::safeHarborMap() const {
+  return dataDirectory() + "/" + kQSSafeHarborMapFileName;
+}
 
 std::string DeviceLayout::lastSystemVersionRecord() const {
   return dataDirectory() + "/" + kLastSystemVersionFileName;
 }
 
-std::string DeviceLayout::systemVersionFile() const { return platform::FileSystemVersionSource(root_).path(); }
+std::string DeviceLayout::systemVersionFile() const {
+  return platform::FileSystemVersionSource(root_).path();
+}
 
 std::string DeviceLayout::systemApplicationsDirectory() const {
   return configuration_->systemAppsDirectory().path();
 }
 
-std::string DeviceLayout::oldGroupContainersDirectory() const { return absolute(kOldGroupContainersRelativePath); }
+std::string DeviceLayout::oldGroupContainersDirectory() const {
+  return absolute(kOldGroupContainersRelativePath);
+}
 
-std::string DeviceLayout::safeHarborsDirectory() const { return absolute(kSafeHarborsRelativePath); }
+std::string DeviceLayout::safeHarborsDirectory() const {
+  return absolute(kSafeHarborsRelativePath);
+}
 
-std::string DeviceLayout::manifest() const { return absolute(kManifestFileName); }
+std::string DeviceLayout::manifest() const {
+  return absolute(kManifestFileName);
+}
 
-std::vector<std::string> DeviceLayout::userDataItemNames() const { return configuration_->appUserDataItemNames(); }
+std::vector<std::string> DeviceLayout::userDataItemNames() const {
+  return configuration_->appUserDataItemNames();
+}
 
 std::vector<std::string> DeviceLayout::storeMetadataItemNames() const {
   return configuration_->appBundleMetadataItemNames();

@@ -14,8 +14,8 @@
 #include <string_view>
 #include <vector>
 
-#include "Platform/Foundation/URL.h"
 #include "AppMigrator/QSAppMigrator.h"
+#include "Platform/Foundation/URL.h"
 #include "Platform/Preferences.h"
 
 class QSGlobalConfiguration;

@@ -286,9 +286,8 @@ Value manifestToValue(const Manifest& m) {
   Array containers, groups, harbors, builtIns, items;
   for (const auto& c : m.containers) containers.push_back(containerValue(c));
   for (const auto& g : m.groups) {
-    groups.push_back(Dictionary{{kIdentifierKey, g.identifier},
-                                {kContainerKey, g.containerPath},
-                                {kMembersKey, stringArray(g.members)}});
+    groups.push_back(Dictionary{
+        {kIdentifierKey, g.identifier}, {kContainerKey, g.containerPath}, {kMembersKey, stringArray(g.members)}});
   }
   for (const auto& h : m.harbors) harbors.push_back(Dictionary{{kIdentifierKey, h.identifier}, {kPathKey, h.path}});
   for (const auto& b : m.builtIns) {
@@ -335,7 +334,9 @@ std::optional<Manifest> manifestFromValue(const Value& value, std::string* why) 
                  return ManifestGroup{r.string(kIdentifierKey), r.string(kContainerKey), r.strings(kMembersKey)};
                }) &&
       readList(*root, kSafeHarborsKey, &m.harbors, why,
-               [](FieldReader& r) { return ManifestHarbor{r.string(kIdentifierKey), r.string(kPathKey)}; }) &&
+               [](FieldReader& r) {
+                 return ManifestHarbor{r.string(kIdentifierKey), r.string(kPathKey)};
+               }) &&
       readList(*root, kBuiltInsKey, &m.builtIns, why,
                [](FieldReader& r) {
                  return ManifestBuiltIn{r.string(kIdentifierKey), r.string(kBundleKey), r.string(kVersionKey),
@@ -348,8 +349,8 @@ std::optional<Manifest> manifestFromValue(const Value& value, std::string* why) 
 
 bool writeManifest(const Manifest& manifest, const std::string& path, std::string* why) {
   platform::Error error;
-  if (!platform::plist::writeFile(manifestToValue(manifest), platform::URL::fileURL(path),
-                                  platform::plist::Format::XML, /*atomically=*/true, &error)) {
+  if (!platform::plist::writeFile(manifestToValue(manifest), platform::URL::fileURL(path), platform::plist::Format::XML,
+                                  /*atomically=*/true, &error)) {
     if (why) *why = "cannot write the manifest " + path + ": " + error.description();
     return false;
   }

@@ -21,16 +21,24 @@ Rgb hueToRgb(int hue) {
   const double h = (hue % 360) / 60.0;
   const double x = 1.0 - std::fabs(std::fmod(h, 2.0) - 1.0);
   switch (static_cast<int>(h)) {
-    case 0: return {1, x, 0};
-    case 1: return {x, 1, 0};
-    case 2: return {0, 1, x};
-    case 3: return {0, x, 1};
-    case 4: return {x, 0, 1};
-    default: return {1, 0, x};
+    case 0:
+      return {1, x, 0};
+    case 1:
+      return {x, 1, 0};
+    case 2:
+      return {0, 1, x};
+    case 3:
+      return {0, x, 1};
+    case 4:
+      return {x, 0, 1};
+    default:
+      return {1, 0, x};
   }
 }
 
-uint8_t channel(double value) { return static_cast<uint8_t>(std::clamp(value, 0.0, 1.0) * 255.0 + 0.5); }
+uint8_t channel(double value) {
+  return static_cast<uint8_t>(std::clamp(value, 0.0, 1.0) * 255.0 + 0.5);
+}
 
 std::vector<uint8_t> drawIcon(int size, int hue) {
   std::vector<uint8_t> pixels(static_cast<size_t>(size) * size * kChannels);

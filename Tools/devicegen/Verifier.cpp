@@ -22,7 +22,9 @@ constexpr size_t kListedLeftoverLimit = 10;
 constexpr const char* kProblemKindNames[] = {"missing", "changed", "left behind", "registry", "version"};
 static_assert(std::size(kProblemKindNames) == static_cast<size_t>(ProblemKind::Count));
 
-std::string show(const std::string& bytes) { return tools::printable(bytes); }
+std::string show(const std::string& bytes) {
+  return tools::printable(bytes);
+}
 
 class ImageVerifier {
  public:
@@ -62,8 +64,12 @@ class ImageVerifier {
           ++s.files;
           s.bytes += item.size;
           break;
-        case ManifestItem::Kind::Directory: ++s.directories; break;
-        case ManifestItem::Kind::Link: ++s.links; break;
+        case ManifestItem::Kind::Directory:
+          ++s.directories;
+          break;
+        case ManifestItem::Kind::Link:
+          ++s.links;
+          break;
       }
     }
   }
@@ -193,7 +199,8 @@ class ImageVerifier {
     }
     leftBehindIfPresent(layout_.installMap(), "old install map");
     for (const ManifestGroup& group : manifest_.groups) {
-      leftBehindIfPresent(layout_.absolute(group.containerPath), "old group container of " + show(group.identifier) + ":");
+      leftBehindIfPresent(layout_.absolute(group.containerPath),
+                          "old group container of " + show(group.identifier) + ":");
     }
   }
 
@@ -205,7 +212,8 @@ class ImageVerifier {
       const std::string path = layout_.absolute(harbor.path);
       if (!registered.count({harbor.identifier, path})) {
         all = false;
-        result_.add(ProblemKind::Registry, "safe harbor not registered: " + show(harbor.identifier) + " at " + show(path));
+        result_.add(ProblemKind::Registry,
+                    "safe harbor not registered: " + show(harbor.identifier) + " at " + show(path));
       }
       if (itemKind(path) != ItemKind::Directory) result_.add(ProblemKind::Missing, "safe harbor " + show(path));
     }
@@ -223,7 +231,8 @@ class ImageVerifier {
     }
     const auto current = platform::plist::readDictionary(platform::URL::fileURL(layout_.systemVersionFile()), &error);
     if (!current) {
-      result_.add(ProblemKind::Version, "cannot read " + show(layout_.systemVersionFile()) + ": " + error.description());
+      result_.add(ProblemKind::Version,
+                  "cannot read " + show(layout_.systemVersionFile()) + ": " + error.description());
       return;
     }
     if (*recorded != *current) {
@@ -288,9 +297,9 @@ void printVerifyResult(const std::string& root, const VerifyResult& result, FILE
           static_cast<unsigned long long>(s.applications), static_cast<unsigned long long>(s.placeholders),
           static_cast<unsigned long long>(s.builtInRefusals), static_cast<unsigned long long>(s.vpnOnlyContainers),
           static_cast<unsigned long long>(s.groups), static_cast<unsigned long long>(s.harbors));
-  fprintf(out, "  files: %llu (%llu bytes), directories: %llu, links: %llu\n",
-          static_cast<unsigned long long>(s.files), static_cast<unsigned long long>(s.bytes),
-          static_cast<unsigned long long>(s.directories), static_cast<unsigned long long>(s.links));
+  fprintf(out, "  files: %llu (%llu bytes), directories: %llu, links: %llu\n", static_cast<unsigned long long>(s.files),
+          static_cast<unsigned long long>(s.bytes), static_cast<unsigned long long>(s.directories),
+          static_cast<unsigned long long>(s.links));
   if (result.ok()) {
     fprintf(out, "OK: every item is in its new container, intact; nothing of the old layout is left\n");
     return;
@@ -307,7 +316,8 @@ void printVerifyResult(const std::string& root, const VerifyResult& result, FILE
     fprintf(out, "  %s: %s\n", kProblemKindNames[static_cast<size_t>(p.kind)], p.text.c_str());
   }
   if (result.problemCount() > result.listed.size()) {
-    fprintf(out, "  ... and %llu more\n", static_cast<unsigned long long>(result.problemCount() - result.listed.size()));
+    fprintf(out, "  ... and %llu more\n",
+            static_cast<unsigned long long>(result.problemCount() - result.listed.size()));
   }
   fprintf(out, "FAILED\n");
 }

@@ -39,6 +39,9 @@ int runCreate(devicegen::ImageOptions options) {
   if (!devicegen::makeDirectories(options.root, &why)) return fail(why);
   const std::optional<std::string> root = devicegen::canonicalDirectory(options.root, &why);
   if (!root) return fail(why);
+  // An image lies beside what it imitates; over the real system it would
+  // mix with the real layout.
+  if (*root == "/") return fail("refusing to write an image over /");
   options.root = *root;
   const devicegen::DeviceLayout layout(*root);
   if (devicegen::itemKind(layout.manifest()) != devicegen::ItemKind::Missing) {
@@ -49,11 +52,12 @@ int runCreate(devicegen::ImageOptions options) {
   if (!devicegen::createImage(options, &manifest, &why)) return fail(why);
   const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
   printf("devicegen create: %s\n", tools::printable(*root).c_str());
-  printf("  applications: %llu (%llu placeholders, %llu with a newer built-in copy), VPN-only containers: %llu, "
-         "groups: %llu, safe harbors: %llu\n",
-         static_cast<unsigned long long>(options.applications), static_cast<unsigned long long>(options.placeholders),
-         static_cast<unsigned long long>(options.builtInOlder), static_cast<unsigned long long>(options.vpnOnly),
-         static_cast<unsigned long long>(options.groups), static_cast<unsigned long long>(options.harbors));
+  printf(
+      "  applications: %llu (%llu placeholders, %llu with a newer built-in copy), VPN-only containers: %llu, "
+      "groups: %llu, safe harbors: %llu\n",
+      static_cast<unsigned long long>(options.applications), static_cast<unsigned long long>(options.placeholders),
+      static_cast<unsigned long long>(options.builtInOlder), static_cast<unsigned long long>(options.vpnOnly),
+      static_cast<unsigned long long>(options.groups), static_cast<unsigned long long>(options.harbors));
   printf("  files: %llu (%llu bytes), seed %llu, %.2f s\n", static_cast<unsigned long long>(manifest.fileCount()),
          static_cast<unsigned long long>(manifest.byteCount()), static_cast<unsigned long long>(options.seed), seconds);
   return kExitSuccess;

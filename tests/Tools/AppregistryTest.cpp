@@ -5,8 +5,8 @@
 #include "Platform/BundleReader.h"
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Registry/SQLiteRegistry.h"
-#include "support/TestSupport.h"
 #include "ToolTestSupport.h"
+#include "support/TestSupport.h"
 
 namespace {
 

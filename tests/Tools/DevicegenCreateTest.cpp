@@ -6,8 +6,8 @@
 
 #include <gtest/gtest.h>
 
-#include "support/TestSupport.h"
 #include "ToolTestSupport.h"
+#include "support/TestSupport.h"
 
 namespace {
 
@@ -15,10 +15,9 @@ using platform::Dictionary;
 using platform::Value;
 using tooltest::TreeEntry;
 
-const std::vector<std::string> kStandardOptions = {"--apps",         "8",    "--vpn-only", "2", "--groups",
-                                                   "3",              "--files-per-app", "9", "--bytes-per-file",
-                                                   "1500",           "--harbors", "2", "--placeholders", "1",
-                                                   "--builtin-older", "2",    "--seed",     "7"};
+const std::vector<std::string> kStandardOptions = {
+    "--apps",    "8", "--vpn-only",     "2", "--groups",        "3", "--files-per-app", "9", "--bytes-per-file", "1500",
+    "--harbors", "2", "--placeholders", "1", "--builtin-older", "2", "--seed",          "7"};
 
 // Numeric comparison of dotted versions: "2.10" is newer than "2.9".
 int compareVersions(const std::string& a, const std::string& b) {
@@ -342,8 +341,8 @@ TEST_F(DevicegenCreate, UsageErrorsExit64AndWriteNothing) {
     EXPECT_FALSE(run.err.empty()) << joined;
   }
   EXPECT_FALSE(tooltest::exists(root));
-  const tooltest::RunResult run =
-      tooltest::runTool("devicegen", {"create", "--root", root, "--apps", "2", "--placeholders", "2", "--builtin-older", "1"});
+  const tooltest::RunResult run = tooltest::runTool(
+      "devicegen", {"create", "--root", root, "--apps", "2", "--placeholders", "2", "--builtin-older", "1"});
   EXPECT_NE(run.err.find("exceeds --apps"), std::string::npos) << run.err;
 }
 

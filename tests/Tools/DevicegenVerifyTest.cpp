@@ -8,8 +8,8 @@
 #include "MigrationSimulator.h"
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Registry/SQLiteRegistry.h"
-#include "support/TestSupport.h"
 #include "ToolTestSupport.h"
+#include "support/TestSupport.h"
 
 namespace {
 
@@ -20,10 +20,11 @@ class DevicegenVerify : public ::testing::Test {
  protected:
   void SetUp() override {
     root_ = dir_ / "image";
-    const tooltest::RunResult run = tooltest::runTool(
-        "devicegen", {"create", "--root", root_, "--apps", "6", "--vpn-only", "1", "--groups", "3", "--files-per-app",
-                      "5", "--bytes-per-file", "700", "--harbors", "2", "--placeholders", "1", "--builtin-older", "1",
-                      "--seed", "11"});
+    const tooltest::RunResult run =
+        tooltest::runTool("devicegen", {"create", "--root",    root_, "--apps",          "6", "--vpn-only",
+                                        "1",      "--groups",  "3",   "--files-per-app", "5", "--bytes-per-file",
+                                        "700",    "--harbors", "2",   "--placeholders",  "1", "--builtin-older",
+                                        "1",      "--seed",    "11"});
     ASSERT_EQ(run.status, 0) << run.err;
   }
 
@@ -142,7 +143,8 @@ TEST_F(DevicegenVerify, RetargetedLinkIsReported) {
 TEST_F(DevicegenVerify, LeftoversOfTheOldLayoutAreReported) {
   migrate();
   const Dictionary m = tooltest::readDictionary(root_ + tooltest::kManifest);
-  const std::string oldGroup = root_ + "/" + tooltest::stringAt(*tooltest::arrayAt(m, "Groups")[0].asDictionary(), "Container");
+  const std::string oldGroup =
+      root_ + "/" + tooltest::stringAt(*tooltest::arrayAt(m, "Groups")[0].asDictionary(), "Container");
   ASSERT_TRUE(qstest::makeDirs(oldGroup));
   ASSERT_TRUE(qstest::writeFile(root_ + tooltest::kInstallMap, "x"));
   ASSERT_TRUE(qstest::writeFile(root_ + tooltest::kSafeHarborMap, "x"));
@@ -150,9 +152,9 @@ TEST_F(DevicegenVerify, LeftoversOfTheOldLayoutAreReported) {
   const tooltest::RunResult run = verify();
   EXPECT_EQ(run.status, 1);
   EXPECT_NE(run.out.find("problems: 5 (left behind 5)"), std::string::npos) << run.out;
-  EXPECT_NE(run.out.find("left behind: old applications directory " + root_ + tooltest::kOldApplications +
-                         " (1 entries)"),
-            std::string::npos)
+  EXPECT_NE(
+      run.out.find("left behind: old applications directory " + root_ + tooltest::kOldApplications + " (1 entries)"),
+      std::string::npos)
       << run.out;
   EXPECT_NE(run.out.find("left behind: old container " + root_ + tooltest::kOldApplications + "/LEFTOVER"),
             std::string::npos);

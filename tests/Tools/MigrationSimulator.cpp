@@ -5,8 +5,8 @@
 
 #include "Platform/BundleReader.h"
 #include "Platform/Registry/SQLiteRegistry.h"
-#include "support/TestSupport.h"
 #include "ToolTestSupport.h"
+#include "support/TestSupport.h"
 
 namespace tooltest {
 namespace {
@@ -45,10 +45,12 @@ std::string installContainer(platform::SQLiteApplicationRegistry& registry, cons
   if (!qstest::makeDirs(staging + "/Payload")) return "mkdir " + staging;
   std::string failed = moveItem(bundle, staging + "/Payload/" + stringAt(c, "Bundle"));
   for (const std::string& name : listDirectory(container)) {
-    if (failed.empty() && name.ends_with(".vpnplugin")) failed = moveItem(container + "/" + name, staging + "/Payload/" + name);
+    if (failed.empty() && name.ends_with(".vpnplugin"))
+      failed = moveItem(container + "/" + name, staging + "/Payload/" + name);
   }
   for (const char* name : kStoreMetadataItems) {
-    if (failed.empty() && exists(container + "/" + name)) failed = moveItem(container + "/" + name, staging + "/" + name);
+    if (failed.empty() && exists(container + "/" + name))
+      failed = moveItem(container + "/" + name, staging + "/" + name);
   }
   if (!failed.empty()) return failed;
   const Dictionary options{{platform::kRegistryInstallTypeKey, Value(kInstallType)},
@@ -124,16 +126,16 @@ std::string simulateMigration(const std::string& root) {
   }
   for (const Value& v : arrayAt(manifest, "SafeHarbors")) {
     const Dictionary& h = *v.asDictionary();
-    if (!registry->QuillsetRegisterSafeHarborForContainerType(root + "/" + stringAt(h, "Path"),
-                                                              stringAt(h, "Identifier"), kHarborContainerType,
-                                                              nullptr)) {
+    if (!registry->QuillsetRegisterSafeHarborForContainerType(
+            root + "/" + stringAt(h, "Path"), stringAt(h, "Identifier"), kHarborContainerType, nullptr)) {
       return "safe harbor " + stringAt(h, "Identifier") + " refused";
     }
   }
   unlink((root + kSafeHarborMap).c_str());
   if (!removeTree(root + kOldApplications)) return "cannot remove the old applications directory";
   unlink((root + kInstallMap).c_str());
-  if (!qstest::writeFile(root + kLastSystemVersion, readBytes(root + kSystemVersion))) return "cannot record the version";
+  if (!qstest::writeFile(root + kLastSystemVersion, readBytes(root + kSystemVersion)))
+    return "cannot record the version";
   return "";
 }
 
