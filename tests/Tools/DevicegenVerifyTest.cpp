@@ -129,6 +129,34 @@ TEST_F(DevicegenVerify, RemovedFileIsReportedMissing) {
   EXPECT_NE(run.out.find("missing: " + file + " (data of " + owner + ")"), std::string::npos) << run.out;
 }
 
+TEST_F(DevicegenVerify, FileMissingFromASharedGroupContainerIsReported) {
+  migrate();
+  // A group of three applications has one new container, found through any
+  // member's record.
+  const Dictionary m = tooltest::readDictionary(root_ + tooltest::kManifest);
+  const Dictionary& group = *tooltest::arrayAt(m, "Groups")[0].asDictionary();
+  ASSERT_EQ(tooltest::arrayAt(group, "Members").size(), 3u);
+  const std::string identifier = tooltest::stringAt(group, "Identifier");
+  auto registry = platform::SQLiteApplicationRegistry::open(root_);
+  ASSERT_TRUE(registry);
+  const auto member = registry->recordForIdentifier(*tooltest::arrayAt(group, "Members")[2].asString());
+  ASSERT_TRUE(member && member->groupContainerURLs && member->groupContainerURLs->count(identifier));
+  std::string relative;
+  for (const Value& v : tooltest::arrayAt(m, "Items")) {
+    const Dictionary& item = *v.asDictionary();
+    if (tooltest::stringAt(item, "Identifier") == identifier && tooltest::stringAt(item, "Kind") == "File") {
+      relative = tooltest::stringAt(item, "Path");
+      break;
+    }
+  }
+  const std::string file = member->groupContainerURLs->at(identifier).path() + "/" + relative;
+  ASSERT_EQ(unlink(file.c_str()), 0) << file;
+  const tooltest::RunResult run = verify();
+  EXPECT_EQ(run.status, 1);
+  EXPECT_NE(run.out.find("problems: 1 (missing 1)"), std::string::npos) << run.out;
+  EXPECT_NE(run.out.find("missing: " + file + " (group " + identifier + ")"), std::string::npos) << run.out;
+}
+
 TEST_F(DevicegenVerify, RetargetedLinkIsReported) {
   migrate();
   const auto [owner, path] = firstItem("Link");
