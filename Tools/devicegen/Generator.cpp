@@ -34,11 +34,6 @@ constexpr char kHarborKeptText[] = "kept in a safe harbor\n";
 // UTF-8), so that the migration is shown to carry names as bytes.
 constexpr char kInvalidUTF8Name[] = "raw-\xFF\xFE-bytes.bin";
 constexpr size_t kArtworkBytes = 2048;
-// Positions in the configuration's list of store-metadata item names.
-constexpr size_t kStoreManifestItem = 0;
-constexpr size_t kStoreArtworkItem = 1;
-constexpr size_t kStoreMetadataItem = 2;
-constexpr size_t kStoreGeoJSONItem = 3;
 constexpr int kIconSizes[] = {29, 40, 58, 60, 76, 87, 120, 152, 180};
 
 constexpr const char* kFirstWords[] = {"Pixel", "Quill", "Harbor", "Amber",  "Cobalt", "Drift",
@@ -371,22 +366,18 @@ class ImageWriter {
 
   bool writeStoreMetadata(const AppPlan& app, const std::string& container, std::string* why) {
     if (app.storeMetadata == AppPlan::StoreMetadata::None) return true;
-    const std::vector<std::string> names = layout_.storeMetadataItemNames();
     const Dictionary metadata{{"itemId", Value(static_cast<unsigned long long>(100000 + app.index))},
                               {"itemName", app.displayName},
                               {"bundleVersion", app.version},
                               {"artistName", "Example Developer"}};
-    if (!writePlist(metadata, join(container, names.at(kStoreMetadataItem)), platform::plist::Format::XML, why))
-      return false;
+    if (!writePlist(metadata, join(container, kStoreMetadataFileName), platform::plist::Format::XML, why)) return false;
     if (app.storeMetadata == AppPlan::StoreMetadata::MetadataOnly) return true;
     std::vector<uint8_t>& artwork = buffer(kArtworkBytes);
     random_.fill(artwork.data(), kArtworkBytes);
     const Dictionary packageManifest{{"Identifier", app.identifier}, {"Version", app.version}};
-    return writePlist(packageManifest, join(container, names.at(kStoreManifestItem)), platform::plist::Format::XML,
-                      why) &&
-           writeWholeFile(join(container, names.at(kStoreArtworkItem)), artwork.data(), kArtworkBytes, kFileMode,
-                          why) &&
-           writeWholeFile(join(container, names.at(kStoreGeoJSONItem)), kGeoJSONDocument, sizeof kGeoJSONDocument - 1,
+    return writePlist(packageManifest, join(container, kStoreManifestFileName), platform::plist::Format::XML, why) &&
+           writeWholeFile(join(container, kStoreArtworkFileName), artwork.data(), kArtworkBytes, kFileMode, why) &&
+           writeWholeFile(join(container, kStoreGeoJSONFileName), kGeoJSONDocument, sizeof kGeoJSONDocument - 1,
                           kFileMode, why);
   }
 

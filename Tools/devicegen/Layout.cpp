@@ -1,7 +1,6 @@
 #include "Tools/devicegen/Layout.h"
 
 #include "Platform/SystemVersion.h"
-#include "Shared/Support/QSGlobalConfiguration.h"
 
 namespace devicegen {
 namespace {
@@ -13,12 +12,7 @@ std::string withoutTrailingSeparator(std::string path) {
 
 }  // namespace
 
-DeviceLayout::DeviceLayout(std::string root)
-    : root_(withoutTrailingSeparator(std::move(root))),
-      preferences_(root_),
-      configuration_(std::make_unique<QSGlobalConfiguration>(root_.empty() ? "/" : root_, preferences_)) {}
-
-DeviceLayout::~DeviceLayout() = default;
+DeviceLayout::DeviceLayout(std::string root) : root_(withoutTrailingSeparator(std::move(root))) {}
 
 std::string DeviceLayout::absolute(std::string_view relative) const {
   return root_ + "/" + std::string(relative);
@@ -31,17 +25,15 @@ std::string DeviceLayout::relative(std::string_view path) const {
 }
 
 std::string DeviceLayout::oldApplicationsDirectory() const {
-  return configuration_->oldContainerPath().path();
+  return absolute(kOldApplicationsRelativePath);
 }
 
 std::string DeviceLayout::installMap() const {
-  return configuration_->oldInstallMapPath().path();
+  return absolute(kInstallMapRelativePath);
 }
 
-// The path, not the accessor that creates the directory: the layout only
-// looks, the image writer makes what it needs.
 std::string DeviceLayout::dataDirectory() const {
-  return configuration_->dataDirectoryPath().path();
+  return absolute(kDataDirectoryRelativePath);
 }
 
 std::string DeviceLayout::safeHarborMap() const {
@@ -57,7 +49,7 @@ std::string DeviceLayout::systemVersionFile() const {
 }
 
 std::string DeviceLayout::systemApplicationsDirectory() const {
-  return configuration_->systemAppsDirectory().path();
+  return absolute(kSystemApplicationsRelativePath);
 }
 
 std::string DeviceLayout::oldGroupContainersDirectory() const {
@@ -70,14 +62,6 @@ std::string DeviceLayout::safeHarborsDirectory() const {
 
 std::string DeviceLayout::manifest() const {
   return absolute(kManifestFileName);
-}
-
-std::vector<std::string> DeviceLayout::userDataItemNames() const {
-  return configuration_->appUserDataItemNames();
-}
-
-std::vector<std::string> DeviceLayout::storeMetadataItemNames() const {
-  return configuration_->appBundleMetadataItemNames();
 }
 
 }  // namespace devicegen

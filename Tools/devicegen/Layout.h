@@ -1,24 +1,17 @@
-// DeviceLayout: where the parts of a device image lie under its system root.
-// The migrator's own locations (old applications directory, old install map,
-// data directory, system applications, item-name lists) come from a
-// QSGlobalConfiguration built for the root, so that the tools and the
-// migrator cannot disagree; the names below are those of the files the
-// migrator reads and writes there, and the image's own additions.
+// DeviceLayout: where the parts of a device image lie under its system root:
+// the migrator's locations (old applications directory, old install map,
+// data directory, system applications, item-name lists) as its configuration
+// builds them, the names of the files the migrator reads and writes there,
+// and the image's own additions.
 //
-// Thread safety: a DeviceLayout belongs to one thread (the configuration's
-// cached accessors take its own lock, but nothing here needs more).
+// Thread safety: a DeviceLayout is immutable after construction.
 #pragma once
 
-#include <memory>
 #include <string>
 #include <string_view>
-#include <vector>
 
 #include "AppMigrator/QSAppMigrator.h"
 #include "Platform/Foundation/URL.h"
-#include "Platform/Preferences.h"
-
-class QSGlobalConfiguration;
 
 namespace devicegen {
 
@@ -32,6 +25,19 @@ inline constexpr char kOldApplicationsNoteFileName[] = "WhereDidMyApplicationsGo
 inline constexpr char kBundleExtensionApp[] = "app";
 inline constexpr char kBundleExtensionVPNPlugin[] = "vpnplugin";
 
+// The migrator's layout, relative to the root (QSGlobalConfiguration's
+// oldContainerPath, oldInstallMapPath, dataDirectoryPath, systemAppsDirectory
+// and coreServicesDirectory for the root "/").
+inline constexpr char kOldApplicationsRelativePath[] = "private/var/mobile/Applications";
+inline constexpr char kInstallMapRelativePath[] = "private/var/mobile/Library/Caches/com.vantrel.quill.set.plist";
+inline constexpr char kDataDirectoryRelativePath[] = "private/var/quilld/Library/Quillset";
+inline constexpr char kSystemApplicationsRelativePath[] = "Applications";
+// Store-metadata items of an old container (appBundleMetadataItemNames).
+inline constexpr char kStoreManifestFileName[] = "Manifest.plist";
+inline constexpr char kStoreArtworkFileName[] = "VendraArtwork";
+inline constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
+inline constexpr char kStoreGeoJSONFileName[] = "GeoJSON";
+
 // The image's own additions, relative to the root.
 inline constexpr char kManifestFileName[] = "devicegen-manifest.plist";
 inline constexpr char kOldGroupContainersRelativePath[] = "private/var/mobile/Library/AppGroups";
@@ -42,9 +48,6 @@ class DeviceLayout {
   // `root`: an absolute path without a trailing separator ("" or "/" is the
   // real root).
   explicit DeviceLayout(std::string root);
-  ~DeviceLayout();
-  DeviceLayout(const DeviceLayout&) = delete;
-  DeviceLayout& operator=(const DeviceLayout&) = delete;
 
   const std::string& root() const { return root_; }
   // root + "/" + relative.
@@ -63,13 +66,8 @@ class DeviceLayout {
   std::string safeHarborsDirectory() const;
   std::string manifest() const;
 
-  std::vector<std::string> userDataItemNames() const;
-  std::vector<std::string> storeMetadataItemNames() const;
-
  private:
   std::string root_;
-  platform::FilePreferenceStore preferences_;
-  std::unique_ptr<QSGlobalConfiguration> configuration_;
 };
 
 }  // namespace devicegen
