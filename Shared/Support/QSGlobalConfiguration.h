@@ -16,6 +16,7 @@
 // creation.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <mutex>
 #include <optional>
@@ -23,6 +24,7 @@
 #include <string>
 #include <vector>
 
+#include "Platform/DeviceRegistry.h"
 #include "Platform/Foundation/URL.h"
 #include "Platform/Foundation/Value.h"
 #include "Platform/Preferences.h"
@@ -104,8 +106,19 @@ class QSGlobalConfiguration {
   std::optional<std::string> mountPointForDevice(uint32_t device);
   std::vector<platform::URL> diskImageApplicationsDirectories();
 
+  // The device registry that the disk-image operations ask: the process's
+  // LinuxDeviceRegistry::shared() until another one is set (tests hand in
+  // registries over synthetic trees). `registry` must outlive its use; null
+  // restores the shared one. Any thread.
+  void setDeviceRegistry(platform::DeviceRegistry* registry);
+
  private:
+  platform::DeviceRegistry& deviceRegistry() const;
+  std::optional<platform::Dictionary> cachedAppMap(std::optional<platform::Dictionary>& field,
+                                                   platform::URL (QSGlobalConfiguration::*directory)());
+
   std::string systemRoot_;
+  std::atomic<platform::DeviceRegistry*> deviceRegistry_{nullptr};
 
   // Fixed at creation.
   platform::URL _quilldPath;
