@@ -40,35 +40,43 @@ std::string hexString(const unsigned char* bytes, size_t length) {
   return text;
 }
 
+// Writes a failure line of the reader without disturbing errno, which the
+// digest's own line reports after the reader has returned.
+template <class... Args>
+void logReadFailure(const char* format, const Args&... args) {
+  const int saved = errno;
+  QS_SYSLOG(kQSLogLevelError, kReadFileFunction, format, args...);
+  errno = saved;
+}
+
 }  // namespace
 
 bool _ReadFile(const char* path, const QSReadFileConsumer& consumer) {
   platform::ReadOnlyFile file(path);
   if (!file.isOpen()) {
-    QS_SYSLOG(kQSLogLevelError, kReadFileFunction, "failed to open %s : %s", path, QSErrorText(errno));
+    logReadFailure("failed to open %s : %s", path, QSErrorText(errno));
     return false;
   }
   int64_t fileSize = 0;
   if (!file.size(&fileSize)) {
-    QS_SYSLOG(kQSLogLevelError, kReadFileFunction, "failed to stat %s : %s", path, QSErrorText(errno));
+    logReadFailure("failed to stat %s : %s", path, QSErrorText(errno));
     return false;
   }
   const long bufferSize = static_cast<long>(std::min(fileSize, kReadChunkLimit));
   HeapBuffer buffer(static_cast<uint8_t*>(std::malloc(static_cast<size_t>(bufferSize))));
   if (!buffer && bufferSize > 0) {
-    QS_SYSLOG(kQSLogLevelError, kReadFileFunction, "malloc failed for %ld bytes: %s", bufferSize, QSErrorText(errno));
+    logReadFailure("malloc failed for %ld bytes: %s", bufferSize, QSErrorText(errno));
     return false;
   }
   for (int64_t offset = 0; offset < fileSize;) {
     const size_t want = static_cast<size_t>(std::min<int64_t>(bufferSize, fileSize - offset));
     const int64_t got = file.read(buffer.get(), want);
     if (got == -1) {
-      QS_SYSLOG(kQSLogLevelError, kReadFileFunction, "read failed for %s : %s", path, QSErrorText(errno));
+      logReadFailure("read failed for %s : %s", path, QSErrorText(errno));
       return false;
     }
     if (got < 1) {
-      QS_SYSLOG(kQSLogLevelError, kReadFileFunction, "read failed for %s, got %lld bytes", path,
-                static_cast<long long>(got));
+      logReadFailure("read failed for %s, got %lld bytes", path, static_cast<long long>(got));
       return false;
     }
     if (!consumer(buffer.get(), static_cast<size_t>(got))) return false;

@@ -83,6 +83,20 @@ TEST_F(Digest, MissingFileWritesTheReaderLineThenTheDigestLine) {
   EXPECT_EQ(lines[1].message, "Failed to read " + url.description() + " : No such file or directory");
 }
 
+TEST_F(Digest, DigestLineKeepsTheReadersErrnoWhenTheLogChangesIt) {
+  std::vector<std::string> messages;
+  // A sink that disturbs errno, as syslog may.
+  platform::SystemLogSink previous = platform::setSystemLogSink([&messages](const platform::SystemLogLine& line) {
+    messages.push_back(line.message);
+    errno = EBADF;
+  });
+  std::string path = dir_ / "missing";
+  EXPECT_EQ(QSCreateSHA256Digest(path), std::nullopt);
+  platform::setSystemLogSink(previous);
+  ASSERT_EQ(messages.size(), 2u);
+  EXPECT_EQ(messages[1], "Failed to read file://" + path + " : No such file or directory");
+}
+
 TEST_F(Digest, DirectoryFailsAtTheFirstRead) {
   std::string path = dir_ / "sub";
   ASSERT_TRUE(qstest::makeDirs(path));
