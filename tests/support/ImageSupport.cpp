@@ -3,6 +3,7 @@
 #include <png.h>
 
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <iterator>
 
@@ -26,6 +27,7 @@ std::optional<platform::Image> decodePNG(const platform::Data& bytes) {
 }
 
 std::optional<platform::Image> decodePNGFile(const std::string& path) {
+  if (!std::filesystem::is_regular_file(path)) return std::nullopt;
   std::ifstream in(path, std::ios::binary);
   if (!in) return std::nullopt;
   platform::Data bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
