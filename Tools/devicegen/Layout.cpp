@@ -1,6 +1,7 @@
 #include "Tools/devicegen/Layout.h"
 
 #include "Platform/SystemVersion.h"
+#include "Shared/Support/QSGlobalConfiguration.h"
 
 namespace devicegen {
 namespace {
@@ -12,7 +13,12 @@ std::string withoutTrailingSeparator(std::string path) {
 
 }  // namespace
 
-DeviceLayout::DeviceLayout(std::string root) : root_(withoutTrailingSeparator(std::move(root))) {}
+DeviceLayout::DeviceLayout(std::string root)
+    : root_(withoutTrailingSeparator(std::move(root))),
+      preferences_(root_),
+      configuration_(std::make_unique<QSGlobalConfiguration>(root_.empty() ? "/" : root_, preferences_)) {}
+
+DeviceLayout::~DeviceLayout() = default;
 
 std::string DeviceLayout::absolute(std::string_view relative) const {
   return root_ + "/" + std::string(relative);
@@ -25,15 +31,17 @@ std::string DeviceLayout::relative(std::string_view path) const {
 }
 
 std::string DeviceLayout::oldApplicationsDirectory() const {
-  return absolute(kOldApplicationsRelativePath);
+  return configuration_->oldContainerPath().path();
 }
 
 std::string DeviceLayout::installMap() const {
-  return absolute(kInstallMapRelativePath);
+  return configuration_->oldInstallMapPath().path();
 }
 
+// The path, not the accessor that creates the directory: the layout only
+// names places, the image writer makes what it needs.
 std::string DeviceLayout::dataDirectory() const {
-  return absolute(kDataDirectoryRelativePath);
+  return configuration_->dataDirectoryPath().path();
 }
 
 std::string DeviceLayout::safeHarborMap() const {
@@ -49,7 +57,7 @@ std::string DeviceLayout::systemVersionFile() const {
 }
 
 std::string DeviceLayout::systemApplicationsDirectory() const {
-  return absolute(kSystemApplicationsRelativePath);
+  return configuration_->systemAppsDirectory().path();
 }
 
 std::string DeviceLayout::oldGroupContainersDirectory() const {

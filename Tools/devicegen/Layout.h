@@ -4,14 +4,21 @@
 // builds them, the names of the files the migrator reads and writes there,
 // and the image's own additions.
 //
-// Thread safety: a DeviceLayout is immutable after construction.
+// The migrator's own locations come from a QSGlobalConfiguration built for
+// the root, so that the tools and the migrator cannot disagree.
+//
+// Thread safety: a DeviceLayout belongs to one thread.
 #pragma once
 
+#include <memory>
 #include <string>
 #include <string_view>
 
 #include "AppMigrator/QSAppMigrator.h"
 #include "Platform/Foundation/URL.h"
+#include "Platform/Preferences.h"
+
+class QSGlobalConfiguration;
 
 namespace devicegen {
 
@@ -25,13 +32,6 @@ inline constexpr char kOldApplicationsNoteFileName[] = "WhereDidMyApplicationsGo
 inline constexpr char kBundleExtensionApp[] = "app";
 inline constexpr char kBundleExtensionVPNPlugin[] = "vpnplugin";
 
-// The migrator's layout, relative to the root (QSGlobalConfiguration's
-// oldContainerPath, oldInstallMapPath, dataDirectoryPath, systemAppsDirectory
-// and coreServicesDirectory for the root "/").
-inline constexpr char kOldApplicationsRelativePath[] = "private/var/mobile/Applications";
-inline constexpr char kInstallMapRelativePath[] = "private/var/mobile/Library/Caches/com.vantrel.quill.set.plist";
-inline constexpr char kDataDirectoryRelativePath[] = "private/var/quilld/Library/Quillset";
-inline constexpr char kSystemApplicationsRelativePath[] = "Applications";
 // Store-metadata items of an old container (appBundleMetadataItemNames).
 inline constexpr char kStoreManifestFileName[] = "Manifest.plist";
 inline constexpr char kStoreArtworkFileName[] = "VendraArtwork";
@@ -48,6 +48,9 @@ class DeviceLayout {
   // `root`: an absolute path without a trailing separator ("" or "/" is the
   // real root).
   explicit DeviceLayout(std::string root);
+  ~DeviceLayout();
+  DeviceLayout(const DeviceLayout&) = delete;
+  DeviceLayout& operator=(const DeviceLayout&) = delete;
 
   const std::string& root() const { return root_; }
   // root + "/" + relative.
@@ -68,6 +71,8 @@ class DeviceLayout {
 
  private:
   std::string root_;
+  platform::FilePreferenceStore preferences_;
+  std::unique_ptr<QSGlobalConfiguration> configuration_;
 };
 
 }  // namespace devicegen
