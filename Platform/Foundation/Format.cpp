@@ -12,7 +12,7 @@ std::atomic<uint64_t> gMismatches{0};
 
 void noteMismatch() { gMismatches.fetch_add(1, std::memory_order_relaxed); }
 
-struct Spec {
+struct Directive {
   std::string flags;
   int width = -1;
   int precision = -1;
@@ -20,20 +20,20 @@ struct Spec {
   char conversion = 0;
 };
 
-// Pads `text` to the spec's width, honouring the "-" flag.
-std::string pad(std::string text, const Spec& spec) {
-  if (spec.width > 0 && static_cast<int>(text.size()) < spec.width) {
-    std::string fill(spec.width - text.size(), ' ');
-    bool left = spec.flags.find('-') != std::string::npos;
+// Pads `text` to the directive's width, honouring the "-" flag.
+std::string pad(std::string text, const Directive& directive) {
+  if (directive.width > 0 && static_cast<int>(text.size()) < directive.width) {
+    std::string fill(directive.width - text.size(), ' ');
+    bool left = directive.flags.find('-') != std::string::npos;
     text = left ? text + fill : fill + text;
   }
   return text;
 }
 
-std::string printfSpec(const Spec& spec, const char* length, char conversion) {
-  std::string f = "%" + spec.flags;
-  if (spec.width >= 0) f += std::to_string(spec.width);
-  if (spec.precision >= 0) f += "." + std::to_string(spec.precision);
+std::string printfDirective(const Directive& directive, const char* length, char conversion) {
+  std::string f = "%" + directive.flags;
+  if (directive.width >= 0) f += std::to_string(directive.width);
+  if (directive.precision >= 0) f += "." + std::to_string(directive.precision);
   f += length;
   f += conversion;
   return f;
@@ -59,26 +59,26 @@ int lengthBits(const std::string& length) {
   return 64;
 }
 
-std::string formatSigned(const Spec& spec, const FormatArg& arg) {
+std::string formatSigned(const Directive& directive, const FormatArg& arg) {
   int64_t v = arg.signedValue();
-  switch (lengthBits(spec.length)) {
+  switch (lengthBits(directive.length)) {
     case 8: v = static_cast<int8_t>(v); break;
     case 16: v = static_cast<int16_t>(v); break;
     case 32: v = static_cast<int32_t>(v); break;
     default: break;
   }
-  return snprintfOne(printfSpec(spec, "ll", 'd'), static_cast<long long>(v));
+  return snprintfOne(printfDirective(directive, "ll", 'd'), static_cast<long long>(v));
 }
 
-std::string formatUnsigned(const Spec& spec, const FormatArg& arg, char conversion) {
+std::string formatUnsigned(const Directive& directive, const FormatArg& arg, char conversion) {
   uint64_t v = arg.unsignedValue();
-  switch (lengthBits(spec.length)) {
+  switch (lengthBits(directive.length)) {
     case 8: v = static_cast<uint8_t>(v); break;
     case 16: v = static_cast<uint16_t>(v); break;
     case 32: v = static_cast<uint32_t>(v); break;
     default: break;
   }
-  return snprintfOne(printfSpec(spec, "ll", conversion), static_cast<unsigned long long>(v));
+  return snprintfOne(printfDirective(directive, "ll", conversion), static_cast<unsigned long long>(v));
 }
 
 // The text of an argument printed where it does not belong.
@@ -94,38 +94,38 @@ std::string fallbackText(const FormatArg& arg) {
   return "";
 }
 
-std::string render(const Spec& spec, const FormatArg* arg) {
+std::string render(const Directive& directive, const FormatArg* arg) {
   if (!arg) {
     noteMismatch();
     return "<missing>";
   }
   using K = FormatArg::Kind;
   const bool integer = arg->kind() == K::Signed || arg->kind() == K::Unsigned;
-  switch (spec.conversion) {
+  switch (directive.conversion) {
     case '@':
       if (arg->kind() == K::Object || arg->kind() == K::CString) {
-        return pad(arg->isNull() ? "(null)" : arg->text(), spec);
+        return pad(arg->isNull() ? "(null)" : arg->text(), directive);
       }
       break;
     case 's':
       if (arg->kind() == K::CString || (arg->kind() == K::Object && arg->isNull())) {
         std::string text = arg->isNull() ? "(null)" : arg->text();
-        if (spec.precision >= 0 && static_cast<size_t>(spec.precision) < text.size()) text.resize(spec.precision);
-        return pad(text, spec);
+        if (directive.precision >= 0 && static_cast<size_t>(directive.precision) < text.size()) text.resize(directive.precision);
+        return pad(text, directive);
       }
       break;
     case 'd':
     case 'i':
-      if (integer) return formatSigned(spec, *arg);
+      if (integer) return formatSigned(directive, *arg);
       break;
     case 'u':
     case 'x':
     case 'X':
     case 'o':
-      if (integer) return formatUnsigned(spec, *arg, spec.conversion);
+      if (integer) return formatUnsigned(directive, *arg, directive.conversion);
       break;
     case 'c':
-      if (integer) return pad(std::string(1, static_cast<char>(arg->signedValue())), spec);
+      if (integer) return pad(std::string(1, static_cast<char>(arg->signedValue())), directive);
       break;
     case 'f':
     case 'F':
@@ -133,21 +133,21 @@ std::string render(const Spec& spec, const FormatArg* arg) {
     case 'G':
     case 'e':
     case 'E':
-      if (arg->kind() == K::Real) return snprintfOne(printfSpec(spec, "", spec.conversion), arg->realValue());
+      if (arg->kind() == K::Real) return snprintfOne(printfDirective(directive, "", directive.conversion), arg->realValue());
       if (integer) {
         noteMismatch();
-        return snprintfOne(printfSpec(spec, "", spec.conversion), static_cast<double>(arg->signedValue()));
+        return snprintfOne(printfDirective(directive, "", directive.conversion), static_cast<double>(arg->signedValue()));
       }
       break;
     case 'p':
       if (arg->kind() == K::Pointer || integer) {
-        return pad(snprintfOne(std::string("%#llx"), static_cast<unsigned long long>(arg->unsignedValue())), spec);
+        return pad(snprintfOne(std::string("%#llx"), static_cast<unsigned long long>(arg->unsignedValue())), directive);
       }
       break;
     default: break;
   }
   noteMismatch();
-  return pad(fallbackText(*arg), spec);
+  return pad(fallbackText(*arg), directive);
 }
 
 }  // namespace
@@ -168,40 +168,40 @@ std::string FormatV(const char* format, FormatArgs args) {
       out += '%';
       continue;
     }
-    Spec spec;
-    while (*p && std::strchr("-+ #0'", *p)) spec.flags += *p++;
+    Directive directive;
+    while (*p && std::strchr("-+ #0'", *p)) directive.flags += *p++;
     if (*p == '*') {
       const FormatArg* w = take();
-      spec.width = w ? static_cast<int>(w->signedValue()) : 0;
+      directive.width = w ? static_cast<int>(w->signedValue()) : 0;
       ++p;
     } else {
-      while (*p >= '0' && *p <= '9') spec.width = (spec.width < 0 ? 0 : spec.width * 10) + (*p++ - '0');
+      while (*p >= '0' && *p <= '9') directive.width = (directive.width < 0 ? 0 : directive.width * 10) + (*p++ - '0');
     }
     if (*p == '.') {
       ++p;
-      spec.precision = 0;
+      directive.precision = 0;
       if (*p == '*') {
         const FormatArg* w = take();
-        spec.precision = w ? static_cast<int>(w->signedValue()) : 0;
+        directive.precision = w ? static_cast<int>(w->signedValue()) : 0;
         ++p;
       } else {
-        while (*p >= '0' && *p <= '9') spec.precision = spec.precision * 10 + (*p++ - '0');
+        while (*p >= '0' && *p <= '9') directive.precision = directive.precision * 10 + (*p++ - '0');
       }
     }
-    while (*p && std::strchr("hlzjtqL", *p)) spec.length += *p++;
+    while (*p && std::strchr("hlzjtqL", *p)) directive.length += *p++;
     if (!*p) {
       // A lone "%" at the end: printed as written.
       noteMismatch();
       out.append(start);
       break;
     }
-    spec.conversion = *p;
-    if (!std::strchr("@sdiuxXocfFgGeEp", spec.conversion)) {
+    directive.conversion = *p;
+    if (!std::strchr("@sdiuxXocfFgGeEp", directive.conversion)) {
       noteMismatch();
       out.append(start, p + 1);
       continue;
     }
-    out += render(spec, take());
+    out += render(directive, take());
   }
   if (next < args.size()) noteMismatch();
   return out;
