@@ -216,9 +216,29 @@ class MigratorTest : public testing::Test {
 
   std::unique_ptr<QSAppMigrator> createMigrator();
 
+  // Host-log lines whose message is exactly `message`.
+  std::vector<platform::HostLogLine> hostLines(const std::string& message) const;
+  size_t hostLineCount(const std::string& message) const { return hostLines(message).size(); }
+  // Messages of the host-log lines that start with `prefix`, in order.
+  std::vector<std::string> hostMessagesStartingWith(const std::string& prefix) const;
+
   std::unique_ptr<TempDir> scratch_;  // fakes' containers and the temporary directory
   std::unique_ptr<FakePlatform> platform_;
   std::unique_ptr<LogCapture> log_;
+};
+
+// A fresh directory on /dev/shm (another file system than the test root's),
+// removed with everything in it when the object goes away.
+class TempDirOnSharedMemory {
+ public:
+  TempDirOnSharedMemory();
+  ~TempDirOnSharedMemory();
+  TempDirOnSharedMemory(const TempDirOnSharedMemory&) = delete;
+  TempDirOnSharedMemory& operator=(const TempDirOnSharedMemory&) = delete;
+  const std::string& path() const { return path_; }
+
+ private:
+  std::string path_;
 };
 
 bool pathExists(const std::string& path);  // lstat
