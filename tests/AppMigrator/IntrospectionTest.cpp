@@ -22,9 +22,10 @@ class Introspection : public MigratorTest {
  protected:
   void SetUp() override {
     MigratorTest::SetUp();
-    ASSERT_TRUE(makeDirs(oldApplicationsPath()));
     migrator_ = createMigrator();
     ASSERT_NE(migrator_, nullptr);
+    // Made after creation, which would remove it while empty.
+    ASSERT_TRUE(makeDirs(oldApplicationsPath()));
   }
 
   std::optional<Dictionary> introspect(const std::string& path, bool* flag) {
@@ -92,12 +93,14 @@ TEST_F(Introspection, ChildWhoseStatusCannotBeReadLeavesContainerInPlace) {
 }
 
 TEST_F(Introspection, ApplicationAndVPNPluginInEitherListingOrder) {
-  // Enough containers that both listing orders occur among them.
+  // Enough name pairs that both listing orders occur among them.
   bool sawApplicationFirst = false, sawPluginFirst = false;
   for (int i = 0; i < 16; ++i) {
     const std::string container = makeContainer("both" + std::to_string(i));
-    makeBundle(container + "/Main.app", "com.example.main");
-    makeBundle(container + "/Tunnel.vpnplugin", "com.example.tunnel");
+    const std::string application = container + "/Main" + std::to_string(i) + ".app";
+    const std::string plugin = container + "/Tunnel" + std::to_string(i) + ".vpnplugin";
+    makeBundle(application, "com.example.main");
+    makeBundle(plugin, "com.example.tunnel");
     auto children = QSFileManager::defaultManager().urlsForItemsInDirectoryAtURL(URL::fileURL(container, true), false);
     ASSERT_TRUE(children.has_value());
     for (const URL& child : *children) {
@@ -111,8 +114,7 @@ TEST_F(Introspection, ApplicationAndVPNPluginInEitherListingOrder) {
     auto info = introspect(container, &flag);
     ASSERT_TRUE(info.has_value());
     EXPECT_TRUE(flag);
-    EXPECT_EQ(*info, containerInfo(container, container + "/Main.app", "com.example.main", "App",
-                                   container + "/Tunnel.vpnplugin"));
+    EXPECT_EQ(*info, containerInfo(container, application, "com.example.main", "App", plugin));
   }
   EXPECT_TRUE(sawApplicationFirst && sawPluginFirst) << "the directory gave only one order";
 }

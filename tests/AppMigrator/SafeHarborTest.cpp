@@ -76,20 +76,22 @@ TEST_F(SafeHarbors, RefusedRegistrationKeepsTheMapAndTheOthersAreStillTried) {
 }
 
 TEST_F(SafeHarbors, MalformedEntriesAreSkippedAndTheMapStillGoes) {
-  writePlist(harborMapPath(),
-             Value(Dictionary{{"com.example.array", Value(platform::makeStringArray({"/harbor"}))},
-                              {"com.example.nopath", Value(Dictionary{{"Other", Value("/harbor")}})},
-                              {"com.example.number", Value(Dictionary{{"HarborPathKey", Value(3)}})},
-                              {"com.example.good", entry("/harbor/good")}}));
+  const Value noPath(Dictionary{{"Other", Value("/harbor")}});
+  const Value numericPath(Dictionary{{"HarborPathKey", Value(3)}});
+  writePlist(harborMapPath(), Value(Dictionary{{"com.example.array", Value(platform::makeStringArray({"/harbor"}))},
+                                               {"com.example.nopath", noPath},
+                                               {"com.example.number", numericPath},
+                                               {"com.example.good", entry("/harbor/good")}}));
   EXPECT_TRUE(migrate());
   ASSERT_EQ(platform_->daemon.safeHarborCalls.size(), 1u);
   EXPECT_EQ(platform_->daemon.safeHarborCalls[0].identifier, "com.example.good");
   EXPECT_EQ(hostLineCount("QSAppMigrator: Failed to get harbor info for identifier com.example.array"), 1u);
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Failed to get harbor path from harbor entry for com.example.nopath : "
-                          "{Other = /harbor; }"),
+  // The entry is printed as the dictionary it is.
+  EXPECT_EQ(hostLineCount("QSAppMigrator: Failed to get harbor path from harbor entry for com.example.nopath : " +
+                          noPath.description()),
             1u);
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Failed to get harbor path from harbor entry for com.example.number : "
-                          "{HarborPathKey = 3; }"),
+  EXPECT_EQ(hostLineCount("QSAppMigrator: Failed to get harbor path from harbor entry for com.example.number : " +
+                          numericPath.description()),
             1u);
   EXPECT_FALSE(pathExists(harborMapPath()));
 }
