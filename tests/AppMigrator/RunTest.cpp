@@ -176,6 +176,29 @@ TEST_F(MigrationRun, RunWithoutOldLayoutSucceedsAndRecordsSystemVersion) {
   EXPECT_EQ(hostLineCount(kReturningFailed), 0u);
 }
 
+TEST_F(MigrationRun, SuccessfulRunMovesEverythingAndRemovesTheOldLayout) {
+  const std::string container = makeAppContainer("A", "com.example.a");
+  ASSERT_TRUE(makeDirs(container + "/Documents"));
+  ASSERT_TRUE(writeFile(container + "/Documents/letter", "dear"));
+  makeVPNContainer("B", "com.example.b");
+  writeInstallMap(Dictionary{});
+  auto migrator = createMigrator();
+  ASSERT_NE(migrator, nullptr);
+
+  EXPECT_TRUE(migrator->performMigration()) << testing::PrintToString(log_->hostMessages());
+  EXPECT_EQ(migrator->countItemsMigrated(), 2u);
+  EXPECT_EQ(readFile(platform_->registry.dataContainerPath("com.example.a") + "/Documents/letter"), "dear");
+  for (const char* identifier : {"com.example.a", "com.example.b"}) {
+    auto record = platform_->registry.storedRecord(identifier);
+    ASSERT_TRUE(record.has_value()) << identifier;
+    EXPECT_FALSE(record->isPlaceholder) << identifier;
+  }
+  EXPECT_FALSE(pathExists(oldApplicationsPath()));
+  EXPECT_FALSE(pathExists(oldInstallMapPath()));
+  EXPECT_EQ(readPlist(versionRecordPath()), platform_->systemVersion.dictionary);
+  EXPECT_TRUE(hostMessagesStartingWith("QSAppMigrator: Failed").empty());
+}
+
 TEST_F(MigrationRun, NoteFileAloneIsRemovedAndOldLayoutGoes) {
   ASSERT_TRUE(makeDirs(oldApplicationsPath()));
   ASSERT_TRUE(writeFile(oldApplicationsPath() + "/WhereDidMyApplicationsGo.txt", "elsewhere"));
