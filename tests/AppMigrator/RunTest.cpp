@@ -180,7 +180,9 @@ TEST_F(MigrationRun, SuccessfulRunMovesEverythingAndRemovesTheOldLayout) {
   const std::string container = makeAppContainer("A", "com.example.a");
   ASSERT_TRUE(makeDirs(container + "/Documents"));
   ASSERT_TRUE(writeFile(container + "/Documents/letter", "dear"));
+  // A VPN plug-in gets no placeholder: it must be known to the registry already.
   makeVPNContainer("B", "com.example.b");
+  platform_->registry.addInstalledApplication("com.example.b");
   writeInstallMap(Dictionary{});
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
