@@ -2,8 +2,10 @@
 #include <fcntl.h>
 #include <fts.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 
 #include "Shared/FileManager/QSFileManager.h"
@@ -28,6 +30,23 @@ constexpr char kDestinationOfSymlinkFn[] = "-[QSFileManager destinationOfSymboli
 constexpr int kWalkOptions = FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV;
 
 constexpr mode_t kPermissionBits = 07777;
+
+// fchmodat2, the system call that takes AT_SYMLINK_NOFOLLOW itself (Linux 6.6).
+// glibc 2.36 emulates the flag through an O_PATH descriptor and /proc, four
+// system calls per item; the call does it in one.
+constexpr long kFchmodat2Syscall = 452;
+
+// Changes the mode of the item at `path` itself, never of a link's target.
+// Returns 0 or -1 with errno, as fchmodat does.
+int changeModeNoFollow(const char* path, mode_t mode) {
+  static std::atomic<bool> kernelHasFchmodat2{true};
+  if (kernelHasFchmodat2.load(std::memory_order_relaxed)) {
+    long rc = syscall(kFchmodat2Syscall, AT_FDCWD, path, mode, AT_SYMLINK_NOFOLLOW);
+    if (rc == 0 || errno != ENOSYS) return rc == 0 ? 0 : -1;
+    kernelHasFchmodat2.store(false, std::memory_order_relaxed);
+  }
+  return fchmodat(AT_FDCWD, path, mode, AT_SYMLINK_NOFOLLOW);
+}
 constexpr mode_t kStandardDirectoryMode = 0755;
 constexpr mode_t kStandardItemMode = 0644;
 
@@ -156,7 +175,7 @@ bool QSFileManager::standardizeOwnershipAtURL(const URL& url, uint32_t toUID, ui
     if ((entry.status.st_mode & kPermissionBits) != wanted) {
       // Not following a link: the item may have been swapped for one since it
       // was visited.
-      if (fchmodat(AT_FDCWD, path, wanted, AT_SYMLINK_NOFOLLOW) != 0) {
+      if (changeModeNoFollow(path, wanted) != 0) {
         QS_SYSLOG(kQSLogLevelError, kStandardizeStepFn, "Could not chmod %s: %s", entry.path, QSErrorText(errno));
       }
     }
