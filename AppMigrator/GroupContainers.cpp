@@ -13,7 +13,6 @@ namespace {
 
 constexpr char kMigrateFunction[] = "-[QSAppMigrator _migrateGroupContainersForIdentifier:]";
 constexpr char kMoveAllFunction[] = "-[QSAppMigrator _moveAllItemsInGroupContainerURL:toGroupContainerURL:]";
-constexpr char kGroupContainerPathKey[] = "Container";
 
 // Moves every item of `source` into `destination`, replacing (never merging)
 // an item of the same name. False only when `source` cannot be listed;
@@ -78,7 +77,7 @@ void QSAppMigrator::_migrateGroupContainer(const std::string& identifier, const 
              identifier, group);
     return;
   }
-  const platform::Value* path = entry->second.get(kGroupContainerPathKey);
+  const platform::Value* path = entry->second.get(kQSGroupContainerPathKey);
   if (!path || !path->isString()) {
     QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: Failed to get path to group container for %@[%@]",
              identifier, group);

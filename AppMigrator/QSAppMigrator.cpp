@@ -24,11 +24,6 @@ namespace {
 constexpr char kInitFunction[] = "-[QSAppMigrator init]";
 constexpr char kPerformMigrationFunction[] = "-[QSAppMigrator performMigration]";
 
-constexpr char kInstallMapGroupContainersKey[] = "GroupContainers";
-constexpr char kLastSystemVersionFileName[] = "AppMigratorLastSystemVersion.plist";
-// A note the previous release may leave among the containers; not a container.
-constexpr char kOldApplicationsNoteFileName[] = "WhereDidMyApplicationsGo.txt";
-
 // estimatedDuration = entries * kDurationPerEntry + kBaseDuration.
 constexpr float kBaseDuration = 20.0f;
 constexpr float kDurationPerEntry = 2.25f;
@@ -86,7 +81,7 @@ void QSAppMigrator::_loadInstallMap() {
     return;
   }
   _installMap = std::move(*installMap);
-  const Value* groups = QSValueForKey(*_installMap, kInstallMapGroupContainersKey);
+  const Value* groups = QSValueForKey(*_installMap, kQSInstallMapGroupContainersKey);
   if (groups && groups->isDictionary()) {
     _groupContainerMap = *groups->asDictionary();
   } else {
@@ -105,7 +100,7 @@ void QSAppMigrator::_loadHarborMap() {
 }
 
 void QSAppMigrator::_loadLastSystemVersion() {
-  const URL recordURL = QSGlobalConfiguration::sharedInstance().dataDirectory().appending(kLastSystemVersionFileName);
+  const URL recordURL = QSGlobalConfiguration::sharedInstance().dataDirectory().appending(kQSLastSystemVersionFileName);
   std::optional<Dictionary> record = platform::plist::readDictionary(recordURL);
   if (!record) return;
   // Kept for diagnosis only, whatever its type: nothing branches on it.
@@ -175,7 +170,7 @@ std::deque<Dictionary> QSAppMigrator::_introspectItemsToMigrate() {
   std::deque<Dictionary> workList;
   for (const URL& entry : *_itemsToMigrate) {
     QSAM_LOG(kQSLogLevelNotice, kPerformMigrationFunction, "QSAppMigrator: Introspecting %@", entry.path());
-    if (entry.lastPathComponent() == kOldApplicationsNoteFileName) {
+    if (entry.lastPathComponent() == kQSOldApplicationsNoteFileName) {
       // Not a container; whether it goes is decided by the final re-listing.
       (void)fileManager.removeItemAtURL(entry);
       ++_countItemsMigrated;
@@ -243,7 +238,7 @@ bool QSAppMigrator::_removeOldLayoutIfEmpty() {
 }
 
 void QSAppMigrator::_recordCurrentSystemVersion() {
-  const URL recordURL = QSGlobalConfiguration::sharedInstance().dataDirectory().appending(kLastSystemVersionFileName);
+  const URL recordURL = QSGlobalConfiguration::sharedInstance().dataDirectory().appending(kQSLastSystemVersionFileName);
   std::optional<Dictionary> systemVersion = services_.systemVersion->systemVersionDictionary();
   if (!systemVersion || !platform::plist::writeFile(Value(*systemVersion), recordURL, platform::plist::Format::XML,
                                                     /*atomically=*/true)) {

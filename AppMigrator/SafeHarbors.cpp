@@ -10,7 +10,6 @@ using platform::Value;
 namespace {
 
 constexpr char kMigrateSafeHarborsFunction[] = "-[QSAppMigrator _migrateSafeHarbors]";
-constexpr char kHarborPathKey[] = "HarborPathKey";
 // The daemon's container-type code for a harbor registered by the migrator.
 constexpr int kSafeHarborContainerType = 2;
 
@@ -29,7 +28,7 @@ bool QSAppMigrator::_migrateSafeHarbors() {
                "QSAppMigrator: Failed to get harbor info for identifier %@", identifier);
       continue;
     }
-    const std::string* path = QSStringForKey(*harbor, kHarborPathKey);
+    const std::string* path = QSStringForKey(*harbor, kQSHarborPathKey);
     if (!path) {
       QSAM_LOG(kQSLogLevelError, kMigrateSafeHarborsFunction,
                "QSAppMigrator: Failed to get harbor path from harbor entry for %@ : %@", identifier, entry);

@@ -415,21 +415,21 @@ class ImageWriter {
   }
 
   bool writeOldApplicationsNote(std::string* why) {
-    return writeWholeFile(join(layout_.oldApplicationsDirectory(), kOldApplicationsNoteFileName), kOldApplicationsNote,
+    return writeWholeFile(join(layout_.oldApplicationsDirectory(), kQSOldApplicationsNoteFileName), kOldApplicationsNote,
                           sizeof kOldApplicationsNote - 1, kFileMode, why);
   }
 
   bool writeInstallMap(std::string* why) {
     Dictionary groups, users;
     for (const ManifestGroup& group : manifest_.groups) {
-      groups[group.identifier] = Dictionary{{kInstallMapContainerKey, layout_.absolute(group.containerPath)}};
+      groups[group.identifier] = Dictionary{{kQSGroupContainerPathKey, layout_.absolute(group.containerPath)}};
     }
     for (const ManifestContainer& c : manifest_.containers) {
       if (c.kind == ManifestContainer::Kind::Application) {
-        users[c.identifier] = Dictionary{{kInstallMapContainerKey, layout_.absolute(c.containerPath)}};
+        users[c.identifier] = Dictionary{{kQSGroupContainerPathKey, layout_.absolute(c.containerPath)}};
       }
     }
-    const Dictionary map{{kInstallMapGroupContainersKey, std::move(groups)}, {kInstallMapUserKey, std::move(users)}};
+    const Dictionary map{{kQSInstallMapGroupContainersKey, std::move(groups)}, {kInstallMapUserKey, std::move(users)}};
     return writePlist(map, layout_.installMap(), platform::plist::Format::XML, why);
   }
 
@@ -444,7 +444,7 @@ class ImageWriter {
           !writeWholeFile(kept, kHarborKeptText, sizeof kHarborKeptText - 1, kFileMode, why)) {
         return false;
       }
-      map[identifier] = Dictionary{{kHarborPathKey, directory}};
+      map[identifier] = Dictionary{{kQSHarborPathKey, directory}};
       manifest_.harbors.push_back({identifier, layout_.relative(directory)});
     }
     return writePlist(map, layout_.safeHarborMap(), platform::plist::Format::XML, why);

@@ -49,7 +49,7 @@ std::string DeviceLayout::safeHarborMap() const {
 }
 
 std::string DeviceLayout::lastSystemVersionRecord() const {
-  return dataDirectory() + "/" + kLastSystemVersionFileName;
+  return dataDirectory() + "/" + kQSLastSystemVersionFileName;
 }
 
 std::string DeviceLayout::systemVersionFile() const {

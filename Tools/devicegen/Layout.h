@@ -23,12 +23,7 @@ class QSGlobalConfiguration;
 namespace devicegen {
 
 // Files and keys the migrator reads and writes.
-inline constexpr char kInstallMapGroupContainersKey[] = "GroupContainers";
-inline constexpr char kInstallMapContainerKey[] = "Container";
 inline constexpr char kInstallMapUserKey[] = "User";
-inline constexpr char kHarborPathKey[] = "HarborPathKey";
-inline constexpr char kLastSystemVersionFileName[] = "AppMigratorLastSystemVersion.plist";
-inline constexpr char kOldApplicationsNoteFileName[] = "WhereDidMyApplicationsGo.txt";
 inline constexpr char kBundleExtensionApp[] = "app";
 inline constexpr char kBundleExtensionVPNPlugin[] = "vpnplugin";
 
