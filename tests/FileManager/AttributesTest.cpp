@@ -1,22 +1,12 @@
 // Data-protection classes and the bundle attributes on real files.
-#include <sys/stat.h>
-#include <sys/xattr.h>
-#include <unistd.h>
 
-#include <cerrno>
 #include <cstdint>
-#include <cstring>
-#include <string>
 #include <vector>
-
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/DataProtection.h"
 #include "Shared/FileManager/QSFileManager.h"
-#include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
-#include "support/TestSupport.h"
 
 using platform::Error;
 using platform::URL;
@@ -58,13 +48,6 @@ class AttributesFixture : public testing::Test {
 
 using AttributesClass = AttributesFixture;
 
-TEST_F(AttributesClass, ItemWithoutAClassReadsZero) {
-  int32_t cls = 99;
-  Error error;
-  ASSERT_TRUE(fm_.dataProtectionClassOfItemAtURL(URL::fileURL(file_), &cls, &error));
-  EXPECT_EQ(cls, 0);
-}
-
 TEST_F(AttributesClass, SetClassReadsBackOnFilesAndDirectories) {
   for (const std::string& path : {file_, bundle_}) {
     ASSERT_TRUE(fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(path), 3, nullptr));
@@ -95,13 +78,6 @@ TEST_F(AttributesClass, RefusingPredicateSeesTheCurrentClassAndChangesNothing) {
   EXPECT_EQ(cls, 2);
 }
 
-TEST_F(AttributesClass, AgreeingPredicateLetsTheClassChange) {
-  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(file_), 4, [](int32_t c) { return c == 0; }));
-  int32_t cls = 0;
-  ASSERT_TRUE(fm_.dataProtectionClassOfItemAtURL(URL::fileURL(file_), &cls));
-  EXPECT_EQ(cls, 4);
-}
-
 TEST_F(AttributesClass, SymbolicLinkFailsAtTheOpen) {
   std::string link = tmp_ / "link";
   ASSERT_EQ(symlink(file_.c_str(), link.c_str()), 0);
@@ -117,14 +93,6 @@ TEST_F(AttributesClass, SymbolicLinkFailsAtTheOpen) {
   }
   EXPECT_EQ(attribute(file_, qsfs::kDataProtectionClassAttributeName).size(), 0u);
   EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(AttributesClass, MissingItemFailsAtTheOpen) {
-  Error error;
-  int32_t cls = 0;
-  EXPECT_FALSE(fm_.dataProtectionClassOfItemAtURL(URL::fileURL(tmp_ / "absent"), &cls, &error));
-  EXPECT_TRUE(error.isPOSIX(ENOENT));
-  EXPECT_EQ(error.localizedDescription(), "Failed to open " + (tmp_ / "absent") + " : No such file or directory");
 }
 
 TEST_F(AttributesClass, UnreadableClassFailsBothTheReadAndAGuardedChange) {
@@ -280,15 +248,6 @@ TEST_F(AttributesInstallType, FailedWriteLeavesTheOldValue) {
   EXPECT_TRUE(error.underlyingError()->isPOSIX(EPERM));
   EXPECT_EQ(log_.count("Could't set installType EA on"), 1u);
   EXPECT_EQ(fm_.installTypeForBundle(bundleURL())->uint64Value(), 7u);
-}
-
-TEST_F(AttributesInstallType, MissingBundleFailsTheRead) {
-  Error error;
-  std::string missing = tmp_ / "absent.app";
-  EXPECT_FALSE(fm_.installTypeForBundle(URL::fileURL(missing, true), &error));
-  EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeFileOperationFailed));
-  ASSERT_NE(error.underlyingError(), nullptr);
-  EXPECT_TRUE(error.underlyingError()->isPOSIX(ENOENT));
 }
 
 }  // namespace

@@ -1,12 +1,4 @@
-#include <fcntl.h>
-#include <sys/stat.h>
 #include <sys/sysmacros.h>
-#include <sys/xattr.h>
-#include <unistd.h>
-
-#include <cstring>
-
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
@@ -113,23 +105,6 @@ TEST_F(FileManagerCopy, TreeKeepsDataAttributesOwnersModesTimesAndLinks) {
   EXPECT_TRUE(error.is("Sentinel", 99));
   expectCopied(dir / "src", dir / "dst");
   EXPECT_TRUE(qstest::exists(dir / "src/data")) << "a copy leaves its source";
-}
-
-TEST_F(FileManagerCopy, ToAnotherFileSystemKeepsEverything) {
-  qstest::ShmDir shm;
-  ASSERT_NO_FATAL_FAILURE(buildSource(dir / "src"));
-  Error error;
-  ASSERT_TRUE(fm.copyItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error)) << error.description();
-  expectCopied(dir / "src", shm / "dst");
-}
-
-TEST_F(FileManagerCopy, LinkAtTheTopIsCopiedAsALink) {
-  ASSERT_TRUE(qstest::makeDirs(dir / "target"));
-  ASSERT_EQ(symlink("target", (dir / "link").c_str()), 0);
-  ASSERT_TRUE(fm.copyItemAtURL(fileURL(dir / "link"), fileURL(dir / "copy")));
-  auto status = qstest::lstatOf(dir / "copy");
-  ASSERT_TRUE(status);
-  EXPECT_TRUE(S_ISLNK(status->st_mode));
 }
 
 TEST_F(FileManagerCopy, ExistingDestinationFailsWithFileExists) {
@@ -246,13 +221,6 @@ TEST_F(FileManagerMove, RenameWithinTheFileSystem) {
   EXPECT_FALSE(qstest::exists(dir / "src"));
   EXPECT_EQ(qstest::lstatOf(dir / "dst")->st_ino, inode);
   EXPECT_EQ(qstest::readFile(dir / "dst/sub/file"), "x");
-}
-
-TEST_F(FileManagerMove, ReplacesAnExistingFileAsRenameDoes) {
-  ASSERT_TRUE(qstest::writeFile(dir / "src", "new"));
-  ASSERT_TRUE(qstest::writeFile(dir / "dst", "old"));
-  EXPECT_TRUE(fm.moveItemAtURL(fileURL(dir / "src"), fileURL(dir / "dst")));
-  EXPECT_EQ(qstest::readFile(dir / "dst"), "new");
 }
 
 TEST_F(FileManagerMove, AbsentSourceIsNoFailureOnlyForTheIfExistsForm) {

@@ -1,13 +1,7 @@
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <sys/xattr.h>
-#include <unistd.h>
 
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/DataProtection.h"
-#include "Shared/FileManager/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 
 namespace {
@@ -58,13 +52,6 @@ TEST_F(FileManagerDirectories, ExistingDirectoryIsNoFailureAndKeepsItsMode) {
   EXPECT_EQ(qstest::lstatOf(dir / "a")->st_mode & 07777, 0700u);
 }
 
-TEST_F(FileManagerDirectories, ExistingDirectoryThroughLinkIsNoFailure) {
-  ASSERT_TRUE(qstest::makeDirs(dir / "real"));
-  ASSERT_EQ(symlink("real", (dir / "link").c_str()), 0);
-  EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "link/new", true), true, kMode));
-  EXPECT_TRUE(qstest::exists(dir / "real/new"));
-}
-
 TEST_F(FileManagerDirectories, ClassGoesOnTheLastDirectoryOnly) {
   EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a/b", true), true, kMode, kClass));
   EXPECT_EQ(classOf(dir / "a/b"), kClass);
@@ -76,11 +63,6 @@ TEST_F(FileManagerDirectories, ClassIsAppliedAgainToAnExistingDirectory) {
   ASSERT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), false, kMode, 2));
   EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), false, kMode, kClass));
   EXPECT_EQ(classOf(dir / "a"), kClass);
-}
-
-TEST_F(FileManagerDirectories, NoClassLeavesNoAttribute) {
-  EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), false, kMode, kQSNoDataProtectionClass));
-  EXPECT_FALSE(hasClassAttribute(dir / "a"));
 }
 
 TEST_F(FileManagerDirectories, SingleCreationWithMissingParentFails) {
@@ -167,31 +149,6 @@ TEST_F(DataProtection, NoClassValueIsNeverStored) {
   int32_t read = 0;
   ASSERT_EQ(qsfs::getDataProtectionClass(fd.get(), &read), 0);
   EXPECT_EQ(read, 3);
-}
-
-TEST_F(DataProtection, StoredValueOfAnotherSizeIsRefused) {
-  ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));
-  qsfs::ScopedFD fd = openItem(dir / "file");
-  for (size_t size : {size_t{2}, size_t{8}}) {
-    const char bytes[8] = {1, 2, 3, 4, 5, 6, 7, 8};
-    ASSERT_EQ(fsetxattr(fd.get(), qsfs::kDataProtectionClassAttributeName, bytes, size, 0), 0);
-    int32_t read = 77;
-    EXPECT_EQ(qsfs::getDataProtectionClass(fd.get(), &read), ERANGE) << size;
-    EXPECT_EQ(read, 77);
-  }
-}
-
-TEST_F(DataProtection, ImmutableItemKeepsItsClass) {
-  ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));
-  qsfs::ScopedFD fd = openItem(dir / "file");
-  ASSERT_EQ(qsfs::setDataProtectionClass(fd.get(), 2), 0);
-  ASSERT_TRUE(qstest::setImmutable(dir / "file", true));
-  int result = qsfs::setDataProtectionClass(fd.get(), 5);
-  ASSERT_TRUE(qstest::setImmutable(dir / "file", false));
-  EXPECT_EQ(result, EPERM);
-  int32_t read = 0;
-  ASSERT_EQ(qsfs::getDataProtectionClass(fd.get(), &read), 0);
-  EXPECT_EQ(read, 2);
 }
 
 }  // namespace

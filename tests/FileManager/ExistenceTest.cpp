@@ -1,7 +1,4 @@
-#include <sys/stat.h>
-#include <unistd.h>
 
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
@@ -15,10 +12,6 @@ class FileManagerExistence : public testing::Test {
   QSFileManager& fm = QSFileManager::defaultManager();
   qstest::TempDir dir{"existence"};
 };
-
-TEST_F(FileManagerExistence, SharedInstanceIsOneObject) {
-  EXPECT_EQ(&QSFileManager::defaultManager(), &fm);
-}
 
 TEST_F(FileManagerExistence, FileDirectoryAndDanglingLinkExist) {
   ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));

@@ -1,11 +1,7 @@
 #include <dirent.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <set>
-
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
@@ -81,16 +77,6 @@ TEST_F(FileManagerListing, OrderIsTheDirectorysOwnOrder) {
   EXPECT_EQ(names, expected);
 }
 
-TEST_F(FileManagerListing, NamesKeepTheirBytes) {
-  const std::string odd = "caf\xe9-\xff\xfe name";  // not UTF-8
-  ASSERT_TRUE(qstest::writeFile(dir / odd, "bytes"));
-  auto urls = fm.urlsForItemsInDirectoryAtURL(fileURL(dir.path(), true), true);
-  ASSERT_TRUE(urls.has_value());
-  auto it = std::find_if(urls->begin(), urls->end(), [&](const URL& u) { return u.lastPathComponent() == odd; });
-  ASSERT_NE(it, urls->end());
-  EXPECT_EQ(qstest::readFile(it->path()), "bytes");
-}
-
 TEST_F(FileManagerListing, SymbolicLinkToDirectoryIsNotListedThrough) {
   Error error;
   EXPECT_FALSE(fm.urlsForItemsInDirectoryAtURL(fileURL(dir / "link-to-dir"), false, &error).has_value());
@@ -120,14 +106,6 @@ TEST_F(FileManagerListing, UnreadableDirectoryFailsWithPermissionDenied) {
     return error.localizedDescription() == "_IterateDirectory for " + path + " returned Permission denied" ? 0 : 3;
   });
   EXPECT_EQ(status, 0);
-}
-
-TEST(QuillsetAdditions, NameConversionKeepsExactlyTheGivenBytes) {
-  const char bytes[] = {'a', '\0', '\xff', 'b', 'c'};
-  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation(bytes, 4), std::string(bytes, 4));
-  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation("ab\xfe"), "ab\xfe");
-  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation("name", 2), "na") << "no terminator is needed";
-  EXPECT_EQ(QuillsetAdditions::stringWithFileSystemRepresentation(nullptr), "");
 }
 
 TEST(QuillsetAdditions, DotDotCountsOnlyAsAWholeComponent) {

@@ -1,13 +1,7 @@
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <thread>
 
-#include <gtest/gtest.h>
-
 #include "FileLayerTestSupport.h"
-#include "Shared/FileManager/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/FileManager/RemoveTree.h"
 
@@ -218,20 +212,6 @@ TEST_F(RemoveTree, DirectoryMovedAwayDuringTheWalkIsLeftWhereItWent) {
   ASSERT_FALSE(move.numbers.empty());
   EXPECT_EQ(move.numbers.front(), EPERM);
   EXPECT_FALSE(qstest::exists(shm / "root"));
-}
-
-TEST_F(RemoveTree, MissingRootReportsNoSuchFile) {
-  qsfs::RemovalState state;
-  EXPECT_EQ(qsfs::removeTree((dir / "none").c_str(), state), ENOENT);
-}
-
-TEST_F(RemoveTree, StateRefusesNullArgumentsAndHasNoNumberOutsideTheCallback) {
-  qsfs::RemovalState state;
-  EXPECT_EQ(state.setErrorCallback(nullptr), EINVAL);
-  EXPECT_EQ(state.setErrorContext(nullptr), EINVAL);
-  int errnum = 12345;
-  EXPECT_EQ(state.errorNumber(&errnum), EINVAL);
-  EXPECT_EQ(errnum, 12345);
 }
 
 }  // namespace

@@ -1,18 +1,10 @@
 // Capture of the store items between real directories.
-#include <sys/stat.h>
-#include <unistd.h>
 
-#include <cerrno>
-#include <string>
 #include <vector>
-
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
-#include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
-#include "support/TestSupport.h"
 
 using platform::Error;
 using platform::URL;
@@ -74,14 +66,6 @@ TEST_F(StoreData, NothingToCaptureSucceedsQuietly) {
   EXPECT_TRUE(log_.systemLines().empty());
 }
 
-TEST_F(StoreData, MovingTakesASingleItemAway) {
-  ASSERT_TRUE(qstest::writeFile(from_ + "/VendraMetadata.plist", "meta"));
-  EXPECT_TRUE(capture(false, true));
-  EXPECT_EQ(qstest::readFile(to_ + "/VendraMetadata.plist"), "meta");
-  EXPECT_FALSE(exists(from_ + "/VendraMetadata.plist"));
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
 TEST_F(StoreData, CopyingLeavesEveryItemAtTheSource) {
   populate();
   EXPECT_TRUE(capture(true, true));
@@ -91,13 +75,6 @@ TEST_F(StoreData, CopyingLeavesEveryItemAtTheSource) {
   }
   EXPECT_EQ(qstest::readFile(to_ + "/VendraArtwork/icon.png"), "png");
   EXPECT_EQ(qstest::readFile(to_ + "/GeoJSON"), "GeoJSON");
-}
-
-TEST_F(StoreData, MoveReplacesAFileOfTheSameName) {
-  ASSERT_TRUE(qstest::writeFile(from_ + "/Manifest.plist", "new"));
-  ASSERT_TRUE(qstest::writeFile(to_ + "/Manifest.plist", "old"));
-  EXPECT_TRUE(capture(false, true));
-  EXPECT_EQ(qstest::readFile(to_ + "/Manifest.plist"), "new");
 }
 
 TEST_F(StoreData, NonFatalFailureIsLoggedAndTheRestIsCaptured) {

@@ -1,6 +1,4 @@
-#include <sys/stat.h>
 
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
@@ -63,15 +61,6 @@ TEST_F(FileManagerTempDir, MissingParentIsAnInstallerErrorWithTheTemplate) {
   EXPECT_EQ(lines[0].function, kTempFn);
   EXPECT_NE(lines[0].message.find("Failed to create temp dir at path " + templatePath), std::string::npos)
       << lines[0].message;
-}
-
-TEST_F(FileManagerTempDir, ParentThatIsAFileGivesNotADirectoryUnderneath) {
-  ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));
-  Error error;
-  EXPECT_FALSE(fm.createTemporaryDirectoryInDirectoryURL(fileURL(dir / "file"), &error));
-  EXPECT_TRUE(error.is(QSInstallerErrorDomain, 4));
-  ASSERT_NE(error.underlyingError(), nullptr);
-  EXPECT_TRUE(error.underlyingError()->isPOSIX(ENOTDIR));
 }
 
 TEST_F(FileManagerTempDir, ImmutableParentGivesPermissionErrorUnderneath) {

@@ -1,19 +1,11 @@
 // Tree walks, ownership standardisation and symbolic links on real trees.
-#include <sys/stat.h>
-#include <unistd.h>
 
-#include <cerrno>
 #include <map>
-#include <string>
 #include <vector>
-
-#include <gtest/gtest.h>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QSFileManager.h"
-#include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
-#include "support/TestSupport.h"
 
 using platform::Error;
 using platform::URL;
@@ -142,20 +134,6 @@ TEST_F(TraversalWalk, RefusingStepStopsTheWalkWithItsError) {
   }));
   EXPECT_EQ(calls, 2);
   EXPECT_TRUE(error.is("StepDomain", 7));
-}
-
-TEST_F(TraversalWalk, RefusingStepWithoutAnErrorLeavesTheOutParameterAlone) {
-  Error error("Untouched", 1);
-  EXPECT_FALSE(fm_._traverseDirectory(rootURL(), &error, [](const QSTraversalEntry&, Error*) { return false; }));
-  EXPECT_TRUE(error.is("Untouched", 1));
-}
-
-TEST_F(TraversalWalk, WalkWithoutAStepOnlyVisits) {
-  ASSERT_TRUE(qstest::makeDirs(root_ + "/a/b"));
-  EXPECT_TRUE(fm_._traverseDirectory(rootURL(), nullptr, QSTraversalBlock()));
-  Error error;
-  EXPECT_FALSE(fm_._traverseDirectory(URL::fileURL(tmp_ / "absent", true), &error, QSTraversalBlock()));
-  EXPECT_TRUE(error.isPOSIX(ENOENT));
 }
 
 TEST_F(TraversalWalk, MissingRootIsAnErrorEntry) {
@@ -344,14 +322,6 @@ TEST_F(TraversalStandardize, UnchangeableItemIsLoggedAndPassedOver) {
   EXPECT_EQ(log_.systemLines().size(), 2u);
   EXPECT_EQ(permissions(root_ + "/other"), 0644u);
   EXPECT_EQ(statusOf(root_ + "/other").st_uid, kWantedUID);
-}
-
-TEST_F(TraversalStandardize, MissingRootFails) {
-  Error error;
-  std::string missing = tmp_ / "absent";
-  EXPECT_FALSE(fm_.standardizeOwnershipAtURL(URL::fileURL(missing, true), 0, 0, true, &error));
-  EXPECT_TRUE(error.isPOSIX(ENOENT));
-  EXPECT_EQ(error.localizedDescription(), "Error for path " + missing + ": No such file or directory");
 }
 
 // --- Symbolic links ---------------------------------------------------------------
