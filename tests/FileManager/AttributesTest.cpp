@@ -144,20 +144,15 @@ TEST_F(AttributesPlaceholder, MarkIsAFourByteOneInNativeOrder) {
   EXPECT_TRUE(log_.systemLines().empty());
 }
 
-TEST_F(AttributesPlaceholder, AnyFourBytesMarkAPlaceholder) {
-  setAttribute(bundle_, kQSPlaceholderAttributeName, {0, 0, 0, 0});
-  EXPECT_TRUE(fm_.bundleAtURLIsPlaceholder(bundleURL()));
-  setAttribute(bundle_, kQSPlaceholderAttributeName, {9, 8, 7, 6});
-  EXPECT_TRUE(fm_.bundleAtURLIsPlaceholder(bundleURL()));
-}
-
-TEST_F(AttributesPlaceholder, OtherSizesAndMissingItemsAreNoPlaceholder) {
-  EXPECT_FALSE(fm_.bundleAtURLIsPlaceholder(bundleURL()));
-  setAttribute(bundle_, kQSPlaceholderAttributeName, {1});
-  EXPECT_FALSE(fm_.bundleAtURLIsPlaceholder(bundleURL()));
-  setAttribute(bundle_, kQSPlaceholderAttributeName, {1, 0, 0, 0, 0, 0, 0, 0});
+TEST_F(AttributesPlaceholder, AnyFourBytesAndOnlyFourMarkAPlaceholder) {
   EXPECT_FALSE(fm_.bundleAtURLIsPlaceholder(bundleURL()));
   EXPECT_FALSE(fm_.bundleAtURLIsPlaceholder(URL::fileURL(tmp_ / "absent.app", true)));
+  const std::pair<std::vector<uint8_t>, bool> cases[] = {
+      {{0, 0, 0, 0}, true}, {{9, 8, 7, 6}, true}, {{1}, false}, {{1, 0, 0, 0, 0, 0, 0, 0}, false}};
+  for (const auto& [bytes, marked] : cases) {
+    setAttribute(bundle_, kQSPlaceholderAttributeName, bytes);
+    EXPECT_EQ(fm_.bundleAtURLIsPlaceholder(bundleURL()), marked) << bytes.size();
+  }
   EXPECT_TRUE(log_.systemLines().empty());
 }
 

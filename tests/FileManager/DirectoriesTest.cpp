@@ -65,26 +65,23 @@ TEST_F(FileManagerDirectories, ClassIsAppliedAgainToAnExistingDirectory) {
   EXPECT_EQ(classOf(dir / "a"), kClass);
 }
 
-TEST_F(FileManagerDirectories, SingleCreationWithMissingParentFails) {
-  Error error;
-  EXPECT_FALSE(fm.createDirectoryAtURL(fileURL(dir / "missing/a", true), false, kMode, &error));
-  qstest::expectPOSIXError(error, ENOENT, "mkdir of " + dir.path() + "/missing/a failed: No such file or directory",
-                           kCreateFn);
-}
-
-TEST_F(FileManagerDirectories, FileInTheMiddleOfThePathFailsWithNotADirectory) {
+TEST_F(FileManagerDirectories, FailuresNameTheCallAndThePath) {
   ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));
-  Error error;
-  EXPECT_FALSE(fm.createDirectoryAtURL(fileURL(dir / "file/a/b", true), true, kMode, &error));
-  qstest::expectPOSIXError(error, ENOTDIR, "mkpath_np of " + dir.path() + "/file/a/b failed: Not a directory",
-                           kCreateFn);
-}
-
-TEST_F(FileManagerDirectories, FileAtTheEndOfThePathFailsWithIntermediates) {
-  ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));
-  Error error;
-  EXPECT_FALSE(fm.createDirectoryAtURL(fileURL(dir / "file", true), true, kMode, &error));
-  qstest::expectPOSIXError(error, EEXIST, "mkpath_np of " + dir.path() + "/file failed: File exists", kCreateFn);
+  const struct {
+    const char* path;
+    bool intermediates;
+    int code;
+    std::string message;
+  } cases[] = {
+      {"missing/a", false, ENOENT, "mkdir of " + dir.path() + "/missing/a failed: No such file or directory"},
+      {"file/a/b", true, ENOTDIR, "mkpath_np of " + dir.path() + "/file/a/b failed: Not a directory"},
+      {"file", true, EEXIST, "mkpath_np of " + dir.path() + "/file failed: File exists"},
+  };
+  for (const auto& c : cases) {
+    Error error;
+    EXPECT_FALSE(fm.createDirectoryAtURL(fileURL(dir / c.path, true), c.intermediates, kMode, &error)) << c.path;
+    qstest::expectPOSIXError(error, c.code, c.message, kCreateFn);
+  }
 }
 
 TEST_F(FileManagerDirectories, FileAtThePathWithoutIntermediatesDependsOnTheClass) {

@@ -77,30 +77,6 @@ TEST_F(TraversalWalk, ReportsEveryKindWithFullPathsAndDirectoriesTwice) {
   EXPECT_TRUE(log_.systemLines().empty());
 }
 
-TEST_F(TraversalWalk, SecondVisitOfADirectoryCarriesTheStatusOfTheFirst) {
-  ASSERT_EQ(chmod(root_.c_str(), 0700), 0);
-  std::vector<mode_t> modes;
-  ASSERT_TRUE(fm_._traverseDirectory(rootURL(), nullptr, [&](const QSTraversalEntry& e, Error*) {
-    modes.push_back(e.status.st_mode & 07777);
-    if (e.kind == Kind::DirectoryPre) chmod(e.path.c_str(), 0711);
-    return true;
-  }));
-  EXPECT_EQ(modes, (std::vector<mode_t>{0700, 0700}));
-  EXPECT_EQ(permissions(root_), 0711u);
-}
-
-TEST_F(TraversalWalk, LinksAreNeverFollowed) {
-  ASSERT_TRUE(qstest::makeDirs(tmp_ / "elsewhere"));
-  ASSERT_TRUE(qstest::writeFile(tmp_ / "elsewhere/secret", "x"));
-  qstest::makeSymlink(tmp_ / "elsewhere", root_ + "/link");
-  std::vector<std::string> paths;
-  ASSERT_TRUE(fm_._traverseDirectory(rootURL(), nullptr, [&](const QSTraversalEntry& e, Error*) {
-    paths.push_back(e.path);
-    return true;
-  }));
-  EXPECT_EQ(paths, (std::vector<std::string>{root_, root_ + "/link", root_}));
-}
-
 TEST_F(TraversalWalk, OtherFileSystemsAreReportedButNotEntered) {
   // /dev/shm is a file system of its own mounted inside /dev.
   qstest::ShmDir shm;
