@@ -118,7 +118,8 @@ TEST_F(PlaceholderInstallation, InstallsTheStagedDirectoryWithFourOptionsWithout
 }
 
 TEST_F(PlaceholderInstallation, StoreMetadataBytesArePassedUnchangedAndStay) {
-  const std::string bytes("\x00\x01not a property list\xff", 24);
+  static const char kRaw[] = "\x00\x01not a property list\xff";
+  const std::string bytes(kRaw, sizeof kRaw - 1);
   ASSERT_TRUE(writeFile(container_ + "/VendraMetadata.plist", bytes));
   ASSERT_TRUE(install());
   const auto calls = platform_->registry.installCalls();
