@@ -12,20 +12,20 @@ namespace qstest {
 using platform::Dictionary;
 using platform::Value;
 
-std::string infoPlistXML(const BundleSpec& spec) {
+std::string infoPlistXML(const BundleSpec& bundle) {
   std::string xml =
       "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
       "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" \"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
       "<plist version=\"1.0\">\n<dict>\n";
-  if (!spec.identifier.empty()) xml += "<key>RkBundleIdentifier</key><string>" + spec.identifier + "</string>\n";
-  if (!spec.version.empty()) xml += "<key>RkBundleVersion</key><string>" + spec.version + "</string>\n";
-  if (!spec.displayName.empty()) xml += "<key>RkBundleDisplayName</key><string>" + spec.displayName + "</string>\n";
-  if (!spec.groups.empty()) {
+  if (!bundle.identifier.empty()) xml += "<key>RkBundleIdentifier</key><string>" + bundle.identifier + "</string>\n";
+  if (!bundle.version.empty()) xml += "<key>RkBundleVersion</key><string>" + bundle.version + "</string>\n";
+  if (!bundle.displayName.empty()) xml += "<key>RkBundleDisplayName</key><string>" + bundle.displayName + "</string>\n";
+  if (!bundle.groups.empty()) {
     xml += "<key>RkApplicationGroups</key><array>";
-    for (const std::string& group : spec.groups) xml += "<string>" + group + "</string>";
+    for (const std::string& group : bundle.groups) xml += "<string>" + group + "</string>";
     xml += "</array>\n";
   }
-  if (spec.noDataContainer) xml += "<key>RkNoDataContainer</key><true/>\n";
+  if (bundle.noDataContainer) xml += "<key>RkNoDataContainer</key><true/>\n";
   xml += "<key>RkBundleExecutable</key><string>main</string>\n</dict>\n</plist>\n";
   return xml;
 }
@@ -37,10 +37,10 @@ std::unique_ptr<platform::SQLiteApplicationRegistry> RegistryTest::openRegistry(
   return registry;
 }
 
-void RegistryTest::makeBundle(const std::string& path, const BundleSpec& spec) {
+void RegistryTest::makeBundle(const std::string& path, const BundleSpec& bundle) {
   ASSERT_TRUE(makeDirs(path));
-  ASSERT_TRUE(writeFile(path + "/" + platform::kInfoPlistFileName, infoPlistXML(spec)));
-  ASSERT_TRUE(writeFile(path + "/main", "executable of " + spec.identifier));
+  ASSERT_TRUE(writeFile(path + "/" + platform::kInfoPlistFileName, infoPlistXML(bundle)));
+  ASSERT_TRUE(writeFile(path + "/main", "executable of " + bundle.identifier));
 }
 
 std::string RegistryTest::makePackage(const std::string& name, const BundleSpec& app, const BundleSpec& plugin,
@@ -53,9 +53,9 @@ std::string RegistryTest::makePackage(const std::string& name, const BundleSpec&
   return package;
 }
 
-std::string RegistryTest::makeBuiltIn(const std::string& name, const BundleSpec& spec) {
+std::string RegistryTest::makeBuiltIn(const std::string& name, const BundleSpec& bundle) {
   std::string path = at("Applications/" + name);
-  makeBundle(path, spec);
+  makeBundle(path, bundle);
   return path;
 }
 

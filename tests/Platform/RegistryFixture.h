@@ -42,7 +42,7 @@ struct BundleSpec {
 };
 
 // Info.plist text in the XML form.
-std::string infoPlistXML(const BundleSpec& spec);
+std::string infoPlistXML(const BundleSpec& bundle);
 
 class RegistryTest : public testing::Test {
  protected:
@@ -53,7 +53,7 @@ class RegistryTest : public testing::Test {
   std::unique_ptr<platform::SQLiteApplicationRegistry> openRegistry();
 
   // A bundle directory at `path` with an Info.plist and an executable file.
-  void makeBundle(const std::string& path, const BundleSpec& spec);
+  void makeBundle(const std::string& path, const BundleSpec& bundle);
   // A package directory "<name>" under the test's "packages" folder:
   // Payload/<appName> for the application (when `app` has an identifier),
   // Payload/<pluginName> for the plug-in (when `plugin` has one), and
@@ -61,7 +61,7 @@ class RegistryTest : public testing::Test {
   std::string makePackage(const std::string& name, const BundleSpec& app, const BundleSpec& plugin = {},
                           const std::vector<std::string>& metadataFiles = {});
   // A built-in application <root>/Applications/<name>.
-  std::string makeBuiltIn(const std::string& name, const BundleSpec& spec);
+  std::string makeBuiltIn(const std::string& name, const BundleSpec& bundle);
 
   // Installs a package with the migrator's options for `identifier`,
   // collecting the progress reports.

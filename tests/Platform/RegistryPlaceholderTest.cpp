@@ -14,9 +14,9 @@ using platform::Value;
 class RegistryPlaceholder : public RegistryTest {
  protected:
   // A staged placeholder directory outside the system root's layout.
-  std::string stagePlaceholder(const BundleSpec& spec) {
-    std::string path = staging_ / (spec.identifier.empty() ? "unnamed.app" : spec.identifier + ".app");
-    makeBundle(path, spec);
+  std::string stagePlaceholder(const BundleSpec& bundle) {
+    std::string path = staging_ / (bundle.identifier.empty() ? "unnamed.app" : bundle.identifier + ".app");
+    makeBundle(path, bundle);
     return path;
   }
   bool installPlaceholder(platform::SQLiteApplicationRegistry& registry, const std::string& bundle,
