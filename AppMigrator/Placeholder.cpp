@@ -32,11 +32,12 @@ constexpr const char* kPlaceholderInfoKeys[] = {
     platform::kBundleVersionKey,    platform::kBundleShortVersionStringKey,
 };
 
-Dictionary placeholderInfo(const Dictionary& appInfo) {
-  Dictionary info;
+platform::plist::OrderedEntries placeholderInfo(const Dictionary& appInfo) {
+  platform::plist::OrderedEntries info;
+  info.reserve(std::size(kPlaceholderInfoKeys) + 1);
   for (const char* key : kPlaceholderInfoKeys) {
     const auto found = appInfo.find(key);
-    if (found != appInfo.end()) info.emplace(key, found->second);
+    if (found != appInfo.end()) info.emplace_back(key, found->second);
   }
   return info;
 }
@@ -111,18 +112,18 @@ bool QSAppMigrator::_installPlaceholderStagedAtURL(const URL& staged, const URL&
              "QSAppMigrator: Failed to get bundle info dictionary for bundle %@", bundle.path());
     return false;
   }
-  Dictionary info = placeholderInfo(*appInfo);
+  platform::plist::OrderedEntries info = placeholderInfo(*appInfo);
 
   const URL iconURL = staged.appending(platform::kDefaultIconFileName);
   if (_writeIconForBundle(*appBundle, iconURL)) {
-    info.insert_or_assign(platform::kBundleIconFileKey, Value(platform::kDefaultIconFileName));
+    info.emplace_back(platform::kBundleIconFileKey, Value(platform::kDefaultIconFileName));
   } else {
     QSAM_LOG(kQSLogLevelError, kPlaceholderFunction, "QSAppMigrator: Writing placeholder icon for app %@ to %@ failed",
              identifier, iconURL);
   }
 
   const URL infoURL = staged.appending(platform::kInfoPlistFileName);
-  if (!platform::plist::writeFile(Value(std::move(info)), infoURL, platform::plist::Format::XML, true)) {
+  if (!platform::plist::writeOrderedDictionary(info, infoURL, platform::plist::Format::XML, true)) {
     QSAM_LOG(kQSLogLevelError, kPlaceholderFunction, "QSAppMigrator: Failed to write placeholder Info.plist to %@",
              infoURL);
     return false;

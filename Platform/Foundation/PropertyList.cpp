@@ -262,6 +262,9 @@ class NodeWriter {
     return fail("a value of unknown type");
   }
 
+  // A root dictionary whose entries keep the given order.
+  PlistPtr orderedDictionary(const OrderedEntries& entries) { return dictionary(entries, 0); }
+
   const std::string& problem() const { return problem_; }
 
  private:
@@ -323,7 +326,8 @@ class NodeWriter {
     return node;
   }
 
-  PlistPtr dictionary(const Dictionary& entries, int depth) {
+  template <class Entries>
+  PlistPtr dictionary(const Entries& entries, int depth) {
     PlistPtr node(plist_new_dict());
     for (const auto& [key, item] : entries) {
       if (!checkText(key, "key")) return nullptr;
@@ -349,10 +353,12 @@ std::optional<Data> libplistWrite(plist_t root, void (*writer)(plist_t, char**, 
   return Data(buffer.get(), buffer.get() + length);
 }
 
-// Serialises `value`; on failure returns none and says why in *problem.
-std::optional<Data> serializeValue(const Value& value, Format format, std::string* problem) {
+// Serialises the node `build` makes with a NodeWriter; on failure returns
+// none and says why in *problem.
+template <class Build>
+std::optional<Data> serializeWith(Format format, std::string* problem, const Build& build) {
   NodeWriter writer(format);
-  PlistPtr root = writer.write(value, 0);
+  PlistPtr root = build(writer);
   if (!root) {
     *problem = writer.problem();
     return std::nullopt;
@@ -361,6 +367,10 @@ std::optional<Data> serializeValue(const Value& value, Format format, std::strin
                                                   : libplistWrite<BinaryFree>(root.get(), plist_to_bin);
   if (!out) *problem = "libplist could not produce the " + std::string(formatName(format)) + " form";
   return out;
+}
+
+std::optional<Data> serializeValue(const Value& value, Format format, std::string* problem) {
+  return serializeWith(format, problem, [&](NodeWriter& writer) { return writer.write(value, 0); });
 }
 
 }  // namespace
@@ -410,6 +420,15 @@ std::optional<Data> serialize(const Value& value, Format format, Error* error) {
 bool writeFile(const Value& value, const URL& url, Format format, bool atomically, Error* error) {
   std::string problem;
   std::optional<Data> data = serializeValue(value, format, &problem);
+  if (!data) return failWith(error, FileWriteError(url, problem));
+  return writeFileBytes(*data, url, atomically, error);
+}
+
+bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Format format, bool atomically,
+                            Error* error) {
+  std::string problem;
+  std::optional<Data> data =
+      serializeWith(format, &problem, [&](NodeWriter& writer) { return writer.orderedDictionary(entries); });
   if (!data) return failWith(error, FileWriteError(url, problem));
   return writeFileBytes(*data, url, atomically, error);
 }

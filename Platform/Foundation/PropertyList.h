@@ -28,6 +28,9 @@
 #pragma once
 
 #include <optional>
+#include <string>
+#include <utility>
+#include <vector>
 
 #include "Platform/Foundation/Error.h"
 #include "Platform/Foundation/FileErrors.h"
@@ -51,6 +54,12 @@ std::optional<Dictionary> readDictionary(const URL& url, Error* error = nullptr)
 std::optional<Data> serialize(const Value& value, Format format, Error* error = nullptr);
 bool writeFile(const Value& value, const URL& url, Format format = Format::XML, bool atomically = true,
                Error* error = nullptr);
+
+// A dictionary whose entries are written in the order given (a Dictionary is
+// ordered by key). Later duplicates of a key replace earlier ones in place.
+using OrderedEntries = std::vector<std::pair<std::string, Value>>;
+bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Format format = Format::XML,
+                            bool atomically = true, Error* error = nullptr);
 
 // Reads a whole file's bytes (no caching). Missing file: kFileErrorDomain 260
 // with the POSIX error underneath; other failures: kFileErrorDomain 256.

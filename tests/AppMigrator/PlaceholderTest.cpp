@@ -84,6 +84,16 @@ TEST_F(PlaceholderInstallation, StagesTrimmedInfoPlistAndRenderedIcon) {
       {platform::kBundleShortVersionStringKey, Value("4.2")}, {platform::kBundleIconFileKey, Value("Icon.png")}};
   EXPECT_EQ(Value(*infoAtInstall_), Value(expected));
   EXPECT_EQ(infoTextAtInstall_.rfind("<?xml", 0), 0u) << "Info.plist is written as XML";
+  // The keys stand in the order they were copied, the icon entry last.
+  size_t previous = 0;
+  for (const char* key : {platform::kBundleIdentifierKey, platform::kBundleDisplayNameKey,
+                          platform::kBundleExecutableKey, platform::kBundleVersionKey,
+                          platform::kBundleShortVersionStringKey, platform::kBundleIconFileKey}) {
+    const size_t at = infoTextAtInstall_.find("<key>" + std::string(key) + "</key>");
+    ASSERT_NE(at, std::string::npos) << key;
+    EXPECT_GT(at, previous) << key << " is out of order";
+    previous = at;
+  }
 
   ASSERT_TRUE(iconAtInstall_);
   EXPECT_EQ(iconAtInstall_->width, platform::kHomeScreenIconSize);
