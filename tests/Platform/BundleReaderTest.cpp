@@ -1,12 +1,9 @@
-// The file bundle reader, and the registry's reading of bundle versions.
+// The file bundle reader.
 #include "Platform/BundleReader.h"
 
-#include <gtest/gtest.h>
 
 #include "Platform/Foundation/PropertyList.h"
-#include "Platform/Registry/BundleInfo.h"
 #include "Platform/RegistryFixture.h"
-#include "support/TestSupport.h"
 
 namespace qstest {
 namespace {
@@ -95,41 +92,6 @@ TEST_F(BundleReading, FilteredInfoPlistKeepsOnlyTheKeysAndIsReadAfresh) {
   ASSERT_TRUE(filtered && filtered->isDictionary());
   ASSERT_EQ(filtered->asDictionary()->size(), 1u);
   EXPECT_EQ(filtered->get(platform::kBundleIdentifierKey)->description(), "com.example.changed");
-}
-
-TEST(BundleVersions, CompareNumericallyComponentByComponent) {
-  using platform::registry::compareBundleVersions;
-  EXPECT_GT(compareBundleVersions("1.10", "1.9"), 0);
-  EXPECT_LT(compareBundleVersions("1.9", "1.10"), 0);
-  EXPECT_EQ(compareBundleVersions("2", "2.0.0"), 0);
-  EXPECT_GT(compareBundleVersions("1.0.1", "1"), 0);
-  EXPECT_EQ(compareBundleVersions("", "0"), 0);
-  EXPECT_EQ(compareBundleVersions("beta", "0"), 0);
-  EXPECT_LT(compareBundleVersions("9", "10"), 0);
-}
-
-TEST(BundleVersions, InfoReadsGroupsAndNoDataContainer) {
-  TempDir dir("info");
-  std::string path = dir / "A.app";
-  ASSERT_TRUE(makeDirs(path));
-  ASSERT_TRUE(writeFile(path + "/Info.plist", infoPlistXML(BundleSpec("com.example.a")
-                                                               .withVersion("3.2")
-                                                               .withGroups({"g1", "g2"})
-                                                               .withoutDataContainer()
-                                                               .withDisplayName("A"))));
-  platform::Error error;
-  auto info = platform::registry::readBundleInfo(path, &error);
-  ASSERT_TRUE(info) << error.description();
-  EXPECT_EQ(info->identifier, "com.example.a");
-  EXPECT_EQ(info->version, "3.2");
-  EXPECT_EQ(info->displayName, "A");
-  EXPECT_EQ(info->groups, (std::vector<std::string>{"g1", "g2"}));
-  EXPECT_TRUE(info->noDataContainer);
-
-  EXPECT_FALSE(platform::registry::readBundleInfo(dir / "missing.app", &error));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidInfoPlist));
-  ASSERT_TRUE(error.underlyingError());
-  EXPECT_TRUE(error.underlyingError()->is(platform::kFileErrorDomain, platform::kFileReadNoSuchFileError));
 }
 
 }  // namespace

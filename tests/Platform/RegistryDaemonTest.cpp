@@ -31,16 +31,12 @@ TEST_F(RegistrySafeHarbor, IsRegisteredOnlyForAnExistingDirectory) {
   EXPECT_EQ(harbors[0].identifier, "com.example.game");
   EXPECT_EQ(harbors[0].path, at("harbors/game"));
   EXPECT_EQ(harbors[0].containerType, 2);
-}
 
-TEST_F(RegistrySafeHarbor, RegisteringAgainReplacesThePath) {
-  auto registry = openRegistry();
-  ASSERT_TRUE(makeDirs(at("harbors/one")));
+  // Registering again replaces the path.
   ASSERT_TRUE(makeDirs(at("harbors/two")));
-  ASSERT_TRUE(registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/one"), "com.example.a", 2, nullptr));
-  ASSERT_TRUE(registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/two"), "com.example.a", 2, nullptr));
-  ASSERT_EQ(registry->safeHarbors().size(), 1u);
-  EXPECT_EQ(registry->safeHarbors()[0].path, at("harbors/two"));
+  ASSERT_TRUE(reopened->QuillsetRegisterSafeHarborForContainerType(at("harbors/two"), "com.example.game", 2, nullptr));
+  ASSERT_EQ(reopened->safeHarbors().size(), 1u);
+  EXPECT_EQ(reopened->safeHarbors()[0].path, at("harbors/two"));
 }
 
 class RegistryDataProtection : public RegistryTest {
@@ -60,6 +56,12 @@ TEST_F(RegistryDataProtection, UpdateSetsClassThreeOnEverySystemDataContainer) {
   makeBuiltIn("Settings.app", BundleSpec("com.example.settings").withoutDataContainer());
   auto registry = openRegistry();
   std::string mailData = registry->recordForIdentifier("com.example.mail")->dataContainerURL->path();
+  // Without the option nothing changes.
+  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({}));
+  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly(
+      {{platform::kQSUpdateSystemAppDataContainerDataProtection, Value(false)}}));
+  EXPECT_EQ(protectionClass(mailData), -1);
+  EXPECT_EQ(entries(appDataContainers()).size(), 1u);
 
   ASSERT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly(updateSystemApps_));
   EXPECT_EQ(protectionClass(mailData), 3);
@@ -68,16 +70,6 @@ TEST_F(RegistryDataProtection, UpdateSetsClassThreeOnEverySystemDataContainer) {
   EXPECT_EQ(protectionClass(maps->path()), 3);
   EXPECT_FALSE(registry->recordForIdentifier("com.example.settings")->dataContainerURL);
   EXPECT_EQ(entries(appDataContainers()).size(), 2u);
-}
-
-TEST_F(RegistryDataProtection, WithoutTheOptionNothingChanges) {
-  makeBuiltIn("Mail.app", BundleSpec("com.example.mail"));
-  auto registry = openRegistry();
-  std::string mailData = registry->recordForIdentifier("com.example.mail")->dataContainerURL->path();
-  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({}));
-  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly(
-      {{platform::kQSUpdateSystemAppDataContainerDataProtection, Value(false)}}));
-  EXPECT_EQ(protectionClass(mailData), -1);
 }
 
 TEST_F(RegistryDataProtection, ContainerThatRefusesTheAttributeFailsTheUpdate) {

@@ -1,8 +1,5 @@
 #include "Platform/RegistryFixture.h"
 
-#include <dirent.h>
-#include <sys/stat.h>
-
 #include <algorithm>
 
 #include "Platform/BundleReader.h"
@@ -69,25 +66,12 @@ bool RegistryTest::install(platform::SQLiteApplicationRegistry& registry, const 
 
 std::vector<std::string> RegistryTest::entries(const std::string& directory) {
   std::vector<std::string> names;
-  DIR* dir = opendir(directory.c_str());
-  if (!dir) return names;
-  while (const dirent* entry = readdir(dir)) {
-    std::string name = entry->d_name;
-    if (name != "." && name != "..") names.push_back(name);
+  std::error_code missing;
+  for (const auto& entry : std::filesystem::directory_iterator(directory, missing)) {
+    names.push_back(entry.path().filename());
   }
-  closedir(dir);
   std::sort(names.begin(), names.end());
   return names;
-}
-
-bool RegistryTest::isDirectory(const std::string& path) {
-  struct stat st;
-  return stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
-}
-
-bool RegistryTest::exists(const std::string& path) {
-  struct stat st;
-  return lstat(path.c_str(), &st) == 0;
 }
 
 Dictionary customerOptions(const std::string& identifier) {

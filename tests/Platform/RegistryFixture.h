@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <vector>
@@ -17,22 +18,10 @@ namespace qstest {
 struct BundleSpec {
   BundleSpec() = default;
   explicit BundleSpec(std::string id) : identifier(std::move(id)) {}
-  BundleSpec&& withVersion(std::string v) && {
-    version = std::move(v);
-    return std::move(*this);
-  }
-  BundleSpec&& withGroups(std::vector<std::string> g) && {
-    groups = std::move(g);
-    return std::move(*this);
-  }
-  BundleSpec&& withDisplayName(std::string n) && {
-    displayName = std::move(n);
-    return std::move(*this);
-  }
-  BundleSpec&& withoutDataContainer() && {
-    noDataContainer = true;
-    return std::move(*this);
-  }
+  BundleSpec&& withVersion(std::string v) && { return version = std::move(v), std::move(*this); }
+  BundleSpec&& withGroups(std::vector<std::string> g) && { return groups = std::move(g), std::move(*this); }
+  BundleSpec&& withDisplayName(std::string n) && { return displayName = std::move(n), std::move(*this); }
+  BundleSpec&& withoutDataContainer() && { return noDataContainer = true, std::move(*this); }
 
   std::string identifier;
   std::string version = "1.0";
@@ -79,8 +68,8 @@ class RegistryTest : public testing::Test {
 
   // Entries of a directory (none when it is missing), sorted.
   static std::vector<std::string> entries(const std::string& directory);
-  static bool isDirectory(const std::string& path);
-  static bool exists(const std::string& path);
+  static bool isDirectory(const std::string& path) { return std::filesystem::is_directory(path); }
+  static bool exists(const std::string& path) { return std::filesystem::exists(std::filesystem::symlink_status(path)); }
 
  private:
   TempDir root_{"registry"};

@@ -2,6 +2,8 @@
 // replays.
 #include <unistd.h>
 
+#include <cstdio>
+#include <functional>
 #include <stdexcept>
 #include <thread>
 
@@ -73,16 +75,6 @@ TEST_F(RegistryInstall, ThrowingProgressCallbackDoesNotStopTheInstallation) {
   EXPECT_TRUE(registry->recordForIdentifier("com.example.notes")->foundBackingBundle);
 }
 
-TEST_F(RegistryInstall, ContainerNamesAreRandomUUIDs) {
-  auto registry = openRegistry();
-  ASSERT_TRUE(install(*registry, makePackage("a", BundleSpec("com.example.a")), "com.example.a"));
-  std::string name = registry->recordForIdentifier("com.example.a")->bundleContainerURL.lastPathComponent();
-  ASSERT_EQ(name.size(), 36u) << name;
-  for (size_t i : {8u, 13u, 18u, 23u}) EXPECT_EQ(name[i], '-') << name;
-  EXPECT_EQ(name[14], '4') << "version 4 UUID: " << name;
-  EXPECT_NE(name, registry->recordForIdentifier("com.example.a")->dataContainerURL->lastPathComponent());
-}
-
 TEST_F(RegistryInstall, ReinstallKeepsDataContainerAndRemovesOldBundleContainer) {
   auto registry = openRegistry();
   ASSERT_TRUE(
@@ -137,35 +129,19 @@ TEST_F(RegistryInstall, VPNPluginInTheSamePayloadGetsARecordOfItsOwn) {
   EXPECT_TRUE(plugin->groupContainerURLs);
 }
 
-TEST_F(RegistryInstall, PayloadHoldingOnlyAVPNPluginInstallsThePlugin) {
-  auto registry = openRegistry();
-  ASSERT_TRUE(install(*registry, makePackage("tunnel", {}, BundleSpec("com.example.tunnel")), "com.example.tunnel"));
-  std::optional<BundleRecord> plugin = registry->recordForIdentifier("com.example.tunnel");
-  ASSERT_TRUE(plugin);
-  EXPECT_EQ(plugin->bundleType, platform::kBundleTypeVPNPlugin);
-  EXPECT_EQ(plugin->dataContainerURL->deletingLastPathComponent().path(), pluginDataContainers());
-}
-
-TEST_F(RegistryInstall, OlderThanBuiltInIsRefusedAsAlreadyInstalledAndPackageRemoved) {
+TEST_F(RegistryInstall, OlderOrEqualToBuiltInIsRefusedAndPackageRemovedNewerIsInstalled) {
   makeBuiltIn("Clock.app", BundleSpec("com.example.clock").withVersion("2.10"));
   auto registry = openRegistry();
-  std::string package = makePackage("clock", BundleSpec("com.example.clock").withVersion("2.9"));
-  Error error;
-  EXPECT_FALSE(install(*registry, package, "com.example.clock", &error));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorAlreadyInstalled))
-      << error.description();
-  EXPECT_EQ(reportedError(reports_), "ApplicationAlreadyInstalled");
-  EXPECT_FALSE(exists(package));
-  EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeSystem);
-  EXPECT_TRUE(entries(bundleContainers()).empty());
-}
-
-TEST_F(RegistryInstall, EqualToBuiltInIsRefusedAndNewerIsInstalled) {
-  makeBuiltIn("Clock.app", BundleSpec("com.example.clock").withVersion("2.10"));
-  auto registry = openRegistry();
-  EXPECT_FALSE(install(*registry, makePackage("same", BundleSpec("com.example.clock").withVersion("2.10.0")),
-                       "com.example.clock"));
-  EXPECT_EQ(reportedError(reports_), "ApplicationAlreadyInstalled");
+  for (const char* version : {"2.9", "2.10.0"}) {
+    std::string package = makePackage(version, BundleSpec("com.example.clock").withVersion(version));
+    Error error;
+    EXPECT_FALSE(install(*registry, package, "com.example.clock", &error));
+    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorAlreadyInstalled)) << version;
+    EXPECT_EQ(reportedError(reports_), "ApplicationAlreadyInstalled");
+    EXPECT_FALSE(exists(package));
+    EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeSystem);
+    EXPECT_TRUE(entries(bundleContainers()).empty());
+  }
   Error error;
   ASSERT_TRUE(install(*registry, makePackage("newer", BundleSpec("com.example.clock").withVersion("2.10.1")),
                       "com.example.clock", &error))
@@ -175,70 +151,60 @@ TEST_F(RegistryInstall, EqualToBuiltInIsRefusedAndNewerIsInstalled) {
 
 // A refusal other than "already installed" leaves the package as it was and
 // makes no container.
-class RegistryRefusal : public RegistryTest {
- protected:
-  void expectRefused(const std::string& package, const std::string& identifier, int64_t code, const std::string& name) {
-    auto registry = openRegistry();
+using RegistryRefusal = RegistryTest;
+
+TEST_F(RegistryRefusal, BadPackagesAreLeftAsTheyWere) {
+  const std::string plist = "/Payload/App.app/Info.plist";
+  const std::string arrayPlist =
+      "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>";
+  struct Case {
+    const char* name;
+    std::function<void(const std::string& package)> damage;  // none: the options claim another identifier
+    int64_t code;
+    const char* error;
+  } cases[] = {
+      {"claimed", {}, platform::kRegistryErrorIdentifierMismatch, "BundleIdentifierMismatch"},
+      {"no-payload", [](const std::string& p) { ASSERT_EQ(rename((p + "/Payload").c_str(), (p + "/P").c_str()), 0); },
+       platform::kRegistryErrorInvalidPackage, "InvalidPackage"},
+      {"broken-plist", [&](const std::string& p) { ASSERT_TRUE(writeFile(p + plist, "<plist><dict><key>RkBundle")); },
+       platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist"},
+      {"array-plist", [&](const std::string& p) { ASSERT_TRUE(writeFile(p + plist, arrayPlist)); },
+       platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist"},
+      {"no-plist", [&](const std::string& p) { ASSERT_EQ(unlink((p + plist).c_str()), 0); },
+       platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist"},
+      {"two-apps", [&](const std::string& p) { makeBundle(p + "/Payload/Second.app", BundleSpec("com.example.x")); },
+       platform::kRegistryErrorInvalidPackage, "InvalidPackage"},
+      {"link",
+       [&](const std::string& p) {
+         ASSERT_EQ(rename((p + "/Payload/App.app").c_str(), at("Real.app").c_str()), 0);
+         ASSERT_EQ(symlink(at("Real.app").c_str(), (p + "/Payload/App.app").c_str()), 0);
+       },
+       platform::kRegistryErrorInvalidPackage, "InvalidPackage"},
+  };
+  auto registry = openRegistry();
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    std::string package = makePackage(c.name, BundleSpec("com.example.x"));
+    if (c.damage) c.damage(package);
+    const std::string identifier = c.damage ? "com.example.x" : "com.example.claimed";
     std::vector<std::string> before = entries(package + "/Payload");
     Error error;
     EXPECT_FALSE(install(*registry, package, identifier, &error));
-    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, code)) << error.description();
+    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, c.code)) << error.description();
     EXPECT_FALSE(error.localizedDescription().empty());
-    EXPECT_EQ(reportedError(reports_), name);
+    EXPECT_EQ(reportedError(reports_), c.error);
     EXPECT_EQ(statuses(reports_).back(), "Failed");
     EXPECT_EQ(entries(package + "/Payload"), before);
+    EXPECT_TRUE(isDirectory(package));
     EXPECT_TRUE(entries(bundleContainers()).empty());
     EXPECT_TRUE(entries(appDataContainers()).empty());
     EXPECT_FALSE(registry->isInstalled(identifier));
   }
-};
-
-TEST_F(RegistryRefusal, IdentifierDifferentFromOptions) {
-  std::string package = makePackage("p", BundleSpec("com.example.real"));
-  expectRefused(package, "com.example.claimed", platform::kRegistryErrorIdentifierMismatch, "BundleIdentifierMismatch");
-  EXPECT_TRUE(exists(package + "/Payload/App.app/Info.plist"));
+  EXPECT_TRUE(exists(at("Real.app/Info.plist")));
 }
 
-TEST_F(RegistryRefusal, MissingPayload) {
-  ASSERT_TRUE(makeDirs(at("packages/empty")));
-  expectRefused(at("packages/empty"), "com.example.x", platform::kRegistryErrorInvalidPackage, "InvalidPackage");
-  EXPECT_TRUE(isDirectory(at("packages/empty")));
-}
-
-TEST_F(RegistryRefusal, UnreadableInfoPlist) {
+TEST_F(RegistryRefusal, RelativeLocationsAndPlaceholderPackageType) {
   std::string package = makePackage("p", BundleSpec("com.example.x"));
-  ASSERT_TRUE(writeFile(package + "/Payload/App.app/Info.plist", "<plist><dict><key>RkBundle"));
-  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist");
-}
-
-TEST_F(RegistryRefusal, InfoPlistWhoseRootIsNotADictionary) {
-  std::string package = makePackage("p", BundleSpec("com.example.x"));
-  ASSERT_TRUE(writeFile(package + "/Payload/App.app/Info.plist",
-                        "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>"));
-  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist");
-}
-
-TEST_F(RegistryRefusal, MissingInfoPlist) {
-  std::string package = makePackage("p", BundleSpec("com.example.x"));
-  ASSERT_EQ(unlink((package + "/Payload/App.app/Info.plist").c_str()), 0);
-  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist");
-}
-
-TEST_F(RegistryRefusal, TwoApplicationsInPayload) {
-  std::string package = makePackage("p", BundleSpec("com.example.x"));
-  makeBundle(package + "/Payload/Second.app", BundleSpec("com.example.x"));
-  expectRefused(package, "com.example.x", platform::kRegistryErrorInvalidPackage, "InvalidPackage");
-}
-
-TEST_F(RegistryRefusal, SymbolicLinkToABundleInPayload) {
-  makeBundle(at("elsewhere/Real.app"), BundleSpec("com.example.x"));
-  ASSERT_TRUE(makeDirs(at("packages/p/Payload")));
-  ASSERT_EQ(symlink(at("elsewhere/Real.app").c_str(), at("packages/p/Payload/App.app").c_str()), 0);
-  expectRefused(at("packages/p"), "com.example.x", platform::kRegistryErrorInvalidPackage, "InvalidPackage");
-  EXPECT_TRUE(exists(at("elsewhere/Real.app/Info.plist")));
-}
-
-TEST_F(RegistryRefusal, RelativeLocations) {
   auto registry = openRegistry();
   Error error;
   EXPECT_FALSE(registry->installPackage(platform::URL::fileURL("packages/p", true), customerOptions("com.example.x"),
@@ -246,14 +212,8 @@ TEST_F(RegistryRefusal, RelativeLocations) {
   EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage)) << error.description();
   EXPECT_FALSE(registry->installBundle(platform::URL(), {}, &error));
   EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage)) << error.description();
-}
-
-TEST_F(RegistryRefusal, PlaceholderPackageType) {
-  std::string package = makePackage("p", BundleSpec("com.example.x"));
-  auto registry = openRegistry();
   platform::Dictionary options = customerOptions("com.example.x");
   options[platform::kRegistryPackageTypeKey] = platform::Value(platform::kRegistryPackageTypePlaceholder);
-  Error error;
   EXPECT_FALSE(registry->installPackage(platform::URL::fileURL(package, true), options, {}, &error));
   EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidOptions)) << error.description();
   EXPECT_TRUE(exists(package + "/Payload/App.app"));
