@@ -112,15 +112,19 @@ Image gradient(int width, int height) {
   return image;
 }
 
-TEST(PNGEncoding, RoundTripsPixelsExactly) {
+// Encodes one image as PNG and decodes it again; none when encoding fails.
+std::optional<Image> encodeAndDecode(const Image& image) {
   platform::PNGImageEncoding encoding;
   Data buffer;
   auto encoder = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
-  ASSERT_TRUE(encoder);
-  const Image image = gradient(33, 17);
+  if (!encoder) return std::nullopt;
   encoder->addImage(image);
-  ASSERT_TRUE(encoder->finalize());
-  const std::optional<Image> decoded = qstest::decodePNG(buffer);
+  return encoder->finalize() ? qstest::decodePNG(buffer) : std::nullopt;
+}
+
+TEST(PNGEncoding, RoundTripsPixelsExactly) {
+  const Image image = gradient(33, 17);
+  const std::optional<Image> decoded = encodeAndDecode(image);
   ASSERT_TRUE(decoded);
   EXPECT_EQ(decoded->width, 33);
   EXPECT_EQ(decoded->height, 17);
@@ -145,19 +149,11 @@ TEST(PNGEncoding, AnythingButExactlyOneWellFormedPNGImageFailsAndWritesNothing) 
   }
 }
 
-TEST(PNGEncoding, RenderedIconEncodesToA120PixelPNG) {
-  qstest::TempDir dir("icon");
-  ASSERT_TRUE(qstest::writeSolidPNG(dir / "Icon.png", 60, 60, kOpaqueGreen));
-  platform::CairoIconRenderer renderer;
-  const std::optional<Image> icon =
-      renderer.homeScreenIconForBundle(Bundle(URL::fileURL(dir.path(), true), Dictionary{}));
+TEST_F(IconRendering, RenderedIconEncodesToA120PixelPNG) {
+  ASSERT_TRUE(qstest::writeSolidPNG(dir_ / "Icon.png", 60, 60, kOpaqueGreen));
+  const std::optional<Image> icon = renderer_.homeScreenIconForBundle(bundleWithInfo(Dictionary{}));
   ASSERT_TRUE(icon);
-  platform::PNGImageEncoding encoding;
-  Data buffer;
-  auto encoder = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
-  encoder->addImage(*icon);
-  ASSERT_TRUE(encoder->finalize());
-  const std::optional<Image> decoded = qstest::decodePNG(buffer);
+  const std::optional<Image> decoded = encodeAndDecode(*icon);
   ASSERT_TRUE(decoded);
   EXPECT_EQ(decoded->width, kSize);
   EXPECT_EQ(decoded->height, kSize);

@@ -64,6 +64,15 @@ bool RegistryTest::install(platform::SQLiteApplicationRegistry& registry, const 
       [this](const Dictionary& report) { reports_.push_back(report); }, error);
 }
 
+bool RegistryTest::installApp(platform::SQLiteApplicationRegistry& registry, const BundleSpec& bundle,
+                              const BundleSpec& plugin) {
+  std::string package = makePackage(bundle.identifier + "-" + std::to_string(++packages_), bundle, plugin);
+  platform::Error error;
+  bool installed = install(registry, package, bundle.identifier, &error);
+  EXPECT_TRUE(installed) << error.description();
+  return installed;
+}
+
 std::vector<std::string> RegistryTest::entries(const std::string& directory) {
   std::vector<std::string> names;
   std::error_code missing;

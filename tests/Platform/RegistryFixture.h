@@ -57,6 +57,11 @@ class RegistryTest : public testing::Test {
   bool install(platform::SQLiteApplicationRegistry& registry, const std::string& package, const std::string& identifier,
                platform::Error* error = nullptr);
 
+  // Packs `bundle` (and `plugin`) into a fresh package and installs it for
+  // the bundle's identifier, failing the test when the registry refuses it.
+  bool installApp(platform::SQLiteApplicationRegistry& registry, const BundleSpec& bundle,
+                  const BundleSpec& plugin = {});
+
   std::vector<platform::Dictionary> reports_;
 
   // Paths of the layout.
@@ -73,6 +78,7 @@ class RegistryTest : public testing::Test {
 
  private:
   TempDir root_{"registry"};
+  int packages_ = 0;
 };
 
 // The install options the migrator passes for a staged application.

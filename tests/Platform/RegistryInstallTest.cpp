@@ -77,13 +77,11 @@ TEST_F(RegistryInstall, ThrowingProgressCallbackDoesNotStopTheInstallation) {
 
 TEST_F(RegistryInstall, ReinstallKeepsDataContainerAndRemovesOldBundleContainer) {
   auto registry = openRegistry();
-  ASSERT_TRUE(
-      install(*registry, makePackage("v1", BundleSpec("com.example.mail").withVersion("1")), "com.example.mail"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.mail").withVersion("1")));
   BundleRecord first = *registry->recordForIdentifier("com.example.mail");
   ASSERT_TRUE(writeFile(first.dataContainerURL->path() + "/inbox", "user data"));
 
-  ASSERT_TRUE(
-      install(*registry, makePackage("v2", BundleSpec("com.example.mail").withVersion("2")), "com.example.mail"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.mail").withVersion("2")));
   BundleRecord second = *registry->recordForIdentifier("com.example.mail");
   EXPECT_EQ(second.version, "2");
   EXPECT_EQ(second.dataContainerURL->path(), first.dataContainerURL->path());
@@ -93,17 +91,18 @@ TEST_F(RegistryInstall, ReinstallKeepsDataContainerAndRemovesOldBundleContainer)
   EXPECT_EQ(entries(bundleContainers()).size(), 1u);
 }
 
-TEST_F(RegistryInstall, GroupContainerIsSharedByApplicationsOfTheGroup) {
+TEST_F(RegistryInstall, GroupContainerIsSharedByApplicationsOfTheGroupBuiltInOrNot) {
+  makeBuiltIn("Photos.app", BundleSpec("com.example.photos").withGroups({"group.shared"}));
   auto registry = openRegistry();
-  ASSERT_TRUE(install(*registry, makePackage("a", BundleSpec("com.example.a").withGroups({"group.shared", "group.a"})),
-                      "com.example.a"));
-  ASSERT_TRUE(
-      install(*registry, makePackage("b", BundleSpec("com.example.b").withGroups({"group.shared"})), "com.example.b"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.a").withGroups({"group.shared", "group.a"})));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.b").withGroups({"group.shared"})));
   auto a = *registry->recordForIdentifier("com.example.a")->groupContainerURLs;
   auto b = *registry->recordForIdentifier("com.example.b")->groupContainerURLs;
+  auto system = *registry->recordForIdentifier("com.example.photos")->groupContainerURLs;
   ASSERT_EQ(a.size(), 2u);
   ASSERT_EQ(b.size(), 1u);
   EXPECT_EQ(b.at("group.shared").path(), a.at("group.shared").path());
+  EXPECT_EQ(system.at("group.shared").path(), a.at("group.shared").path());
   EXPECT_NE(a.at("group.a").path(), a.at("group.shared").path());
   EXPECT_TRUE(isDirectory(a.at("group.shared").path()));
   EXPECT_TRUE(isDirectory(a.at("group.a").path()));
@@ -113,9 +112,7 @@ TEST_F(RegistryInstall, GroupContainerIsSharedByApplicationsOfTheGroup) {
 
 TEST_F(RegistryInstall, VPNPluginInTheSamePayloadGetsARecordOfItsOwn) {
   auto registry = openRegistry();
-  ASSERT_TRUE(install(*registry,
-                      makePackage("vpn", BundleSpec("com.example.vpn"), BundleSpec("com.example.vpn.tunnel")),
-                      "com.example.vpn"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.vpn"), BundleSpec("com.example.vpn.tunnel")));
   BundleRecord app = *registry->recordForIdentifier("com.example.vpn");
   std::optional<BundleRecord> plugin = registry->recordForIdentifier("com.example.vpn.tunnel");
   ASSERT_TRUE(plugin);
@@ -142,10 +139,7 @@ TEST_F(RegistryInstall, OlderOrEqualToBuiltInIsRefusedAndPackageRemovedNewerIsIn
     EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeSystem);
     EXPECT_TRUE(entries(bundleContainers()).empty());
   }
-  Error error;
-  ASSERT_TRUE(install(*registry, makePackage("newer", BundleSpec("com.example.clock").withVersion("2.10.1")),
-                      "com.example.clock", &error))
-      << error.description();
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.clock").withVersion("2.10.1")));
   EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeUser);
 }
 
@@ -243,7 +237,7 @@ TEST_F(RegistryReplay, InstalledPackageWithEmptiedPayloadSucceedsWithoutChange) 
 
 TEST_F(RegistryReplay, OtherPackagePathOrIdentifierIsRefused) {
   auto registry = openRegistry();
-  ASSERT_TRUE(install(*registry, makePackage("notes", BundleSpec("com.example.notes")), "com.example.notes"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.notes")));
   ASSERT_TRUE(makeDirs(at("packages/elsewhere/Payload")));
   Error error;
   EXPECT_FALSE(install(*registry, at("packages/elsewhere"), "com.example.notes", &error));

@@ -60,10 +60,7 @@ TEST_F(RegistryPlaceholder, RealInstallationKeepsItsDataContainer) {
   BundleRecord placeholder = *registry->recordForIdentifier("com.example.game");
   ASSERT_TRUE(writeFile(placeholder.dataContainerURL->path() + "/save.dat", "level 9"));
 
-  Error error;
-  ASSERT_TRUE(install(*registry, makePackage("game", BundleSpec("com.example.game").withGroups({"group.game"})),
-                      "com.example.game", &error))
-      << error.description();
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.game").withGroups({"group.game"})));
   BundleRecord real = *registry->recordForIdentifier("com.example.game");
   EXPECT_EQ(real.bundleType, platform::kBundleTypeUser);
   EXPECT_FALSE(real.isPlaceholder);
@@ -94,7 +91,7 @@ TEST_F(RegistryPlaceholder, ReplacesAnEarlierPlaceholderButNotAnInstalledApplica
   EXPECT_EQ(second.dataContainerURL->path(), first.dataContainerURL->path());
   EXPECT_FALSE(exists(first.bundleContainerURL.path()));
 
-  ASSERT_TRUE(install(*registry, makePackage("game", BundleSpec("com.example.game")), "com.example.game"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.game")));
   Error error;
   EXPECT_FALSE(installPlaceholder(*registry, staged, "com.example.game", nullptr, &error));
   EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorNotReplaceable)) << error.description();
@@ -145,23 +142,12 @@ TEST_F(RegistryBuiltIn, IsInstalledWithADataContainerMadeOnFirstLookupUnlessItHa
   EXPECT_EQ(entries(appDataContainers()).size(), 1u);
 }
 
-TEST_F(RegistryBuiltIn, GroupsShareContainersWithInstalledApplications) {
-  makeBuiltIn("Photos.app", BundleSpec("com.example.photos").withGroups({"group.media"}));
-  auto registry = openRegistry();
-  ASSERT_TRUE(install(*registry, makePackage("editor", BundleSpec("com.example.editor").withGroups({"group.media"})),
-                      "com.example.editor"));
-  auto system = *registry->recordForIdentifier("com.example.photos")->groupContainerURLs;
-  auto user = *registry->recordForIdentifier("com.example.editor")->groupContainerURLs;
-  EXPECT_EQ(system.at("group.media").path(), user.at("group.media").path());
-  EXPECT_EQ(entries(groupContainers()).size(), 1u);
-}
-
 TEST_F(RegistryBuiltIn, ApplicationAddedLaterIsSeenAndAllRecordsListsEveryone) {
   auto registry = openRegistry();
   EXPECT_FALSE(registry->isInstalled("com.example.late"));
   makeBuiltIn("Late.app", BundleSpec("com.example.late"));
   EXPECT_TRUE(registry->isInstalled("com.example.late"));
-  ASSERT_TRUE(install(*registry, makePackage("a", BundleSpec("com.example.a")), "com.example.a"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.a")));
   std::vector<BundleRecord> all = registry->allRecords();
   ASSERT_EQ(all.size(), 2u);
   EXPECT_EQ(all[0].identifier, "com.example.a");

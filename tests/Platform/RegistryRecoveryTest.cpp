@@ -69,11 +69,7 @@ TEST_F(RegistryRecovery, KilledBeforeTheCommitIsRolledBackWhenOpened) {
 }
 
 TEST_F(RegistryRecovery, KilledWhileStagingKeepsTheDataContainerOfAReinstall) {
-  {
-    auto registry = openRegistry();
-    ASSERT_TRUE(
-        install(*registry, makePackage("v1", BundleSpec("com.example.mail").withVersion("1")), "com.example.mail"));
-  }
+  ASSERT_TRUE(installApp(*openRegistry(), BundleSpec("com.example.mail").withVersion("1")));
   std::string data = openRegistry()->recordForIdentifier("com.example.mail")->dataContainerURL->path();
   ASSERT_TRUE(writeFile(data + "/inbox", "mail"));
   std::string package = makePackage("v2", BundleSpec("com.example.mail").withVersion("2"));
@@ -89,11 +85,7 @@ TEST_F(RegistryRecovery, KilledWhileStagingKeepsTheDataContainerOfAReinstall) {
 }
 
 TEST_F(RegistryRecovery, KilledAfterTheCommitFinishesTheRemovalsWhenOpened) {
-  {
-    auto registry = openRegistry();
-    ASSERT_TRUE(
-        install(*registry, makePackage("v1", BundleSpec("com.example.mail").withVersion("1")), "com.example.mail"));
-  }
+  ASSERT_TRUE(installApp(*openRegistry(), BundleSpec("com.example.mail").withVersion("1")));
   std::string oldContainer = openRegistry()->recordForIdentifier("com.example.mail")->bundleContainerURL.path();
   std::string package = makePackage("v2", BundleSpec("com.example.mail").withVersion("2"));
   ASSERT_TRUE(installKilledAt(package, "com.example.mail", "CleaningUp"));
@@ -116,9 +108,7 @@ using RegistryConcurrency = RegistryTest;
 
 TEST_F(RegistryConcurrency, ReadersSeeWholeRecordsWhileAnotherThreadInstalls) {
   auto registry = openRegistry();
-  ASSERT_TRUE(install(*registry,
-                      makePackage("v0", BundleSpec("com.example.app").withVersion("0").withGroups({"group.g"})),
-                      "com.example.app"));
+  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.app").withVersion("0").withGroups({"group.g"})));
   const std::string data = registry->recordForIdentifier("com.example.app")->dataContainerURL->path();
   std::atomic<bool> done{false};
   std::atomic<int> inconsistent{0}, lookups{0};
@@ -136,13 +126,8 @@ TEST_F(RegistryConcurrency, ReadersSeeWholeRecordsWhileAnotherThreadInstalls) {
       }
     });
   }
-  for (int version = 1; version <= 5; ++version) {
-    std::string v = std::to_string(version);
-    Error error;
-    EXPECT_TRUE(install(*registry,
-                        makePackage("v" + v, BundleSpec("com.example.app").withVersion(v).withGroups({"group.g"})),
-                        "com.example.app", &error))
-        << error.description();
+  for (const char* v : {"1", "2", "3", "4", "5"}) {
+    EXPECT_TRUE(installApp(*registry, BundleSpec("com.example.app").withVersion(v).withGroups({"group.g"})));
   }
   done = true;
   for (std::thread& reader : readers) reader.join();

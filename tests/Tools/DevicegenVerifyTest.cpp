@@ -3,6 +3,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <functional>
+
 #include <gtest/gtest.h>
 
 #include "MigrationSimulator.h"
@@ -90,43 +92,40 @@ TEST_F(DevicegenVerify, UnmigratedImageFailsListingWhatIsLeftAndNotInstalled) {
   EXPECT_NE(run.out.find("FAILED"), std::string::npos);
 }
 
-TEST_F(DevicegenVerify, ChangedFileIsReportedWithItsDigest) {
+TEST_F(DevicegenVerify, ChangedTruncatedRemovedOrRetargetedItemIsReported) {
   migrate();
   const auto [owner, path] = firstItem("File");
   const std::string file = dataContainer(owner) + "/" + path;
-  std::string bytes = tooltest::readBytes(file);
+  const std::string bytes = qstest::readFile(file);
   ASSERT_FALSE(bytes.empty());
-  bytes[0] = static_cast<char>(bytes[0] ^ 0x5A);  // same size, other content
-  ASSERT_TRUE(qstest::writeFile(file, bytes));
-  const tooltest::RunResult run = verify();
-  EXPECT_EQ(run.status, 1);
-  EXPECT_NE(run.out.find("problems: 1 (changed 1)"), std::string::npos) << run.out;
-  EXPECT_NE(run.out.find("changed: " + file + ": content differs (SHA-256 " + tooltest::sha256Hex(bytes)),
-            std::string::npos)
-      << run.out;
-}
-
-TEST_F(DevicegenVerify, TruncatedFileIsReportedWithItsSize) {
-  migrate();
-  const auto [owner, path] = firstItem("File");
-  const std::string file = dataContainer(owner) + "/" + path;
-  const size_t size = tooltest::readBytes(file).size();
-  ASSERT_EQ(truncate(file.c_str(), 1), 0);
-  const tooltest::RunResult run = verify();
-  EXPECT_EQ(run.status, 1);
-  EXPECT_NE(run.out.find("changed: " + file + ": 1 bytes, expected " + std::to_string(size)), std::string::npos)
-      << run.out;
-}
-
-TEST_F(DevicegenVerify, RemovedFileIsReportedMissing) {
-  migrate();
-  const auto [owner, path] = firstItem("File");
-  const std::string file = dataContainer(owner) + "/" + path;
-  ASSERT_EQ(unlink(file.c_str()), 0);
-  const tooltest::RunResult run = verify();
-  EXPECT_EQ(run.status, 1);
-  EXPECT_NE(run.out.find("problems: 1 (missing 1)"), std::string::npos) << run.out;
-  EXPECT_NE(run.out.find("missing: " + file + " (data of " + owner + ")"), std::string::npos) << run.out;
+  std::string changed = bytes;
+  changed[0] = static_cast<char>(changed[0] ^ 0x5A);  // same size, other content
+  const auto [linkOwner, linkPath] = firstItem("Link");
+  const std::string link = dataContainer(linkOwner) + "/" + linkPath;
+  const std::string target = tooltest::snapshotTree(dataContainer(linkOwner))[linkPath].content;
+  const struct {
+    std::function<bool()> damage, repair;
+    std::string problems, line;
+  } cases[] = {
+      {[&] { return qstest::writeFile(file, changed); }, [&] { return qstest::writeFile(file, bytes); },
+       "problems: 1 (changed 1)", "changed: " + file + ": content differs (SHA-256 " + tooltest::sha256Hex(changed)},
+      {[&] { return truncate(file.c_str(), 1) == 0; }, [&] { return qstest::writeFile(file, bytes); },
+       "problems: 1 (changed 1)", "changed: " + file + ": 1 bytes, expected " + std::to_string(bytes.size())},
+      {[&] { return unlink(file.c_str()) == 0; }, [&] { return qstest::writeFile(file, bytes); },
+       "problems: 1 (missing 1)", "missing: " + file + " (data of " + owner + ")"},
+      {[&] { return unlink(link.c_str()) == 0 && symlink("elsewhere", link.c_str()) == 0; },
+       [&] { return unlink(link.c_str()) == 0 && symlink(target.c_str(), link.c_str()) == 0; },
+       "problems: 1 (changed 1)", "changed: " + link + ": link reads \"elsewhere\""},
+  };
+  for (const auto& c : cases) {
+    ASSERT_TRUE(c.damage()) << c.line;
+    const tooltest::RunResult run = verify();
+    EXPECT_EQ(run.status, 1);
+    EXPECT_NE(run.out.find(c.problems), std::string::npos) << run.out;
+    EXPECT_NE(run.out.find(c.line), std::string::npos) << run.out;
+    ASSERT_TRUE(c.repair()) << c.line;
+  }
+  EXPECT_EQ(verify().status, 0) << "every damage was repaired";
 }
 
 TEST_F(DevicegenVerify, FileMissingFromASharedGroupContainerIsReported) {
@@ -155,17 +154,6 @@ TEST_F(DevicegenVerify, FileMissingFromASharedGroupContainerIsReported) {
   EXPECT_EQ(run.status, 1);
   EXPECT_NE(run.out.find("problems: 1 (missing 1)"), std::string::npos) << run.out;
   EXPECT_NE(run.out.find("missing: " + file + " (group " + identifier + ")"), std::string::npos) << run.out;
-}
-
-TEST_F(DevicegenVerify, RetargetedLinkIsReported) {
-  migrate();
-  const auto [owner, path] = firstItem("Link");
-  const std::string link = dataContainer(owner) + "/" + path;
-  ASSERT_EQ(unlink(link.c_str()), 0);
-  ASSERT_EQ(symlink("elsewhere", link.c_str()), 0);
-  const tooltest::RunResult run = verify();
-  EXPECT_EQ(run.status, 1);
-  EXPECT_NE(run.out.find("changed: " + link + ": link reads \"elsewhere\""), std::string::npos) << run.out;
 }
 
 TEST_F(DevicegenVerify, LeftoversOfTheOldLayoutAreReported) {

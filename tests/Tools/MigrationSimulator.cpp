@@ -134,7 +134,7 @@ std::string simulateMigration(const std::string& root) {
   unlink((root + kSafeHarborMap).c_str());
   if (!removeTree(root + kOldApplications)) return "cannot remove the old applications directory";
   unlink((root + kInstallMap).c_str());
-  if (!qstest::writeFile(root + kLastSystemVersion, readBytes(root + kSystemVersion)))
+  if (!qstest::writeFile(root + kLastSystemVersion, qstest::readFile(root + kSystemVersion)))
     return "cannot record the version";
   return "";
 }

@@ -40,7 +40,6 @@ struct TreeEntry {
 // Every item below `root` (not following links), by path relative to it.
 std::map<std::string, TreeEntry> snapshotTree(const std::string& root);
 
-std::string readBytes(const std::string& path);
 std::string sha256Hex(const std::string& bytes);
 // The dictionary in the property list at `path`; an empty one (and a test
 // failure) when it cannot be read.
