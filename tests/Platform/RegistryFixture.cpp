@@ -59,9 +59,14 @@ std::string RegistryTest::makeBuiltIn(const std::string& name, const BundleSpec&
 bool RegistryTest::install(platform::SQLiteApplicationRegistry& registry, const std::string& package,
                            const std::string& identifier, platform::Error* error) {
   reports_.clear();
+  reporterThreads_.clear();
   return registry.installPackage(
       platform::URL::fileURL(package, true), customerOptions(identifier),
-      [this](const Dictionary& report) { reports_.push_back(report); }, error);
+      [this](const Dictionary& report) {
+        reports_.push_back(report);
+        reporterThreads_.push_back(std::this_thread::get_id());
+      },
+      error);
 }
 
 bool RegistryTest::installApp(platform::SQLiteApplicationRegistry& registry, const BundleSpec& bundle,
@@ -91,22 +96,13 @@ Dictionary customerOptions(const std::string& identifier) {
                     {platform::kBundleIdentifierKey, Value(identifier)}};
 }
 
-std::vector<std::string> statuses(const std::vector<Dictionary>& reports) {
-  std::vector<std::string> out;
+std::vector<std::string> reportValues(const std::vector<Dictionary>& reports, const char* key) {
+  std::vector<std::string> values;
   for (const Dictionary& report : reports) {
-    auto it = report.find(platform::kRegistryProgressStatusKey);
-    if (it != report.end() && it->second.asString()) out.push_back(*it->second.asString());
+    auto it = report.find(key);
+    if (it != report.end() && it->second.asString()) values.push_back(*it->second.asString());
   }
-  return out;
-}
-
-std::string reportedError(const std::vector<Dictionary>& reports) {
-  std::string name;
-  for (const Dictionary& report : reports) {
-    auto it = report.find(platform::kRegistryProgressErrorKey);
-    if (it != report.end() && it->second.asString()) name = *it->second.asString();
-  }
-  return name;
+  return values;
 }
 
 }  // namespace qstest

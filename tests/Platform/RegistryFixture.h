@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "Platform/Registry/SQLiteRegistry.h"
@@ -53,7 +54,7 @@ class RegistryTest : public testing::Test {
   std::string makeBuiltIn(const std::string& name, const BundleSpec& bundle);
 
   // Installs a package with the migrator's options for `identifier`,
-  // collecting the progress reports.
+  // collecting the progress reports and the threads they came from.
   bool install(platform::SQLiteApplicationRegistry& registry, const std::string& package, const std::string& identifier,
                platform::Error* error = nullptr);
 
@@ -63,6 +64,7 @@ class RegistryTest : public testing::Test {
                   const BundleSpec& plugin = {});
 
   std::vector<platform::Dictionary> reports_;
+  std::vector<std::thread::id> reporterThreads_;
 
   // Paths of the layout.
   std::string bundleContainers() const { return at("private/var/containers/Bundle/Application"); }
@@ -84,9 +86,16 @@ class RegistryTest : public testing::Test {
 // The install options the migrator passes for a staged application.
 platform::Dictionary customerOptions(const std::string& identifier);
 
-// The Status values of a list of progress reports, in order.
-std::vector<std::string> statuses(const std::vector<platform::Dictionary>& reports);
-// The "Error" value of the last report that has one, or "".
-std::string reportedError(const std::vector<platform::Dictionary>& reports);
+// The values under `key` ("Status" or "Error") of a list of progress
+// reports, in order.
+std::vector<std::string> reportValues(const std::vector<platform::Dictionary>& reports, const char* key);
+inline std::vector<std::string> statuses(const std::vector<platform::Dictionary>& reports) {
+  return reportValues(reports, platform::kRegistryProgressStatusKey);
+}
+// The last "Error" value, or "".
+inline std::string reportedError(const std::vector<platform::Dictionary>& reports) {
+  std::vector<std::string> errors = reportValues(reports, platform::kRegistryProgressErrorKey);
+  return errors.empty() ? "" : errors.back();
+}
 
 }  // namespace qstest

@@ -24,21 +24,14 @@ TEST_F(RegistryInstall, MovesBundleIntoNewContainersAndRemovesPackage) {
   std::string package =
       makePackage("notes", BundleSpec("com.example.notes").withVersion("1.2").withDisplayName("Notes"), {},
                   {"VendraMetadata.plist", "Manifest.plist"});
-  std::thread::id caller = std::this_thread::get_id();
-  std::vector<std::thread::id> reporters;
   Error error;
-  ASSERT_TRUE(registry->installPackage(
-      platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
-      [&](const platform::Dictionary& report) {
-        reports_.push_back(report);
-        reporters.push_back(std::this_thread::get_id());
-      },
-      &error))
-      << error.description();
+  ASSERT_TRUE(install(*registry, package, "com.example.notes", &error)) << error.description();
 
   EXPECT_EQ(statuses(reports_), (std::vector<std::string>{"VerifyingApplication", "StagingFiles",
                                                           "RegisteringApplication", "CleaningUp", "Complete"}));
-  for (std::thread::id id : reporters) EXPECT_NE(id, caller) << "reports come from the registry's worker thread";
+  for (std::thread::id id : reporterThreads_) {
+    EXPECT_NE(id, std::this_thread::get_id()) << "reports come from the registry's worker thread";
+  }
   EXPECT_FALSE(exists(package));
 
   std::optional<BundleRecord> record = registry->recordForIdentifier("com.example.notes");

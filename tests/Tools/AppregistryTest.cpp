@@ -165,13 +165,6 @@ TEST_F(Appregistry, ShowOfAPlaceholderHasNoGroupContainers) {
   EXPECT_NE(text.out.find("group containers:  -\n"), std::string::npos) << text.out;
 }
 
-TEST_F(Appregistry, ShowOfAnUnknownIdentifierFails) {
-  const tooltest::RunResult result = run({"show", "com.example.none", "--root", root_});
-  EXPECT_EQ(result.status, 1);
-  EXPECT_EQ(result.out, "");
-  EXPECT_NE(result.err.find("no record for com.example.none"), std::string::npos) << result.err;
-}
-
 TEST_F(Appregistry, UsageErrorsExit64) {
   for (const auto& args : std::vector<std::vector<std::string>>{
            {}, {"list"}, {"show", "--root", root_}, {"list", "--root", root_, "--yaml"}, {"drop", "--root", root_}}) {
@@ -181,10 +174,14 @@ TEST_F(Appregistry, UsageErrorsExit64) {
   }
 }
 
-TEST_F(Appregistry, MissingRootIsAFailure) {
-  const tooltest::RunResult result = run({"list", "--root", dir_ / "absent"});
-  EXPECT_EQ(result.status, 1);
-  EXPECT_NE(result.err.find("appregistry: "), std::string::npos) << result.err;
+TEST_F(Appregistry, UnknownIdentifierOrMissingRootIsAFailure) {
+  const tooltest::RunResult unknown = run({"show", "com.example.none", "--root", root_});
+  EXPECT_EQ(unknown.status, 1);
+  EXPECT_EQ(unknown.out, "");
+  EXPECT_NE(unknown.err.find("no record for com.example.none"), std::string::npos) << unknown.err;
+  const tooltest::RunResult missing = run({"list", "--root", dir_ / "absent"});
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_NE(missing.err.find("appregistry: "), std::string::npos) << missing.err;
 }
 
 }  // namespace
