@@ -35,51 +35,34 @@ class FilePreferences : public testing::Test {
 
 TEST_F(FilePreferences, DomainFileIsUnderThePreferencesDirectory) {
   EXPECT_EQ(store_.pathForDomain(kDomain), root_ / "private/var/quilld/Library/Preferences/com.vantrel.quill.set.plist");
-  EXPECT_EQ(platform::FilePreferenceStore("/").pathForDomain("d"), "/private/var/quilld/Library/Preferences/d.plist");
-  EXPECT_EQ(platform::FilePreferenceStore("").pathForDomain("d"), "/private/var/quilld/Library/Preferences/d.plist");
+  for (const char* root : {"/", ""}) {
+    EXPECT_EQ(platform::FilePreferenceStore(root).pathForDomain("d"), "/private/var/quilld/Library/Preferences/d.plist");
+  }
   EXPECT_EQ(platform::FilePreferenceStore("/r//").pathForDomain("d"),
             "/r/private/var/quilld/Library/Preferences/d.plist");
 }
 
-TEST_F(FilePreferences, ValuesAreReadWithTheirTypes) {
-  writeDomain(Value(Dictionary{{"LowerInstallPriority", Value(true)},
-                               {"SimultaneousInstallsNumber", Value(3)},
-                               {"List", Value(Array{Value("a")})}}));
-  std::optional<Value> lower = store_.copyValue("LowerInstallPriority", kDomain);
-  ASSERT_TRUE(lower);
-  EXPECT_EQ(*lower, Value(true));
-  std::optional<Value> number = store_.copyValue("SimultaneousInstallsNumber", kDomain);
-  ASSERT_TRUE(number);
-  EXPECT_EQ(*number, Value(3));
+TEST_F(FilePreferences, ValuesAreReadWithTheirTypesAfreshOnEachCall) {
+  writeDomain(Value(Dictionary{{"LowerInstallPriority", Value(true)}, {"List", Value(Array{Value("a")})}}));
+  EXPECT_EQ(store_.copyValue("LowerInstallPriority", kDomain), Value(true));
   EXPECT_EQ(store_.copyValue("List", kDomain), Value(Array{Value("a")}));
   EXPECT_FALSE(store_.copyValue("SkipThinningCheck", kDomain));
+  writeDomain(Value(Dictionary{{"LowerInstallPriority", Value(3)}}));
+  EXPECT_EQ(store_.copyValue("LowerInstallPriority", kDomain), Value(3));
 }
 
-TEST_F(FilePreferences, EachCallReadsTheFileAfresh) {
-  writeDomain(Value(Dictionary{{"k", Value(1)}}));
-  EXPECT_EQ(store_.copyValue("k", kDomain), Value(1));
-  writeDomain(Value(Dictionary{{"k", Value(2)}}));
-  EXPECT_EQ(store_.copyValue("k", kDomain), Value(2));
-}
-
-TEST_F(FilePreferences, MissingDomainReadsAsEmptyAndReportsNoSuchFile) {
-  EXPECT_FALSE(store_.copyValue("k", kDomain));
+TEST_F(FilePreferences, MissingOrBadDomainReadsAsEmpty) {
   Error error;
+  EXPECT_FALSE(store_.copyValue("k", kDomain));
   EXPECT_FALSE(store_.copyDomain(kDomain, &error));
   EXPECT_TRUE(error.is(platform::kFileErrorDomain, platform::kFileReadNoSuchFileError)) << error.description();
-}
 
-TEST_F(FilePreferences, NonDictionaryDomainReadsAsEmpty) {
   writeDomain(Value(Array{Value("k")}));
   EXPECT_FALSE(store_.copyValue("k", kDomain));
-  Error error;
   EXPECT_FALSE(store_.copyDomain(kDomain, &error));
   EXPECT_TRUE(error.is(platform::kFileErrorDomain, platform::kFileReadUnknownError));
   EXPECT_NE(error.localizedDescription().find("not a dictionary"), std::string::npos);
-}
 
-TEST_F(FilePreferences, MalformedDomainReadsAsEmpty) {
-  ASSERT_TRUE(qstest::makeDirs(root_ / "private/var/quilld/Library/Preferences"));
   ASSERT_TRUE(qstest::writeFile(store_.pathForDomain(kDomain),
                                 "<plist><dict><key>k</key><integer>abc</integer></dict></plist>"));
   EXPECT_FALSE(store_.copyValue("k", kDomain));
@@ -98,16 +81,11 @@ TEST_F(FilePreferences, DomainNamesThatLeaveTheDirectoryAreRefused) {
   }
 }
 
-TEST(SystemRoot, TrailingSeparatorsAreDropped) {
-  EXPECT_EQ(platform::normalizedSystemRoot("/"), "");
-  EXPECT_EQ(platform::normalizedSystemRoot("///"), "");
-  EXPECT_EQ(platform::normalizedSystemRoot(""), "");
-  EXPECT_EQ(platform::normalizedSystemRoot("/tmp/root/"), "/tmp/root");
-  EXPECT_EQ(platform::normalizedSystemRoot("/tmp/root//"), "/tmp/root");
-  EXPECT_EQ(platform::normalizedSystemRoot("/tmp/root"), "/tmp/root");
-}
-
-TEST(SystemRoot, EnvironmentIsReadOnceIntoOneObject) {
+TEST(SystemRoot, IsNormalisedAndReadOnceIntoOneObject) {
+  for (const char* root : {"/", "///", ""}) EXPECT_EQ(platform::normalizedSystemRoot(root), "");
+  for (const char* root : {"/tmp/root/", "/tmp/root//", "/tmp/root"}) {
+    EXPECT_EQ(platform::normalizedSystemRoot(root), "/tmp/root");
+  }
   EXPECT_EQ(platform::systemRootFromEnvironment(), platform::normalizedSystemRoot(qstest::systemRoot()));
   EXPECT_FALSE(platform::systemRootFromEnvironment().empty());
 
@@ -126,48 +104,31 @@ TEST(SystemRoot, EnvironmentIsReadOnceIntoOneObject) {
   setenv("QS_SYSTEM_ROOT", qstest::systemRoot().c_str(), 1);
 }
 
-class SystemVersionFile : public testing::Test {
- protected:
-  SystemVersionFile() : source_(root_.path() + "/") {}
-  std::string directory() const { return root_ / "System/Library/CoreServices"; }
-  qstest::TempDir root_;
-  platform::FileSystemVersionSource source_;
-};
-
-TEST_F(SystemVersionFile, PathIsUnderCoreServices) {
-  EXPECT_EQ(source_.path(), root_ / "System/Library/CoreServices/SystemVersion.plist");
+TEST(SystemVersionFile, IsReadWholeFromCoreServicesAndRefusedWhenMissingOrNotADictionary) {
+  qstest::TempDir root;
+  platform::FileSystemVersionSource source(root.path() + "/");
+  EXPECT_EQ(source.path(), root / "System/Library/CoreServices/SystemVersion.plist");
   EXPECT_EQ(platform::FileSystemVersionSource("/").path(), "/System/Library/CoreServices/SystemVersion.plist");
-}
 
-TEST_F(SystemVersionFile, DictionaryIsReadWhole) {
-  ASSERT_TRUE(qstest::makeDirs(directory()));
-  Dictionary version{{platform::kSystemVersionBuildVersionKey, Value("21A100")},
-                     {platform::kSystemVersionProductVersionKey, Value("17.0")},
-                     {platform::kSystemVersionProductNameKey, Value("Quill OS")},
-                     {"Extra", Value(Array{Value(1)})}};
-  ASSERT_TRUE(plist::writeFile(Value(version), URL::fileURL(source_.path()), plist::Format::Binary));
-  std::optional<Dictionary> read = source_.systemVersionDictionary();
-  ASSERT_TRUE(read);
-  EXPECT_EQ(Value(*read), Value(version));
-}
-
-TEST_F(SystemVersionFile, MissingFileIsNoneWithNoSuchFile) {
-  EXPECT_FALSE(source_.systemVersionDictionary());
   Error error;
-  EXPECT_FALSE(source_.readSystemVersionDictionary(&error));
+  EXPECT_FALSE(source.systemVersionDictionary());
+  EXPECT_FALSE(source.readSystemVersionDictionary(&error));
   EXPECT_TRUE(error.is(platform::kFileErrorDomain, platform::kFileReadNoSuchFileError)) << error.description();
   ASSERT_NE(error.underlyingError(), nullptr);
   EXPECT_TRUE(error.underlyingError()->isPOSIX(ENOENT));
-}
 
-TEST_F(SystemVersionFile, OtherRootIsRefused) {
-  ASSERT_TRUE(qstest::makeDirs(directory()));
-  ASSERT_TRUE(plist::writeFile(Value("21A100"), URL::fileURL(source_.path())));
-  EXPECT_FALSE(source_.systemVersionDictionary());
-  Error error;
-  EXPECT_FALSE(source_.readSystemVersionDictionary(&error));
+  ASSERT_TRUE(qstest::makeDirs(root / "System/Library/CoreServices"));
+  ASSERT_TRUE(plist::writeFile(Value("21A100"), URL::fileURL(source.path())));
+  EXPECT_FALSE(source.systemVersionDictionary());
+  EXPECT_FALSE(source.readSystemVersionDictionary(&error));
   EXPECT_TRUE(error.is(platform::kFileErrorDomain, platform::kFileReadUnknownError));
   EXPECT_NE(error.localizedDescription().find("root is a string, not a dictionary"), std::string::npos);
+
+  Dictionary version{{platform::kSystemVersionBuildVersionKey, Value("21A100")},
+                     {platform::kSystemVersionProductVersionKey, Value("17.0")},
+                     {"Extra", Value(Array{Value(1)})}};
+  ASSERT_TRUE(plist::writeFile(Value(version), URL::fileURL(source.path()), plist::Format::Binary));
+  EXPECT_EQ(source.systemVersionDictionary(), version);
 }
 
 }  // namespace
