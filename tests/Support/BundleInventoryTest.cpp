@@ -47,33 +47,33 @@ class BundleInventory : public ::testing::Test {
   qstest::LogCapture log_;
 };
 
-TEST_F(BundleInventory, MapHoldsFilteredInfoAndTheBundleURL) {
+TEST_F(BundleInventory, MapHoldsFilteredInfoAndTheBundleURLOfCaseSensitiveAppBundles) {
   app("Applications", "Maps.app", "com.vantrel.maps", "7.1");
-  std::optional<Dictionary> map = config_.systemAppBundleIDToInfoMap();
-  ASSERT_TRUE(map.has_value());
-  ASSERT_EQ(map->size(), 1u);
-  const Value& info = map->at("com.vantrel.maps");
-  ASSERT_TRUE(info.isDictionary());
-  EXPECT_EQ(*info.asDictionary(),
-            (Dictionary{{"RkBundleIdentifier", Value("com.vantrel.maps")},
-                        {"RkBundleVersion", Value("7.1")},
-                        {"com.vantrel.Quillset.bundleURL", Value(URL::fileURL(root_ / "Applications/Maps.app", true))}}));
-}
-
-TEST_F(BundleInventory, ExtensionTestIsCaseSensitive) {
-  app("Applications", "A.app", "com.example.a");
   app("Applications", "B.APP", "com.example.b");
   app("Applications", "C.framework", "com.example.c");
-  EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), std::set<std::string>{"com.example.a"});
+  std::optional<Dictionary> map = config_.systemAppBundleIDToInfoMap();
+  ASSERT_TRUE(map.has_value());
+  ASSERT_EQ(keysOf(map), std::set<std::string>{"com.vantrel.maps"});
+  EXPECT_EQ(map->at("com.vantrel.maps"),
+            Value(Dictionary{{"RkBundleIdentifier", Value("com.vantrel.maps")},
+                             {"RkBundleVersion", Value("7.1")},
+                             {"com.vantrel.Quillset.bundleURL", Value(URL::fileURL(root_ / "Applications/Maps.app", true))}}));
 }
 
-TEST_F(BundleInventory, BundleWithoutIdentifierIsSkippedWithDebugLine) {
-  supporttest::ScopedLogHandle verbose(7);
+TEST_F(BundleInventory, BundleWithoutStringIdentifierIsSkippedWithDebugLine) {
   app("Applications", "Good.app", "com.example.good");
   ASSERT_TRUE(makeBundle(root_ / "Applications/NoID.app", {{"RkBundleVersion", "1"}}));
   ASSERT_TRUE(qstest::makeDirs(root_ / "Applications/NoPlist.app"));
+  ASSERT_TRUE(qstest::makeDirs(root_ / "Applications/Num.app"));
+  ASSERT_TRUE(qstest::writeFile(root_ / "Applications/Num.app/Info.plist",
+                                "<plist version=\"1.0\"><dict><key>RkBundleIdentifier</key><integer>5</integer>"
+                                "</dict></plist>\n"));
   EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), std::set<std::string>{"com.example.good"});
+  EXPECT_TRUE(log_.systemLines().empty()) << "debug lines are dropped without a handle";
 
+  supporttest::ScopedLogHandle verbose(7);
+  config_.reScanSystemApps();
+  EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), std::set<std::string>{"com.example.good"});
   std::string noID = URL::fileURL(root_ / "Applications/NoID.app", true).description();
   std::string noPlist = URL::fileURL(root_ / "Applications/NoPlist.app", true).description();
   size_t idLines = 0;
@@ -86,25 +86,6 @@ TEST_F(BundleInventory, BundleWithoutIdentifierIsSkippedWithDebugLine) {
   }
   EXPECT_EQ(idLines, 1u);
   EXPECT_EQ(plistLines, 1u);
-}
-
-TEST_F(BundleInventory, DebugLinesAreDroppedWithoutAHandle) {
-  ASSERT_TRUE(makeBundle(root_ / "Applications/NoID.app", {{"RkBundleVersion", "1"}}));
-  std::optional<Dictionary> map = config_.systemAppBundleIDToInfoMap();
-  ASSERT_TRUE(map.has_value());
-  EXPECT_TRUE(map->empty());
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(BundleInventory, NonStringIdentifierIsSkipped) {
-  std::string bundle = root_ / "Applications/Num.app";
-  ASSERT_TRUE(qstest::makeDirs(bundle));
-  ASSERT_TRUE(qstest::writeFile(bundle + "/Info.plist",
-                                "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\">\n<dict>\n"
-                                "<key>RkBundleIdentifier</key><integer>5</integer>\n</dict>\n</plist>\n"));
-  std::optional<Dictionary> map = config_.systemAppBundleIDToInfoMap();
-  ASSERT_TRUE(map.has_value());
-  EXPECT_TRUE(map->empty());
 }
 
 TEST_F(BundleInventory, MissingDirectoryIsAbsentSilentlyAndListedAgainNextTime) {
@@ -141,16 +122,7 @@ TEST_F(BundleInventory, LaterBundleWithTheSameIdentifierWins) {
   EXPECT_EQ(url->asURL()->path(), listing->back().path());
 }
 
-TEST_F(BundleInventory, CachedMapIsKeptUntilReScan) {
-  app("Applications", "One.app", "com.example.one");
-  EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), std::set<std::string>{"com.example.one"});
-  app("Applications", "Two.app", "com.example.two");
-  EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), std::set<std::string>{"com.example.one"});
-  config_.reScanSystemApps();
-  EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), (std::set<std::string>{"com.example.one", "com.example.two"}));
-}
-
-TEST_F(BundleInventory, EachReScanDropsOnlyItsOwnMap) {
+TEST_F(BundleInventory, CachedMapIsKeptUntilItsOwnReScan) {
   app("Applications", "S.app", "com.example.s");
   app("System/Library/CoreServices", "C.app", "com.example.c");
   app("VantrelInternal/Applications", "I.app", "com.example.i");
@@ -160,15 +132,17 @@ TEST_F(BundleInventory, EachReScanDropsOnlyItsOwnMap) {
   app("Applications", "S2.app", "com.example.s2");
   app("System/Library/CoreServices", "C2.app", "com.example.c2");
   app("VantrelInternal/Applications", "I2.app", "com.example.i2");
+  EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), std::set<std::string>{"com.example.s"});
 
   config_.reScanCoreServicesApps();
   EXPECT_EQ(keysOf(config_.coreServicesAppBundleIDToInfoMap()).size(), 2u);
   EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()).size(), 1u);
   EXPECT_EQ(keysOf(config_.internalAppBundleIDToInfoMap()).size(), 1u);
-
   config_.reScanInternalApps();
   EXPECT_EQ(keysOf(config_.internalAppBundleIDToInfoMap()).size(), 2u);
   EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()).size(), 1u);
+  config_.reScanSystemApps();
+  EXPECT_EQ(keysOf(config_.systemAppBundleIDToInfoMap()), (std::set<std::string>{"com.example.s", "com.example.s2"}));
 }
 
 TEST_F(BundleInventory, FrameworkSetCoversTheFourDirectoriesAndFollowsReScans) {
@@ -229,18 +203,19 @@ class DiskImages : public BundleInventory {
   URL developerApps() { return config_.developerAppsDirectory(); }
 };
 
-TEST_F(DiskImages, NoControllerGivesOnlyTheDeveloperApplications) {
+TEST_F(DiskImages, WithoutMountedImagesOnlyTheDeveloperApplicationsAreSearched) {
   EXPECT_TRUE(config_.diskImageMountPoints().empty());
   EXPECT_EQ(config_.diskImageApplicationsDirectories(), std::vector<URL>{developerApps()});
-}
-
-TEST_F(DiskImages, NoAttachedImageGivesOnlyTheDeveloperApplications) {
   loopDevice("loop0", false);
   loopDevice("loop1", false);
   mountTable({});
   EXPECT_TRUE(config_.diskImageMountPoints().empty());
   EXPECT_EQ(config_.diskImageApplicationsDirectories(), std::vector<URL>{developerApps()});
   EXPECT_TRUE(log_.systemLines().empty());
+  // An image mounted on the developer directory is not listed twice.
+  loopDevice("loop2", true);
+  mountTable({{"/dev/loop2", root_ / "Developer"}});
+  EXPECT_EQ(config_.diskImageApplicationsDirectories(), std::vector<URL>{developerApps()});
 }
 
 TEST_F(DiskImages, MountedImagesAndPartitionsAreFoundInDeviceOrder) {
@@ -274,12 +249,6 @@ TEST_F(DiskImages, DebugMountIsNeverSearched) {
   EXPECT_EQ(config_.diskImageApplicationsDirectories(),
             (std::vector<URL>{URL::fileURL(root_ / "mnt/image/Applications", true), developerApps()}));
   EXPECT_EQ(keysOf(config_.diskImageAppBundleIDToInfoMap()), std::set<std::string>{"com.example.image"});
-}
-
-TEST_F(DiskImages, DeveloperDirectoryIsNotListedTwice) {
-  loopDevice("loop0", true);
-  mountTable({{"/dev/loop0", root_ / "Developer"}});
-  EXPECT_EQ(config_.diskImageApplicationsDirectories(), std::vector<URL>{developerApps()});
 }
 
 TEST_F(DiskImages, LaterDirectoriesOverwriteEarlierIdentifiers) {

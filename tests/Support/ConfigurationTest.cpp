@@ -3,6 +3,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <functional>
+#include <map>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -31,105 +33,56 @@ class ConfigurationPreferences : public ::testing::Test {
   qstest::LogCapture log_;
 };
 
-TEST_F(ConfigurationPreferences, DefaultsWithoutPreferencesWriteNoLine) {
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_TRUE(config.lowerInstallPriority());
-  EXPECT_FALSE(config.skipDeviceFamilyCheck());
-  EXPECT_FALSE(config.skipThinningCheck());
-  EXPECT_EQ(config.nSimultaneousInstallations(), 4);
-  EXPECT_EQ(config.uid(), 33u);
-  EXPECT_EQ(config.gid(), 33u);
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(ConfigurationPreferences, EveryKeyIsReadFromTheInstallerDomain) {
-  QSGlobalConfiguration config("/", store_);
-  std::vector<std::string> domains = store_.domainsAsked();
-  ASSERT_EQ(domains.size(), 4u);
-  for (const std::string& domain : domains) EXPECT_EQ(domain, kDomain);
-}
-
-TEST_F(ConfigurationPreferences, LowerInstallPriorityFalseTurnsItOffWithNotice) {
-  store_.set("LowerInstallPriority", Value(false));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_FALSE(config.lowerInstallPriority());
-  auto lines = log_.systemLines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].level, 5);
-  EXPECT_EQ(lines[0].function, kInitFunction);
-  EXPECT_EQ(lines[0].message, "Not running installation at background priority because of a set default");
-}
-
-TEST_F(ConfigurationPreferences, LowerInstallPriorityTrueOrOtherKindsKeepItOnSilently) {
-  for (Value stored : {Value(true), Value(0), Value("NO")}) {
+// Each case: the stored preferences, the settings read, the notices written.
+TEST_F(ConfigurationPreferences, SettingsAndNoticesFollowTheStoredValues) {
+  const std::string lower = "Not running installation at background priority because of a set default";
+  const std::string family = "Skipping device family check because of a set default";
+  const std::string thinning = "Skipping device thinning check because of a set default";
+  const struct {
+    std::map<std::string, Value> stored;
+    bool lowerPriority, skipFamily, skipThinning;
+    int installs;
+    std::vector<std::string> notices;
+  } cases[] = {
+      {{}, true, false, false, 4, {}},
+      {{{"LowerInstallPriority", Value(false)}}, false, false, false, 4, {lower}},
+      {{{"LowerInstallPriority", Value(true)}}, true, false, false, 4, {}},
+      {{{"LowerInstallPriority", Value(0)}}, true, false, false, 4, {}},
+      {{{"LowerInstallPriority", Value("NO")}}, true, false, false, 4, {}},
+      {{{"SkipDeviceFamilyCheck", Value(true)}}, true, true, false, 4, {family}},
+      {{{"SkipThinningCheck", Value(true)}}, true, false, true, 4, {thinning}},
+      {{{"SkipDeviceFamilyCheck", Value(1)}, {"SkipThinningCheck", Value("YES")}}, true, false, false, 4, {}},
+      {{{"SimultaneousInstallsNumber", Value("8")}}, true, false, false, 4, {}},
+      {{{"SimultaneousInstallsNumber", Value(0)}}, true, false, false, 0,
+       {"Setting simultaneous installations allowed to 0"}},
+      {{{"SimultaneousInstallsNumber", Value(-3)}}, true, false, false, -3,
+       {"Setting simultaneous installations allowed to -3"}},
+      {{{"SimultaneousInstallsNumber", Value(2)},
+        {"SkipThinningCheck", Value(true)},
+        {"SkipDeviceFamilyCheck", Value(true)},
+        {"LowerInstallPriority", Value(false)}},
+       false, true, true, 2, {lower, family, thinning, "Setting simultaneous installations allowed to 2"}},
+  };
+  for (const auto& c : cases) {
+    log_.clear();
     MemoryPreferenceStore store;
-    store.set("LowerInstallPriority", stored);
+    for (const auto& [key, value] : c.stored) store.set(key, value);
     QSGlobalConfiguration config("/", store);
-    EXPECT_TRUE(config.lowerInstallPriority()) << stored.description();
+    const std::string label = Value(platform::Dictionary(c.stored.begin(), c.stored.end())).description();
+    EXPECT_EQ(config.lowerInstallPriority(), c.lowerPriority) << label;
+    EXPECT_EQ(config.skipDeviceFamilyCheck(), c.skipFamily) << label;
+    EXPECT_EQ(config.skipThinningCheck(), c.skipThinning) << label;
+    EXPECT_EQ(config.nSimultaneousInstallations(), c.installs) << label;
+    EXPECT_EQ(config.uid(), 33u);
+    EXPECT_EQ(config.gid(), 33u);
+    EXPECT_EQ(log_.systemMessages(), c.notices) << label;
+    for (const auto& line : log_.systemLines()) {
+      EXPECT_EQ(line.level, 5);
+      EXPECT_EQ(line.function, kInitFunction);
+    }
+    std::vector<std::string> domains = store.domainsAsked();
+    EXPECT_EQ(domains, std::vector<std::string>(4, kDomain));
   }
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(ConfigurationPreferences, SkipDeviceFamilyCheckTrueWritesNotice) {
-  store_.set("SkipDeviceFamilyCheck", Value(true));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_TRUE(config.skipDeviceFamilyCheck());
-  EXPECT_FALSE(config.skipThinningCheck());
-  ASSERT_EQ(log_.systemMessages(), std::vector<std::string>{"Skipping device family check because of a set default"});
-  EXPECT_EQ(log_.systemLines()[0].level, 5);
-}
-
-TEST_F(ConfigurationPreferences, SkipThinningCheckTrueWritesNotice) {
-  store_.set("SkipThinningCheck", Value(true));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_TRUE(config.skipThinningCheck());
-  EXPECT_FALSE(config.skipDeviceFamilyCheck());
-  ASSERT_EQ(log_.systemMessages(),
-            std::vector<std::string>{"Skipping device thinning check because of a set default"});
-}
-
-TEST_F(ConfigurationPreferences, SkipChecksIgnoreAnythingButBooleanTrue) {
-  store_.set("SkipDeviceFamilyCheck", Value(1));
-  store_.set("SkipThinningCheck", Value("YES"));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_FALSE(config.skipDeviceFamilyCheck());
-  EXPECT_FALSE(config.skipThinningCheck());
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(ConfigurationPreferences, SimultaneousInstallsAsStringKeepsFourSilently) {
-  store_.set("SimultaneousInstallsNumber", Value("8"));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_EQ(config.nSimultaneousInstallations(), 4);
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(ConfigurationPreferences, SimultaneousInstallsZeroIsTakenWithNotice) {
-  store_.set("SimultaneousInstallsNumber", Value(0));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_EQ(config.nSimultaneousInstallations(), 0);
-  ASSERT_EQ(log_.systemMessages(), std::vector<std::string>{"Setting simultaneous installations allowed to 0"});
-  EXPECT_EQ(log_.systemLines()[0].function, kInitFunction);
-}
-
-TEST_F(ConfigurationPreferences, SimultaneousInstallsHasNoBounds) {
-  store_.set("SimultaneousInstallsNumber", Value(-3));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_EQ(config.nSimultaneousInstallations(), -3);
-  EXPECT_TRUE(log_.contains("Setting simultaneous installations allowed to -3"));
-}
-
-TEST_F(ConfigurationPreferences, AllNoticesInStepOrder) {
-  store_.set("SimultaneousInstallsNumber", Value(2));
-  store_.set("SkipThinningCheck", Value(true));
-  store_.set("SkipDeviceFamilyCheck", Value(true));
-  store_.set("LowerInstallPriority", Value(false));
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_EQ(log_.systemMessages(),
-            (std::vector<std::string>{"Not running installation at background priority because of a set default",
-                                      "Skipping device family check because of a set default",
-                                      "Skipping device thinning check because of a set default",
-                                      "Setting simultaneous installations allowed to 2"}));
 }
 
 TEST_F(ConfigurationPreferences, NoticesFollowTheLevelTest) {
@@ -159,50 +112,36 @@ class ConfigurationLayout : public ::testing::Test {
   MemoryPreferenceStore store_;
 };
 
-TEST_F(ConfigurationLayout, RealRootGivesTheDocumentedPaths) {
-  QSGlobalConfiguration config("/", store_);
-  EXPECT_EQ(config.systemRoot(), "");
-  EXPECT_EQ(config.oldContainerPath().path(), "/private/var/mobile/Applications");
-  EXPECT_TRUE(config.oldContainerPath().isDirectory());
-  EXPECT_EQ(config.oldInstallMapPath().path(), "/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist");
-  EXPECT_FALSE(config.oldInstallMapPath().isDirectory());
-  EXPECT_EQ(config.oldDataDirectoryPath().path(), "/private/var/mobile/Library/Quillset");
-  EXPECT_EQ(config.oldLoggingPath().path(), "/private/var/mobile/Library/Logs/Quillset");
-  EXPECT_EQ(config.oldArchiveDirectory().path(), "/private/var/mobile/Media/ApplicationArchives");
-  EXPECT_EQ(config.dataDirectoryPath().path(), "/private/var/quilld/Library/Quillset");
-  EXPECT_EQ(config.roleUserMigrationMarkerFilePath().path(), "/private/var/quilld/Library/Quillset/RoleUserMigration.plist");
-  EXPECT_FALSE(config.roleUserMigrationMarkerFilePath().isDirectory());
-  EXPECT_EQ(config.coreServicesDirectory().path(), "/System/Library/CoreServices");
-  EXPECT_EQ(config.systemAppsDirectory().path(), "/Applications");
-  EXPECT_EQ(config.internalAppsDirectory().path(), "/VantrelInternal/Applications");
-  EXPECT_EQ(config.developerAppsDirectory().path(), "/Developer/Applications");
-  EXPECT_EQ(config.factoryMountDirectory().path(), "/private/var/factory_mount");
-  EXPECT_TRUE(config.factoryMountDirectory().isDirectory());
-  EXPECT_EQ(config.systemFrameworksRootDirectory().path(), "/System/Library");
-  EXPECT_EQ(config.internalFrameworksRootDirectory().path(), "/VantrelInternal");
-  EXPECT_EQ(config.developerFrameworksRootDirectory().path(), "/Developer");
-}
-
-TEST_F(ConfigurationLayout, RootWithTrailingSeparatorIsNormalised) {
-  qstest::TempDir root("layout");
-  QSGlobalConfiguration config(root.path() + "/", store_);
-  EXPECT_EQ(config.systemRoot(), root.path());
-  EXPECT_EQ(config.oldInstallMapPath().path(),
-            root.path() + "/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist");
-  EXPECT_EQ(config.systemAppsDirectory().path(), root.path() + "/Applications");
-}
-
-TEST_F(ConfigurationLayout, UncachedAccessorsCreateNothing) {
-  qstest::TempDir root("layout");
-  QSGlobalConfiguration config(root.path(), store_);
-  (void)config.oldContainerPath();
-  (void)config.oldDataDirectoryPath();
-  (void)config.dataDirectoryPath();
-  (void)config.roleUserMigrationMarkerFilePath();
-  (void)config.systemAppsDirectory();
-  (void)config.factoryMountDirectory();
-  EXPECT_FALSE(isDirectory(root / "private"));
-  EXPECT_FALSE(isDirectory(root / "Applications"));
+TEST_F(ConfigurationLayout, PathsLieUnderTheNormalisedRootAndAccessingThemCreatesNothing) {
+  qstest::TempDir temp("layout");
+  for (const std::string& root : {std::string("/"), temp.path() + "/"}) {
+    QSGlobalConfiguration config(root, store_);
+    const std::string prefix = root == "/" ? "" : temp.path();
+    EXPECT_EQ(config.systemRoot(), prefix);
+    const std::pair<URL, std::string> cases[] = {
+        {config.oldContainerPath(), "/private/var/mobile/Applications"},
+        {config.oldInstallMapPath(), "/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist"},
+        {config.oldDataDirectoryPath(), "/private/var/mobile/Library/Quillset"},
+        {config.oldLoggingPath(), "/private/var/mobile/Library/Logs/Quillset"},
+        {config.oldArchiveDirectory(), "/private/var/mobile/Media/ApplicationArchives"},
+        {config.dataDirectoryPath(), "/private/var/quilld/Library/Quillset"},
+        {config.roleUserMigrationMarkerFilePath(), "/private/var/quilld/Library/Quillset/RoleUserMigration.plist"},
+        {config.coreServicesDirectory(), "/System/Library/CoreServices"},
+        {config.systemAppsDirectory(), "/Applications"},
+        {config.internalAppsDirectory(), "/VantrelInternal/Applications"},
+        {config.developerAppsDirectory(), "/Developer/Applications"},
+        {config.factoryMountDirectory(), "/private/var/factory_mount"},
+        {config.systemFrameworksRootDirectory(), "/System/Library"},
+        {config.internalFrameworksRootDirectory(), "/VantrelInternal"},
+        {config.developerFrameworksRootDirectory(), "/Developer"},
+    };
+    for (const auto& [url, path] : cases) {
+      EXPECT_EQ(url.path(), prefix + path);
+      EXPECT_EQ(url.isDirectory(), path.find(".plist") == std::string::npos) << path;
+    }
+  }
+  EXPECT_FALSE(isDirectory(temp / "private"));
+  EXPECT_FALSE(isDirectory(temp / "Applications"));
 }
 
 TEST_F(ConfigurationLayout, AllFrameworksDirectoriesAreTheFourSystemAndInternalOnes) {
@@ -237,114 +176,74 @@ class ConfigurationDirectories : public ::testing::Test {
   mode_t previousMask_ = 0;
 };
 
-TEST_F(ConfigurationDirectories, DataDirectoryIsMadeWithClassFourAndMode0755) {
+TEST_F(ConfigurationDirectories, AreMadeWithTheirClassOnEveryAccess) {
   QSGlobalConfiguration config(root_.path(), store_);
-  URL url = config.dataDirectory();
-  EXPECT_EQ(url.path(), root_.path() + "/private/var/quilld/Library/Quillset");
-  EXPECT_TRUE(url.isDirectory());
-  ASSERT_TRUE(isDirectory(url.path()));
-  struct stat status {};
-  ASSERT_EQ(stat(url.path().c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode & 07777, 0755u);
-  EXPECT_EQ(supporttest::protectionClassOf(url.path()), std::optional<int32_t>(4));
+  const struct {
+    std::function<URL()> access;
+    std::string path;
+    std::optional<int32_t> protectionClass;
+  } cases[] = {
+      {[&] { return config.stagingRoot(); },
+       "/private/var/quilld/Library/Caches/com.vantrel.mobile.quilld.staging", 4},
+      {[&] { return config.dataDirectory(); }, "/private/var/quilld/Library/Quillset", 4},
+      {[&] { return config.cachesDirectory(); }, "/private/var/quilld/Library/Caches", std::nullopt},
+      {[&] { return config.logDirectory(); }, "/private/var/quilld/Library/Logs/Quillset", 4},
+      {[&] { return config.carrierBundlesDirectory(); }, "/private/var/mobile/Library/Carrier Bundles",
+       std::nullopt},
+  };
+  for (const auto& c : cases) {
+    for (int round = 0; round < 2; ++round) {
+      URL url = c.access();
+      EXPECT_EQ(url.path(), root_.path() + c.path);
+      EXPECT_TRUE(url.isDirectory());
+      ASSERT_TRUE(isDirectory(url.path())) << c.path << " round " << round;
+      EXPECT_EQ(supporttest::protectionClassOf(url.path()), c.protectionClass) << c.path;
+      struct stat status {};
+      ASSERT_EQ(stat(url.path().c_str(), &status), 0);
+      EXPECT_EQ(status.st_mode & 07777, 0755u);
+      if (c.path.find("staging") != std::string::npos) {
+        // The caches directory made on the way has no class of its own.
+        EXPECT_EQ(supporttest::protectionClassOf(url.deletingLastPathComponent().path()), std::nullopt);
+      } else if (round == 0 && c.path.find("Caches") == std::string::npos) {
+        ASSERT_EQ(rmdir(url.path().c_str()), 0);
+      }
+    }
+  }
   EXPECT_TRUE(log_.systemLines().empty());
 }
 
-TEST_F(ConfigurationDirectories, DataDirectoryIsMadeAgainAfterDeletion) {
-  QSGlobalConfiguration config(root_.path(), store_);
-  URL first = config.dataDirectory();
-  ASSERT_TRUE(isDirectory(first.path()));
-  ASSERT_EQ(rmdir(first.path().c_str()), 0);
-  URL second = config.dataDirectory();
-  EXPECT_EQ(first, second);
-  EXPECT_TRUE(isDirectory(second.path()));
-}
-
-TEST_F(ConfigurationDirectories, CachesDirectoryIsMadeWithoutAClass) {
-  QSGlobalConfiguration config(root_.path(), store_);
-  URL url = config.cachesDirectory();
-  EXPECT_EQ(url.path(), root_.path() + "/private/var/quilld/Library/Caches");
-  ASSERT_TRUE(isDirectory(url.path()));
-  EXPECT_EQ(supporttest::protectionClassOf(url.path()), std::nullopt);
-}
-
-TEST_F(ConfigurationDirectories, StagingRootLivesInTheCachesDirectory) {
-  QSGlobalConfiguration config(root_.path(), store_);
-  URL url = config.stagingRoot();
-  EXPECT_EQ(url.path(), root_.path() + "/private/var/quilld/Library/Caches/com.vantrel.mobile.quilld.staging");
-  ASSERT_TRUE(isDirectory(url.path()));
-  EXPECT_EQ(supporttest::protectionClassOf(url.path()), std::optional<int32_t>(4));
-  EXPECT_EQ(supporttest::protectionClassOf(root_.path() + "/private/var/quilld/Library/Caches"), std::nullopt);
-}
-
-TEST_F(ConfigurationDirectories, LogAndCarrierBundleDirectoriesAreMade) {
-  QSGlobalConfiguration config(root_.path(), store_);
-  URL logs = config.logDirectory();
-  EXPECT_EQ(logs.path(), root_.path() + "/private/var/quilld/Library/Logs/Quillset");
-  EXPECT_TRUE(isDirectory(logs.path()));
-  EXPECT_EQ(supporttest::protectionClassOf(logs.path()), std::optional<int32_t>(4));
-  ASSERT_EQ(rmdir(logs.path().c_str()), 0);
-  EXPECT_TRUE(isDirectory(config.logDirectory().path()));
-
-  URL carriers = config.carrierBundlesDirectory();
-  EXPECT_EQ(carriers.path(), root_.path() + "/private/var/mobile/Library/Carrier Bundles");
-  EXPECT_TRUE(isDirectory(carriers.path()));
-  EXPECT_EQ(supporttest::protectionClassOf(carriers.path()), std::nullopt);
-}
-
-TEST_F(ConfigurationDirectories, FailedStagingRootCreationStillReturnsTheURL) {
-  QSGlobalConfiguration config(root_.path(), store_);
-  std::string caches = root_.path() + "/private/var/quilld/Library/Caches";
-  ASSERT_TRUE(qstest::makeDirs(caches));
-  ASSERT_TRUE(qstest::setImmutable(caches, true));
-  URL url = config.stagingRoot();
-  ASSERT_TRUE(qstest::setImmutable(caches, false));
-
-  EXPECT_EQ(url.path(), caches + "/com.vantrel.mobile.quilld.staging");
-  EXPECT_FALSE(isDirectory(url.path()));
-  auto lines = log_.systemLines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].level, 3);
-  EXPECT_EQ(lines[0].function, "-[QSGlobalConfiguration stagingRoot]");
-  std::string prefix = "Failed to create staging root at \"" + url.description() + "\": Error Domain=POSIXErrorDomain Code=1 ";
-  EXPECT_EQ(lines[0].message.substr(0, prefix.size()), prefix) << lines[0].message;
-}
-
-TEST_F(ConfigurationDirectories, FailedDataDirectoryCreationLogsUnderItsOwnName) {
-  QSGlobalConfiguration config(root_.path(), store_);
-  std::string library = root_.path() + "/private/var/quilld/Library";
-  ASSERT_TRUE(qstest::makeDirs(library));
-  ASSERT_TRUE(qstest::setImmutable(library, true));
-  URL data = config.dataDirectory();
-  URL caches = config.cachesDirectory();
-  URL logs = config.logDirectory();
-  ASSERT_TRUE(qstest::setImmutable(library, false));
-
-  auto lines = log_.systemLines();
-  ASSERT_EQ(lines.size(), 3u);
-  EXPECT_EQ(lines[0].function, "-[QSGlobalConfiguration dataDirectory]");
-  EXPECT_EQ(lines[0].message.rfind("Failed to create data dir at \"" + data.description() + "\": ", 0), 0u);
-  // The caches directory writes the same words as the data directory.
-  EXPECT_EQ(lines[1].function, "-[QSGlobalConfiguration cachesDirectory]");
-  EXPECT_EQ(lines[1].message.rfind("Failed to create data dir at \"" + caches.description() + "\": ", 0), 0u);
-  EXPECT_EQ(lines[2].function, "-[QSGlobalConfiguration logDirectory]");
-  EXPECT_EQ(lines[2].message.rfind("Failed to create log directory at \"" + logs.description() + "\": ", 0), 0u);
-  for (const auto& line : lines) EXPECT_EQ(line.level, 3);
-}
-
-TEST_F(ConfigurationDirectories, FailedCarrierBundlesCreationIsLogged) {
-  QSGlobalConfiguration config(root_.path(), store_);
-  std::string library = root_.path() + "/private/var/mobile/Library";
-  ASSERT_TRUE(qstest::makeDirs(library));
-  ASSERT_TRUE(qstest::setImmutable(library, true));
-  URL carriers = config.carrierBundlesDirectory();
-  ASSERT_TRUE(qstest::setImmutable(library, false));
-  auto lines = log_.systemLines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].function, "-[QSGlobalConfiguration carrierBundlesDirectory]");
-  EXPECT_EQ(lines[0].message.rfind("Failed to create carrier bundles directory at \"" + carriers.description() + "\": ",
-                                   0),
-            0u);
+// The URL still comes back when the directory cannot be made; the line says why.
+TEST_F(ConfigurationDirectories, FailedCreationIsLoggedUnderTheAccessorsName) {
+  const std::string quilld = "/private/var/quilld/Library";
+  const struct {
+    std::string locked;
+    URL (QSGlobalConfiguration::*access)();
+    std::string function, words, cause;
+  } cases[] = {
+      {quilld, &QSGlobalConfiguration::dataDirectory, "dataDirectory", "Failed to create data dir at", ""},
+      // The caches directory writes the same words as the data directory.
+      {quilld, &QSGlobalConfiguration::cachesDirectory, "cachesDirectory", "Failed to create data dir at", ""},
+      {quilld, &QSGlobalConfiguration::logDirectory, "logDirectory", "Failed to create log directory at", ""},
+      {quilld + "/Caches", &QSGlobalConfiguration::stagingRoot, "stagingRoot", "Failed to create staging root at",
+       "Error Domain=POSIXErrorDomain Code=1 "},
+      {"/private/var/mobile/Library", &QSGlobalConfiguration::carrierBundlesDirectory, "carrierBundlesDirectory",
+       "Failed to create carrier bundles directory at", ""},
+  };
+  for (const auto& c : cases) {
+    log_.clear();
+    QSGlobalConfiguration config(root_.path(), store_);
+    ASSERT_TRUE(qstest::makeDirs(root_.path() + c.locked));
+    ASSERT_TRUE(qstest::setImmutable(root_.path() + c.locked, true));
+    URL url = (config.*c.access)();
+    ASSERT_TRUE(qstest::setImmutable(root_.path() + c.locked, false));
+    EXPECT_FALSE(isDirectory(url.path()));
+    auto lines = log_.systemLines();
+    ASSERT_EQ(lines.size(), 1u) << c.function;
+    EXPECT_EQ(lines[0].level, 3);
+    EXPECT_EQ(lines[0].function, "-[QSGlobalConfiguration " + c.function + "]");
+    std::string prefix = c.words + " \"" + url.description() + "\": " + c.cause;
+    EXPECT_EQ(lines[0].message.rfind(prefix, 0), 0u) << lines[0].message;
+  }
 }
 
 TEST_F(ConfigurationDirectories, ConcurrentFirstAccessesAgree) {

@@ -10,45 +10,31 @@ using platform::MountedFileSystem;
 
 namespace {
 
-TEST(MountInfo, ParsesSourceAndMountPoint) {
+TEST(MountInfo, ParsesSourceAndMountPointAndSkipsMalformedLines) {
   std::string text =
       "22 27 0:21 / /proc rw,relatime - proc proc rw\n"
-      "36 27 7:0 / /mnt/image rw,relatime shared:5 - ext4 /dev/loop0 rw\n"
-      "37 27 7:1 / /mnt/two\\040words rw master:1 shared:2 - hfs /dev/loop1p1 rw\n";
-  EXPECT_EQ(platform::parseMountInfo(text),
-            (std::vector<MountedFileSystem>{{"proc", "/proc"},
-                                            {"/dev/loop0", "/mnt/image"},
-                                            {"/dev/loop1p1", "/mnt/two words"}}));
-}
-
-TEST(MountInfo, SkipsMalformedLines) {
-  std::string text =
       "garbage\n"
       "1 2 3:4 / /no/separator rw ext4 /dev/x rw\n"
       "\n"
+      "37 27 7:1 / /mnt/two\\040words rw master:1 shared:2 - hfs /dev/loop1p1 rw\n"
+      "1 2 3:4 / /a\\x\\1 rw - t /dev/s rw\n"
       "5 6 7:8 / /ok rw - ext4 /dev/ok rw";
-  EXPECT_EQ(platform::parseMountInfo(text), (std::vector<MountedFileSystem>{{"/dev/ok", "/ok"}}));
+  EXPECT_EQ(platform::parseMountInfo(text), (std::vector<MountedFileSystem>{{"proc", "/proc"},
+                                                                             {"/dev/loop1p1", "/mnt/two words"},
+                                                                             {"/dev/s", "/a\\x\\1"},
+                                                                             {"/dev/ok", "/ok"}}));
 }
 
-TEST(MountInfo, KeepsBackslashesThatAreNotEscapes) {
-  EXPECT_EQ(platform::parseMountInfo("1 2 3:4 / /a\\x\\1 rw - t /dev/s rw\n"),
-            (std::vector<MountedFileSystem>{{"/dev/s", "/a\\x\\1"}}));
-}
-
-TEST(MountInfo, RealTableHasTheRootMount) {
-  LinuxDeviceRegistry registry("/sys", "/proc/self/mountinfo");
-  auto mounts = registry.mountedFileSystems();
+TEST(MountInfo, RealTableHasTheRootMountAndAMissingOneFailsWithErrno) {
+  auto mounts = LinuxDeviceRegistry("/sys", "/proc/self/mountinfo").mountedFileSystems();
   ASSERT_TRUE(mounts.has_value());
   bool root = false;
   for (const auto& mount : *mounts) root = root || mount.mountPoint == "/";
   EXPECT_TRUE(root);
-}
 
-TEST(MountInfo, MissingTableFailsWithErrno) {
   qstest::TempDir dir("mounts");
-  LinuxDeviceRegistry registry(dir.path(), dir / "missing");
   errno = 0;
-  EXPECT_EQ(registry.mountedFileSystems(), std::nullopt);
+  EXPECT_EQ(LinuxDeviceRegistry(dir.path(), dir / "missing").mountedFileSystems(), std::nullopt);
   EXPECT_EQ(errno, ENOENT);
 }
 
@@ -67,44 +53,47 @@ class SyntheticSysfs : public ::testing::Test {
       ASSERT_TRUE(qstest::writeFile(device + "/" + partition + "/partition", "1\n"));
     }
   }
+  std::vector<DeviceHandle> drives() {
+    auto controller = registry_.firstDiskImageController();
+    EXPECT_TRUE(controller.has_value());
+    platform::DeviceRegistryResult result = -1;
+    auto children = controller ? registry_.childrenOf(*controller, &result) : std::nullopt;
+    EXPECT_TRUE(children.has_value());
+    EXPECT_EQ(result, platform::kDeviceRegistrySuccess);
+    return children.value_or(std::vector<DeviceHandle>{});
+  }
 
   qstest::TempDir dir_{"sysfs"};
   LinuxDeviceRegistry registry_{dir_.path(), dir_ / "mountinfo"};
 };
 
-TEST_F(SyntheticSysfs, NoBlockSubsystemMeansNoController) {
-  EXPECT_EQ(registry_.firstDiskImageController(), std::nullopt);
-}
-
 TEST_F(SyntheticSysfs, ControllerChildrenAreLoopDevicesInNumericOrder) {
+  EXPECT_EQ(registry_.firstDiskImageController(), std::nullopt);
   loopDevice("loop10", true);
   loopDevice("loop2", false);
   loopDevice("loop1", true);
   ASSERT_TRUE(qstest::makeDirs(dir_ / "block/vda"));
   ASSERT_TRUE(qstest::makeDirs(dir_ / "block/loopback"));
-  auto controller = registry_.firstDiskImageController();
-  ASSERT_TRUE(controller.has_value());
-  platform::DeviceRegistryResult result = -1;
-  auto children = registry_.childrenOf(*controller, &result);
-  ASSERT_TRUE(children.has_value());
-  EXPECT_EQ(result, platform::kDeviceRegistrySuccess);
-  ASSERT_EQ(children->size(), 3u);
-  EXPECT_TRUE(registry_.isDiskImageDrive((*children)[0]));   // loop1
-  EXPECT_FALSE(registry_.isDiskImageDrive((*children)[1]));  // loop2, nothing attached
-  EXPECT_TRUE(registry_.isDiskImageDrive((*children)[2]));   // loop10
-  for (DeviceHandle child : *children) {
+  std::vector<DeviceHandle> children = drives();
+  ASSERT_EQ(children.size(), 3u);
+  EXPECT_TRUE(registry_.isDiskImageDrive(children[0]));   // loop1
+  EXPECT_FALSE(registry_.isDiskImageDrive(children[1]));  // loop2, nothing attached
+  EXPECT_TRUE(registry_.isDiskImageDrive(children[2]));   // loop10
+  for (DeviceHandle child : children) {
     EXPECT_FALSE(registry_.isMedia(child));
     EXPECT_EQ(registry_.bsdName(child), std::nullopt);
   }
+  EXPECT_EQ(drives(), children) << "handles are stable across queries";
+  auto detached = registry_.descendantsOf(children[1], nullptr);
+  ASSERT_TRUE(detached.has_value());
+  EXPECT_TRUE(detached->empty());
 }
 
 TEST_F(SyntheticSysfs, DriveDescendantsAreWholeMediaThenPartitions) {
   loopDevice("loop0", true, {"loop0p2", "loop0p1"});
-  auto controller = registry_.firstDiskImageController();
-  ASSERT_TRUE(controller.has_value());
-  auto drives = registry_.childrenOf(*controller, nullptr);
-  ASSERT_TRUE(drives && drives->size() == 1u);
-  auto descendants = registry_.descendantsOf(drives->front(), nullptr);
+  std::vector<DeviceHandle> children = drives();
+  ASSERT_EQ(children.size(), 1u);
+  auto descendants = registry_.descendantsOf(children.front(), nullptr);
   ASSERT_TRUE(descendants.has_value());
   std::vector<std::string> names;
   for (DeviceHandle d : *descendants) {
@@ -115,22 +104,6 @@ TEST_F(SyntheticSysfs, DriveDescendantsAreWholeMediaThenPartitions) {
   EXPECT_EQ(names, (std::vector<std::string>{"loop0", "loop0p1", "loop0p2"}));
 }
 
-TEST_F(SyntheticSysfs, DetachedDriveHasNoMedia) {
-  loopDevice("loop0", false);
-  auto drives = registry_.childrenOf(*registry_.firstDiskImageController(), nullptr);
-  ASSERT_TRUE(drives && drives->size() == 1u);
-  auto descendants = registry_.descendantsOf(drives->front(), nullptr);
-  ASSERT_TRUE(descendants.has_value());
-  EXPECT_TRUE(descendants->empty());
-}
-
-TEST_F(SyntheticSysfs, HandlesAreStableAcrossQueries) {
-  loopDevice("loop0", true);
-  auto first = registry_.childrenOf(*registry_.firstDiskImageController(), nullptr);
-  auto second = registry_.childrenOf(*registry_.firstDiskImageController(), nullptr);
-  EXPECT_EQ(first, second);
-}
-
 TEST_F(SyntheticSysfs, UnknownHandleCannotBeIterated) {
   platform::DeviceRegistryResult result = platform::kDeviceRegistrySuccess;
   EXPECT_EQ(registry_.descendantsOf(999, &result), std::nullopt);
@@ -138,9 +111,6 @@ TEST_F(SyntheticSysfs, UnknownHandleCannotBeIterated) {
   EXPECT_EQ(registry_.childrenOf(platform::kNoDevice, &result), std::nullopt);
   EXPECT_FALSE(registry_.isDiskImageDrive(999));
   EXPECT_FALSE(registry_.isMedia(999));
-}
-
-TEST_F(SyntheticSysfs, ErrorCodeCarriesTheErrno) {
   EXPECT_EQ(static_cast<uint32_t>(platform::deviceRegistryErrorFromErrno(EACCES)), 0xE000000Du);
 }
 

@@ -68,9 +68,11 @@ void drain(platform::WorkQueue& queue) {
   done.get_future().wait();
 }
 
-TEST(WorkQueue, RunsJobsOneAtATimeInOrder) {
+TEST(WorkQueue, RunsJobsOneAtATimeInOrderOnItsOwnThread) {
   platform::WorkQueue queue("test.order");
   std::vector<int> order;
+  std::thread::id jobThread;
+  queue.async([&jobThread] { jobThread = std::this_thread::get_id(); });
   std::atomic<int> running{0};
   std::atomic<bool> overlapped{false};
   for (int i = 0; i < 200; ++i) {
@@ -84,13 +86,6 @@ TEST(WorkQueue, RunsJobsOneAtATimeInOrder) {
   ASSERT_EQ(order.size(), 200u);
   for (int i = 0; i < 200; ++i) EXPECT_EQ(order[i], i);
   EXPECT_FALSE(overlapped.load());
-}
-
-TEST(WorkQueue, JobsRunOnTheQueuesOwnThread) {
-  platform::WorkQueue queue("test.thread");
-  std::thread::id jobThread;
-  queue.async([&jobThread] { jobThread = std::this_thread::get_id(); });
-  drain(queue);
   EXPECT_NE(jobThread, std::this_thread::get_id());
 }
 
@@ -124,21 +119,15 @@ TEST(TransactionalTask, ReturnsAtOnceAndHoldsTheProcessUntilTheTaskEnds) {
   EXPECT_EQ(platform::ProcessKeepAliveTransactionCount(), before);
 }
 
-TEST(TransactionalTask, QueueReleasesTheTaskAfterItRan) {
-  platform::WorkQueue queue("test.release");
+TEST(TransactionalTask, SharedQueueRunsTheTaskAndThenReleasesIt) {
   auto token = std::make_shared<int>(1);
   std::weak_ptr<int> watch = token;
-  QSRunTransactionalTask(queue, [token] { (void)token; });
-  token.reset();
-  drain(queue);
-  EXPECT_TRUE(watch.expired());
-}
-
-TEST(TransactionalTask, SharedQueueRunsTasks) {
   std::promise<std::string> label;
-  QSRunTransactionalTask(platform::WorkQueue::shared(), [&label] { label.set_value("ran"); });
+  QSRunTransactionalTask(platform::WorkQueue::shared(), [token, &label] { label.set_value("ran"); });
+  token.reset();
   EXPECT_EQ(label.get_future().get(), "ran");
   drain(platform::WorkQueue::shared());
+  EXPECT_TRUE(watch.expired());
 }
 
 // --- Crash report ------------------------------------------------------------------------
@@ -153,22 +142,17 @@ std::string reportOnThread(const QSException& exception, std::optional<std::stri
   return report;
 }
 
-TEST(CrashReport, UnnamedThreadAndNoReason) {
-  QSException exception{"NSInternalInconsistency", std::nullopt, {"0 frame", "1 frame"}};
-  EXPECT_EQ(reportOnThread(exception, std::nullopt),
-            "** INTERNAL ERROR: Uncaught Exception **\nException: NSInternalInconsistency: \nStack:\n0 frame\n1 frame");
-}
-
-TEST(CrashReport, EmptyThreadNameShowsEmptyBrackets) {
-  QSException exception{std::nullopt, "it broke", {}};
-  EXPECT_EQ(reportOnThread(exception, std::string()),
-            "** INTERNAL ERROR: Uncaught Exception **\nException: <> it broke\nStack:\n");
-}
-
-TEST(CrashReport, NamedThreadNameAndReason) {
-  QSException exception{"Bad", "very", {"only"}};
-  EXPECT_EQ(reportOnThread(exception, std::string("migration worker thread")),
-            "** INTERNAL ERROR: Uncaught Exception **\nException: <migration worker thread> Bad: very\nStack:\nonly");
+TEST(CrashReport, ShowsThreadNameNameReasonAndStack) {
+  const std::tuple<QSException, std::optional<std::string>, std::string> cases[] = {
+      {{"NSInternalInconsistency", std::nullopt, {"0 frame", "1 frame"}}, std::nullopt,
+       "Exception: NSInternalInconsistency: \nStack:\n0 frame\n1 frame"},
+      {{std::nullopt, "it broke", {}}, std::string(), "Exception: <> it broke\nStack:\n"},
+      {{"Bad", "very", {"only"}}, std::string("migration worker thread"),
+       "Exception: <migration worker thread> Bad: very\nStack:\nonly"},
+  };
+  for (const auto& [exception, name, rest] : cases) {
+    EXPECT_EQ(reportOnThread(exception, name), "** INTERNAL ERROR: Uncaught Exception **\n" + rest);
+  }
 }
 
 TEST(CrashReport, ThreadNameIsPerThread) {
