@@ -1,373 +1,387 @@
-// transvale, the host program, run for real on small device trees.
-#include <fcntl.h>
-#include <sys/stat.h>
+// End to end: transvale runs the real plug-in and registry on device images
+// made by devicegen (checked afterwards by devicegen verify), and on small
+// hand-made roots for its exit codes, output and log modes.
+#include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstdlib>
+#include <chrono>
 #include <filesystem>
-#include <map>
-#include <optional>
-#include <sstream>
-#include <string>
-#include <vector>
+#include <fstream>
+#include <iostream>
+#include <random>
+#include <regex>
+#include <thread>
 
 #include <gtest/gtest.h>
 
+#include "AppMigrator/QSAppMigrator.h"
+#include "Platform/Foundation/PropertyList.h"
+#include "Platform/Registry/SQLiteRegistry.h"
 #include "support/TestSupport.h"
 
+namespace fs = std::filesystem;
+using platform::Dictionary;
+using platform::URL;
+using platform::Value;
+
+namespace qstest {
 namespace {
 
-namespace fs = std::filesystem;
+constexpr int kExitSuccess = 0, kExitRunFailed = 1, kExitPluginUnusable = 2, kExitUsage = 64;
+// Paths in a device root.
+constexpr char kOldApplications[] = "/private/var/mobile/Applications";
+constexpr char kOldInstallMap[] = "/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist";
+constexpr char kDefaultLog[] = "/private/var/mobile/Library/Logs/Transvale/transvale.log";
+constexpr char kSystemVersion[] = "/System/Library/CoreServices/SystemVersion.plist";
 
-struct ProgramResult {
-  int exitCode = -1;
-  std::string out;
-  std::string err;
-};
+// The built programs lie beside this binary.
+const std::string kBin = fs::read_symlink("/proc/self/exe").parent_path().string();
 
-std::string buildDirectory() {
-  const char* dir = std::getenv("QS_BUILD_DIR");
-  return dir ? dir : "";
+bool pathExists(const std::string& path) {
+  std::error_code ec;
+  return fs::exists(fs::symlink_status(path, ec));
 }
 
-std::string transvalePath() { return buildDirectory() + "/bin/transvale"; }
+// The entries of `dir`, full paths, sorted.
+std::vector<std::string> entriesOf(const std::string& dir) {
+  std::vector<std::string> paths;
+  std::error_code ec;
+  for (const auto& entry : fs::directory_iterator(dir, ec)) paths.push_back(entry.path().string());
+  std::sort(paths.begin(), paths.end());
+  return paths;
+}
 
-// Runs transvale with `arguments`, standard output and error captured in
-// files under `scratch`; QS_SYSTEM_ROOT is cleared so that only --root counts.
-ProgramResult runTransvale(const std::vector<std::string>& arguments, const std::string& scratch) {
-  const std::string outPath = scratch + "/stdout", errPath = scratch + "/stderr";
-  const pid_t pid = fork();
-  if (pid == 0) {
-    const int out = open(outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    const int err = open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    if (out < 0 || err < 0) _exit(126);
-    dup2(out, STDOUT_FILENO);
-    dup2(err, STDERR_FILENO);
+// A program of the build running with its standard output and error in
+// `dir`/stdout and `dir`/stderr, TMPDIR `dir`/tmp, and no QS_SYSTEM_ROOT (only
+// --root counts).
+class Process {
+ public:
+  Process(std::vector<std::string> argv, const std::string& dir) : pid_(fork()) {
+    if (pid_ != 0) return;
+    if (!freopen((dir + "/stdout").c_str(), "w", stdout) || !freopen((dir + "/stderr").c_str(), "w", stderr))
+      _exit(126);
+    setenv("TMPDIR", (dir + "/tmp").c_str(), 1);
     unsetenv("QS_SYSTEM_ROOT");
-    std::vector<char*> argv;
-    const std::string program = transvalePath();
-    argv.push_back(const_cast<char*>(program.c_str()));
-    for (const std::string& argument : arguments) argv.push_back(const_cast<char*>(argument.c_str()));
-    argv.push_back(nullptr);
-    execv(program.c_str(), argv.data());
+    argv[0] = kBin + "/" + argv[0];
+    std::vector<char*> args;
+    for (std::string& arg : argv) args.push_back(arg.data());
+    args.push_back(nullptr);
+    execv(args[0], args.data());
     _exit(127);
   }
-  ProgramResult result;
-  int status = 0;
-  if (pid > 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status)) result.exitCode = WEXITSTATUS(status);
-  result.out = qstest::readFile(outPath);
-  result.err = qstest::readFile(errPath);
-  return result;
-}
+  // The exit status, or -signal when it was killed.
+  int wait() {
+    int status = 0;
+    while (waitpid(pid_, &status, 0) < 0 && errno == EINTR) {
+    }
+    return decode(status);
+  }
+  bool running() {
+    int status = 0;
+    if (waitpid(pid_, &status, WNOHANG) == 0) return true;
+    exited_ = decode(status);
+    return false;
+  }
+  int exited() const { return exited_; }
+  void kill() { ::kill(pid_, SIGKILL); }
 
-// --- A small reader of the flat JSON objects of the log ---------------------------------
-
-struct JSONValue {
-  enum class Kind { String, Number, Null } kind = Kind::Null;
-  std::string text;  // strings decoded to bytes (\udcXX gives the byte XX)
-  long number = 0;
+ private:
+  static int decode(int status) { return WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status); }
+  pid_t pid_;
+  int exited_ = 0;
 };
-using JSONObject = std::map<std::string, JSONValue>;
 
-void appendUTF8(std::string& out, unsigned codePoint) {
-  if (codePoint < 0x80) {
-    out += static_cast<char>(codePoint);
-  } else if (codePoint < 0x800) {
-    out += static_cast<char>(0xC0 | (codePoint >> 6));
-    out += static_cast<char>(0x80 | (codePoint & 0x3F));
-  } else if (codePoint < 0x10000) {
-    out += static_cast<char>(0xE0 | (codePoint >> 12));
-    out += static_cast<char>(0x80 | ((codePoint >> 6) & 0x3F));
-    out += static_cast<char>(0x80 | (codePoint & 0x3F));
-  } else {
-    out += static_cast<char>(0xF0 | (codePoint >> 18));
-    out += static_cast<char>(0x80 | ((codePoint >> 12) & 0x3F));
-    out += static_cast<char>(0x80 | ((codePoint >> 6) & 0x3F));
-    out += static_cast<char>(0x80 | (codePoint & 0x3F));
-  }
-}
-
-std::optional<std::string> parseString(const std::string& s, size_t& i) {
-  if (i >= s.size() || s[i] != '"') return std::nullopt;
-  std::string out;
-  for (++i; i < s.size(); ++i) {
-    const unsigned char c = static_cast<unsigned char>(s[i]);
-    if (c == '"') {
-      ++i;
-      return out;
-    }
-    if (c < 0x20) return std::nullopt;  // raw control characters are not allowed
-    if (c != '\\') {
-      out += static_cast<char>(c);
-      continue;
-    }
-    if (++i >= s.size()) return std::nullopt;
-    switch (s[i]) {
-      case '"': out += '"'; break;
-      case '\\': out += '\\'; break;
-      case '/': out += '/'; break;
-      case 'n': out += '\n'; break;
-      case 'r': out += '\r'; break;
-      case 't': out += '\t'; break;
-      case 'b': out += '\b'; break;
-      case 'f': out += '\f'; break;
-      case 'u': {
-        if (i + 4 >= s.size()) return std::nullopt;
-        const unsigned unit = std::stoul(s.substr(i + 1, 4), nullptr, 16);
-        i += 4;
-        if (unit >= 0xDC80 && unit <= 0xDCFF) {
-          out += static_cast<char>(unit & 0xFF);
-        } else {
-          appendUTF8(out, unit);
-        }
-        break;
-      }
-      default:
-        return std::nullopt;
-    }
-  }
-  return std::nullopt;
-}
-
-std::optional<JSONObject> parseFlatObject(const std::string& s) {
-  JSONObject object;
-  size_t i = 0;
-  if (s.empty() || s[i++] != '{') return std::nullopt;
-  while (i < s.size()) {
-    auto key = parseString(s, i);
-    if (!key || i >= s.size() || s[i++] != ':') return std::nullopt;
-    JSONValue value;
-    if (s[i] == '"') {
-      auto text = parseString(s, i);
-      if (!text) return std::nullopt;
-      value.kind = JSONValue::Kind::String;
-      value.text = *text;
-    } else if (s.compare(i, 4, "null") == 0) {
-      i += 4;
-    } else {
-      size_t used = 0;
-      value.kind = JSONValue::Kind::Number;
-      value.number = std::stol(s.substr(i), &used);
-      if (used == 0) return std::nullopt;
-      i += used;
-    }
-    object[*key] = value;
-    if (i < s.size() && s[i] == ',') {
-      ++i;
-      continue;
-    }
-    if (i < s.size() && s[i] == '}' && i + 1 == s.size()) return object;
-    return std::nullopt;
-  }
-  return std::nullopt;
-}
-
-std::vector<std::string> lines(const std::string& text) {
-  std::vector<std::string> out;
-  std::istringstream in(text);
-  for (std::string line; std::getline(in, line);) out.push_back(line);
-  return out;
-}
-
-// --- Fixture -------------------------------------------------------------------------------
-
-class Transvale : public testing::Test {
+class EndToEnd : public testing::Test {
  protected:
-  void SetUp() override {
-    ASSERT_FALSE(buildDirectory().empty()) << "QS_BUILD_DIR is not set";
-    ASSERT_TRUE(fs::exists(transvalePath())) << transvalePath();
-    root_ = dir_ / "root";
-    scratch_ = dir_ / "scratch";
-    ASSERT_TRUE(qstest::makeDirs(root_));
-    ASSERT_TRUE(qstest::makeDirs(scratch_));
-    ASSERT_TRUE(qstest::makeDirs(root_ + "/System/Library/CoreServices"));
-    ASSERT_TRUE(qstest::writeFile(root_ + "/System/Library/CoreServices/SystemVersion.plist", kSystemVersion));
+  void SetUp() override { ASSERT_TRUE(makeDirs(dir_ / "tmp")); }
+  void TearDown() override {
+    if (!HasFailure()) return;
+    const std::string log = readFile(image_ + kDefaultLog);
+    std::cerr << "--- stdout ---\n"
+              << out() << "--- stderr ---\n"
+              << err() << "--- log (tail) ---\n"
+              << log.substr(log.size() > 6000 ? log.size() - 6000 : 0);
   }
 
-  std::string oldApplications() const { return root_ + "/private/var/mobile/Applications"; }
-  std::string defaultLog() const { return root_ + "/private/var/mobile/Library/Logs/Transvale/transvale.log"; }
+  int run(const std::vector<std::string>& argv) { return Process(argv, dir_.path()).wait(); }
+  std::string out() const { return readFile(dir_ / "stdout"); }
+  std::string err() const { return readFile(dir_ / "stderr"); }
+  std::string oldApplications() const { return image_ + kOldApplications; }
 
-  ProgramResult run(std::vector<std::string> arguments) {
-    arguments.insert(arguments.begin(), {"--root", root_});
-    return runTransvale(arguments, scratch_);
-  }
-
-  static constexpr char kSystemVersion[] =
-      "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
-      "<key>BuildVersion</key><string>21A100</string><key>ProductVersion</key><string>21.0</string>"
-      "</dict></plist>\n";
-
-  qstest::TempDir dir_;
-  std::string root_, scratch_;
+  TempDir dir_{"e2e"};
+  std::string image_ = dir_ / "image";
 };
 
-// --- Usage -----------------------------------------------------------------------------------
+// --- transvale's exit codes, output and log modes ---------------------------------------------
 
-TEST_F(Transvale, UnknownOptionIsAUsageError) {
-  auto result = runTransvale({"--bogus"}, scratch_);
-  EXPECT_EQ(result.exitCode, 64);
-  EXPECT_NE(result.err.find("--bogus"), std::string::npos) << result.err;
-}
+enum class Layout { Empty, OddEntries, ApplicationsIsAFile, NoRoot };
+// Where a text must be found, or must not.
+enum Where { InOutput, NotInOutput, InError, InLog, NotInLog };  // InLog: the default log
 
-TEST_F(Transvale, BadOptionValuesAreUsageErrors) {
-  EXPECT_EQ(run({"--progress", "sometimes"}).exitCode, 64);
-  EXPECT_EQ(run({"--log-format", "xml"}).exitCode, 64);
-  EXPECT_EQ(run({"--system-log-level", "nine"}).exitCode, 64);
-  EXPECT_EQ(run({"--system-log-level", "8"}).exitCode, 64);
-  EXPECT_EQ(runTransvale({"--root", root_ + "/missing"}, scratch_).exitCode, 64);
-  EXPECT_EQ(runTransvale({"extra"}, scratch_).exitCode, 64);
-}
+struct HostCase {
+  const char* name;
+  Layout layout;
+  std::vector<std::string> arguments;  // after --root; "{root}" and "{bin}" are replaced
+  int exitCode;
+  std::vector<std::pair<Where, std::string>> texts;  // "{root}" and "{bin}" are replaced
+};
 
-TEST_F(Transvale, UnwritableLogIsAUsageError) {
-  ASSERT_TRUE(qstest::writeFile(scratch_ + "/file", "x"));
-  auto result = run({"--log", scratch_ + "/file/transvale.log"});
-  EXPECT_EQ(result.exitCode, 64);
-  EXPECT_NE(result.err.find("cannot"), std::string::npos) << result.err;
-}
-
-TEST_F(Transvale, HelpAndVersion) {
-  auto help = runTransvale({"--help"}, scratch_);
-  EXPECT_EQ(help.exitCode, 0);
-  for (const char* option : {"--root", "--plugin", "--log", "--log-format", "--system-log-level", "--progress"}) {
-    EXPECT_NE(help.out.find(option), std::string::npos) << option;
+class Transvale : public EndToEnd {
+ protected:
+  std::string expand(std::string text) const {
+    for (const auto& [token, value] : {std::pair<std::string, std::string>{"{root}", image_}, {"{bin}", kBin}}) {
+      for (size_t at; (at = text.find(token)) != std::string::npos;) text.replace(at, token.size(), value);
+    }
+    return text;
   }
-  auto version = runTransvale({"--version"}, scratch_);
-  EXPECT_EQ(version.exitCode, 0);
-  EXPECT_NE(version.out.find("transvale 1.0.0"), std::string::npos) << version.out;
-}
-
-// --- The plug-in -------------------------------------------------------------------------------
-
-TEST_F(Transvale, MissingPluginIsReported) {
-  auto result = run({"--plugin", scratch_ + "/absent.so"});
-  EXPECT_EQ(result.exitCode, 2);
-  EXPECT_NE(result.err.find("cannot load the plug-in " + scratch_ + "/absent.so"), std::string::npos) << result.err;
-  EXPECT_FALSE(fs::exists(root_ + "/private/var/quilld/Library/Quillset/AppMigratorLastSystemVersion.plist"));
-}
-
-TEST_F(Transvale, LibraryWithoutEntryPointIsReported) {
-  auto result = run({"--plugin", buildDirectory() + "/lib/libQSPlatform.so"});
-  EXPECT_EQ(result.exitCode, 2);
-  EXPECT_NE(result.err.find("has no entry point QSCreateDataClassMigrator"), std::string::npos) << result.err;
-}
-
-TEST_F(Transvale, MigratorThatCannotBeCreatedIsReported) {
-  // The old applications directory exists but cannot be listed.
-  ASSERT_TRUE(qstest::makeDirs(root_ + "/private/var/mobile"));
-  ASSERT_TRUE(qstest::writeFile(oldApplications(), "not a directory"));
-  auto result = run({});
-  EXPECT_EQ(result.exitCode, 2);
-  EXPECT_NE(result.err.find("could not create its migrator"), std::string::npos) << result.err;
-  EXPECT_NE(qstest::readFile(defaultLog()).find("QSAppMigrator: Failed to get items at file://" + oldApplications()),
-            std::string::npos);
-}
-
-// --- Runs ---------------------------------------------------------------------------------------
-
-TEST_F(Transvale, RunWithNothingToMigrateSucceeds) {
-  auto result = run({"--progress", "never"});
-  EXPECT_EQ(result.exitCode, 0) << result.out << result.err;
-  EXPECT_NE(result.out.find("Data class: QSAppMigrator\n"), std::string::npos) << result.out;
-  EXPECT_NE(result.out.find("Estimated duration: 20\n"), std::string::npos) << result.out;
-  EXPECT_NE(result.out.find("transvale: migration succeeded"), std::string::npos) << result.out;
-  EXPECT_EQ(result.out.find("progress:"), std::string::npos) << result.out;
-  const std::string log = qstest::readFile(defaultLog());
-  EXPECT_NE(log.find("host <5> [Transvaler] -[QSAppMigrator performMigration] (QSAppMigrator.cpp:"),
-            std::string::npos)
-      << log;
-  EXPECT_NE(log.find("QSAppMigrator: Recorded current system version as 21A100"), std::string::npos) << log;
-  EXPECT_NE(qstest::readFile(root_ + "/private/var/quilld/Library/Quillset/AppMigratorLastSystemVersion.plist")
-                .find("21A100"),
-            std::string::npos);
-}
-
-TEST_F(Transvale, RunThatLeavesEntriesFailsAndShowsProgressLines) {
-  // A container whose application bundle is a symbolic link is never touched.
-  ASSERT_TRUE(qstest::makeDirs(oldApplications() + "/A"));
-  ASSERT_EQ(symlink("/nowhere", (oldApplications() + "/A/Main.app").c_str()), 0);
-  ASSERT_TRUE(qstest::writeFile(oldApplications() + "/WhereDidMyApplicationsGo.txt", "x"));
-  auto result = run({"--log", "-"});
-  EXPECT_EQ(result.exitCode, 1) << result.out << result.err;
-  EXPECT_NE(result.out.find("Estimated duration: 24.5\n"), std::string::npos) << result.out;
-  EXPECT_NE(result.out.find("progress: 100% (2/2 entries)\n"), std::string::npos) << result.out;
-  EXPECT_NE(result.out.find("transvale: migration failed, 2 of 2 entries finished"), std::string::npos)
-      << result.out;
-  EXPECT_NE(result.err.find("QSAppMigrator: Skipping container with app symlink at " + oldApplications() +
-                            "/A/Main.app"),
-            std::string::npos)
-      << result.err;
-  EXPECT_NE(result.err.find("QSAppMigrator: Returning migration failed."), std::string::npos) << result.err;
-  EXPECT_TRUE(fs::is_symlink(oldApplications() + "/A/Main.app"));
-}
-
-TEST_F(Transvale, ProgressBarWhenAskedFor) {
-  auto result = run({"--progress", "always"});
-  EXPECT_EQ(result.exitCode, 0) << result.err;
-  EXPECT_NE(result.out.find("\r["), std::string::npos) << result.out;
-  EXPECT_NE(result.out.find("0/0 entries"), std::string::npos) << result.out;
-}
-
-TEST_F(Transvale, JSONLinesCarryEveryFieldAndAnyBytes) {
-  // Names with a quote, a control character and a byte that is not UTF-8.
-  const std::string strayName = "stray \"quoted\"\t\xff\xc3\xa9";
-  ASSERT_TRUE(qstest::makeDirs(oldApplications()));
-  ASSERT_TRUE(qstest::writeFile(oldApplications() + "/" + strayName, "x"));
-  const std::string logPath = scratch_ + "/log.jsonl";
-  auto result = run({"--log", logPath, "--log-format", "jsonl", "--progress", "never"});
-  EXPECT_EQ(result.exitCode, 0) << result.out << result.err;
-
-  const std::string raw = qstest::readFile(logPath);
-  EXPECT_NE(raw.find("\\udcff"), std::string::npos) << raw;
-  bool sawIntrospection = false, sawRemoval = false;
-  for (const std::string& line : lines(raw)) {
-    auto object = parseFlatObject(line);
-    ASSERT_TRUE(object.has_value()) << "not a JSON object: " << line;
-    for (const char* key : {"time", "sink", "level", "category", "function", "file", "line", "message"}) {
-      EXPECT_EQ(object->count(key), 1u) << key << " missing in " << line;
-    }
-    const JSONObject& o = *object;
-    if (o.at("sink").text != "host") continue;
-    EXPECT_EQ(o.at("category").text, "Transvaler");
-    EXPECT_EQ(o.at("level").kind, JSONValue::Kind::Number);
-    EXPECT_EQ(o.at("line").kind, JSONValue::Kind::Number);
-    if (o.at("message").text == "QSAppMigrator: Introspecting " + oldApplications() + "/" + strayName) {
-      sawIntrospection = true;
-      EXPECT_EQ(o.at("function").text, "-[QSAppMigrator performMigration]");
-      EXPECT_EQ(o.at("level").number, 5);
-      EXPECT_NE(o.at("file").text.find("QSAppMigrator.cpp"), std::string::npos);
-    }
-    if (o.at("message").text ==
-        "QSAppMigrator: Found regular file at " + oldApplications() + "/" + strayName + " ; removing") {
-      sawRemoval = true;
-      EXPECT_EQ(o.at("function").text, "-[QSAppMigrator _introspectContainer:orderResultEarly:]");
-      EXPECT_EQ(o.at("level").number, 3);
+  void makeLayout(Layout layout) {
+    fs::remove_all(image_);
+    if (layout == Layout::NoRoot) return;
+    ASSERT_TRUE(makeDirs(fs::path(image_ + kSystemVersion).parent_path()));
+    ASSERT_TRUE(writeFile(image_ + kSystemVersion,
+                          "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
+                          "<key>BuildVersion</key><string>21A100</string></dict></plist>\n"));
+    if (layout == Layout::ApplicationsIsAFile) {
+      ASSERT_TRUE(makeDirs(fs::path(oldApplications()).parent_path()));
+      ASSERT_TRUE(writeFile(oldApplications(), "not a directory"));
+    } else if (layout == Layout::OddEntries) {
+      // A container whose bundle is a symbolic link (never touched), a link
+      // the file layer ignores, a plain file, and a stray file whose name has
+      // a quote, a control character and a byte that is not UTF-8.
+      ASSERT_TRUE(makeDirs(oldApplications() + "/A"));
+      ASSERT_EQ(symlink("/nowhere", (oldApplications() + "/A/Main.app").c_str()), 0);
+      ASSERT_EQ(symlink("/nowhere", (oldApplications() + "/Link").c_str()), 0);
+      ASSERT_TRUE(writeFile(oldApplications() + "/WhereDidMyApplicationsGo.txt", "x"));
+      ASSERT_TRUE(writeFile(oldApplications() + "/stray \"quoted\"\t\xff\xc3\xa9", "x"));
     }
   }
-  EXPECT_TRUE(sawIntrospection) << raw;
-  EXPECT_TRUE(sawRemoval) << raw;
-}
+};
 
-TEST_F(Transvale, SystemLogLevelFiltersTheFileLayersLines) {
-  // A symbolic link among the entries makes the file layer write a level-5 line.
-  auto layout = [&] {
-    fs::remove_all(oldApplications());
-    ASSERT_TRUE(qstest::makeDirs(oldApplications()));
-    ASSERT_EQ(symlink("/nowhere", (oldApplications() + "/Link").c_str()), 0);
-    ASSERT_TRUE(qstest::writeFile(oldApplications() + "/WhereDidMyApplicationsGo.txt", "x"));
+TEST_F(Transvale, ExitCodesOutputAndLogModes) {
+  const std::string apps = std::string("{root}") + kOldApplications;
+  const std::string strayInJSON = apps + R"(/stray \"quoted\"\t\udcff)"
+                                         "\xc3\xa9";
+  using enum Layout;
+  // clang-format off
+  const HostCase cases[] = {
+      {"unknown option", Empty, {"--bogus"}, kExitUsage, {{InError, "--bogus"}}},
+      {"level out of range", Empty, {"--system-log-level", "8"}, kExitUsage, {}},
+      {"root that is not there", NoRoot, {}, kExitUsage, {}},
+      {"log that cannot be made", Empty, {"--log", "{root}" + std::string(kSystemVersion) + "/x.log"}, kExitUsage,
+       {{InError, "transvale: cannot create the log directory"}}},
+      {"help", Empty, {"--help"}, kExitSuccess, {{InOutput, "--system-log-level"}}},
+      {"missing plug-in", Empty, {"--plugin", "{root}/absent.so"}, kExitPluginUnusable,
+       {{InError, "transvale: cannot load the plug-in {root}/absent.so"}}},
+      {"library without entry point", Empty, {"--plugin", "{bin}/../lib/libQSPlatform.so"}, kExitPluginUnusable,
+       {{InError, "has no entry point QSCreateDataClassMigrator"}}},
+      {"no migrator", ApplicationsIsAFile, {}, kExitPluginUnusable,
+       {{InError, "could not create its migrator"}, {InLog, "QSAppMigrator: Failed to get items at file://" + apps}}},
+      {"nothing to migrate", Empty, {"--progress", "never"}, kExitSuccess,
+       {{InOutput, "Data class: QSAppMigrator\nEstimated duration: 20\n"}, {InOutput, "transvale: migration succeeded"},
+        {NotInOutput, "progress"}, {InLog, "QSAppMigrator: Recorded current system version as 21A100"},
+        {InLog, "host <5> [Transvaler] -[QSAppMigrator performMigration] (QSAppMigrator.cpp:"}}},
+      {"progress bar", Empty, {"--progress", "always"}, kExitSuccess, {{InOutput, "\r["}, {InOutput, "0/0 entries"}}},
+      {"entries left, progress lines, log on stderr", OddEntries, {"--log", "-"}, kExitRunFailed,
+       {{InOutput, "Estimated duration: 26.75\n"}, {InOutput, "progress: 100% (3/3 entries)\n"},
+        {InOutput, "transvale: migration failed, 3 of 3 entries finished"},
+        {InError, "QSAppMigrator: Skipping container with app symlink at " + apps + "/A/Main.app"},
+        {InError, "system <5> -[QSFileManager urlsForItemsInDirectoryAtURL:ignoringSymlinks:error:]: "
+                  "Ignoring symlink at " + apps + "/Link"},
+        {InError, "QSAppMigrator: Returning migration failed."}}},
+      {"system log level", OddEntries, {"--system-log-level", "3"}, kExitRunFailed,
+       {{InLog, "host <3> "}, {NotInLog, "system <5> "}}},
+      {"JSON lines", OddEntries, {"--log-format", "jsonl"}, kExitRunFailed,
+       {{InLog, R"("sink":"system","level":5,"category":null,"function":"-[QSFileManager )"},
+        {InLog, R"("sink":"host","level":3,"category":"Transvaler",)"
+                R"("function":"-[QSAppMigrator _introspectContainer:orderResultEarly:]","file":")"},
+        {InLog, R"("message":"QSAppMigrator: Found regular file at )" + strayInJSON + R"( ; removing"})"}}},
   };
-  layout();
-  auto plain = run({"--log", scratch_ + "/plain.log", "--progress", "never"});
-  EXPECT_EQ(plain.exitCode, 1);
-  const std::string plainLog = qstest::readFile(scratch_ + "/plain.log");
-  EXPECT_NE(plainLog.find("system <5> "), std::string::npos) << plainLog;
+  // clang-format on
+  // A JSON string, and a whole line of the jsonl format.
+  const std::string s = R"x("(?:[^"\\\x00-\x1f]|\\["\\/bfnrt]|\\u[0-9a-f]{4})*")x";
+  const std::regex jsonLine(R"x(\{"time":"\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d\.\d{3}Z","sink":"(host|system)",)x"
+                            R"x("level":\d,"category":(null|)x" +
+                            s + R"x(),"function":)x" + s + R"x(,"file":(null|)x" + s +
+                            R"x(),"line":(null|\d+),"message":)x" + s + "\\}");
+  for (const HostCase& c : cases) {
+    SCOPED_TRACE(c.name);
+    makeLayout(c.layout);
+    std::vector<std::string> argv{"transvale", "--root", image_};
+    for (const std::string& argument : c.arguments) argv.push_back(expand(argument));
+    EXPECT_EQ(run(argv), c.exitCode);
+    const std::string output = out(), error = err(), log = readFile(image_ + kDefaultLog);
+    for (const auto& [where, text] : c.texts) {
+      const std::string& in = where <= NotInOutput ? output : where == InError ? error : log;
+      EXPECT_EQ(in.find(expand(text)) != std::string::npos, where != NotInOutput && where != NotInLog) << text;
+    }
+    EXPECT_TRUE(c.layout != OddEntries || fs::is_symlink(oldApplications() + "/A/Main.app"));
+    if (c.arguments.size() == 2 && c.arguments[1] == "jsonl") {
+      std::istringstream lines(log);
+      for (std::string line; std::getline(lines, line);) EXPECT_TRUE(std::regex_match(line, jsonLine)) << line;
+    }
+  }
+}
 
-  layout();
-  auto quiet = run({"--log", scratch_ + "/quiet.log", "--system-log-level", "3", "--progress", "never"});
-  EXPECT_EQ(quiet.exitCode, 1);
-  const std::string quietLog = qstest::readFile(scratch_ + "/quiet.log");
-  EXPECT_EQ(quietLog.find("system <5> "), std::string::npos) << quietLog;
-  EXPECT_NE(quietLog.find("host <3> "), std::string::npos) << quietLog;
+// --- Migrations of device images -------------------------------------------------------------
+
+class Migration : public EndToEnd {
+ protected:
+  void createImage(const std::vector<std::string>& options) {
+    std::vector<std::string> argv{"devicegen", "create", "--root", image_};
+    argv.insert(argv.end(), options.begin(), options.end());
+    ASSERT_EQ(run(argv), kExitSuccess);
+    image_ = fs::canonical(image_).string();
+  }
+  std::vector<std::string> transvale() const { return {"transvale", "--root", image_, "--progress", "never"}; }
+  int migrate() { return run(transvale()); }
+  int verify() { return run({"devicegen", "verify", "--root", image_}); }
+  static std::string bundleIn(const std::string& container) {
+    for (const std::string& path : entriesOf(container)) {
+      if (fs::path(path).extension() == ".app" && !fs::is_symlink(path)) return path;
+    }
+    return "";
+  }
+  // devicegen verify checks that every item arrived and nothing of the old
+  // layout is left. Placeholders are staged under the temporary directory and
+  // never left there, except by a run killed while it installed one.
+  void expectMigratedAndVerified(bool killedRuns = false) {
+    EXPECT_EQ(verify(), kExitSuccess) << out();
+    EXPECT_TRUE(killedRuns || entriesOf(dir_ / "tmp/com.vantrel.quill.set.migrator").empty());
+  }
+
+  // The containers whose migration has started, from what the log gained
+  // since the last call (complete lines only).
+  size_t containersStarted() {
+    std::ifstream in(image_ + kDefaultLog, std::ios::binary);
+    in.seekg(static_cast<std::streamoff>(logRead_));
+    std::string gained{std::istreambuf_iterator<char>(in), {}};
+    gained.resize(gained.rfind('\n') + 1);
+    for (size_t at = 0; (at = gained.find("QSAppMigrator: Migrating ", at)) != std::string::npos; ++at) ++started_;
+    logRead_ += gained.size();
+    return started_;
+  }
+  size_t logRead_ = 0, started_ = 0;
+};
+
+TEST_F(Migration, ImageOfEveryShapeMigratesAndVerifies) {
+  // Groups cycle through 3, 1 and 2 members, so group 1 is shared by three
+  // applications; some applications have a newer built-in copy (the
+  // registry refuses them as already installed) and some old bundles are
+  // placeholders.
+  createImage({"--apps", "24", "--vpn-only", "3", "--groups", "6", "--harbors", "3", "--placeholders", "2",
+               "--builtin-older", "2", "--files-per-app", "5", "--bytes-per-file", "1500", "--seed", "11"});
+  ASSERT_EQ(migrate(), kExitSuccess);
+  expectMigratedAndVerified();
+  // A second run finds nothing to do and succeeds.
+  EXPECT_EQ(migrate(), kExitSuccess);
+  EXPECT_EQ(verify(), kExitSuccess) << out();
+}
+
+TEST_F(Migration, ContainerInterruptedAfterStagingIsResumedFromItsMarker) {
+  createImage({"--apps", "6", "--groups", "2", "--seed", "5"});
+  std::string container, bundle;
+  for (const std::string& path : entriesOf(oldApplications())) {
+    if (!(bundle = bundleIn(container = path)).empty()) break;
+  }
+  ASSERT_FALSE(bundle.empty());
+  const auto info = platform::plist::readDictionary(URL::fileURL(bundle + "/Info.plist"));
+  const std::string* identifier = info ? QSStringForKey(*info, platform::kBundleIdentifierKey) : nullptr;
+  ASSERT_TRUE(identifier);
+
+  // What an attempt killed during staging leaves: the marker, the
+  // placeholder installed, the bundle and store metadata in the package.
+  const Dictionary marker{{kQSContainerPathKey, Value(container)},
+                          {kQSBundlePathKey, Value(bundle)},
+                          {kQSBundleIdentifierKey, Value(*identifier)},
+                          {kQSContainerTypeKey, Value(kQSContainerTypeApp)}};
+  ASSERT_TRUE(platform::plist::writeFile(Value(marker), URL::fileURL(container + "/" + kQSMigrationMarkerFileName)));
+  const std::string placeholder = dir_ / "tmp/placeholder/" + *identifier + ".app";
+  ASSERT_TRUE(makeDirs(placeholder));
+  ASSERT_TRUE(platform::plist::writeFile(Value(Dictionary{{platform::kBundleIdentifierKey, Value(*identifier)}}),
+                                         URL::fileURL(placeholder + "/Info.plist")));
+  platform::Error error;
+  auto registry = platform::SQLiteApplicationRegistry::open(image_, &error);
+  ASSERT_TRUE(registry) << error.description();
+  const Dictionary options{{platform::kRegistryInstallTypeKey, Value(kQSMigratorInstallType)},
+                           {platform::kRegistryPackageTypeKey, Value(platform::kRegistryPackageTypePlaceholder)},
+                           {platform::kBundleIdentifierKey, Value(*identifier)}};
+  ASSERT_TRUE(registry->installBundle(URL::fileURL(placeholder, true), options, &error)) << error.description();
+  registry.reset();
+  ASSERT_TRUE(makeDirs(container + "/Staging/Payload"));
+  fs::rename(bundle, container + "/Staging/Payload/" + fs::path(bundle).filename().string());
+  if (pathExists(container + "/VendraMetadata.plist")) {
+    fs::rename(container + "/VendraMetadata.plist", container + "/Staging/VendraMetadata.plist");
+  }
+
+  ASSERT_EQ(migrate(), kExitSuccess);
+  EXPECT_NE(
+      readFile(image_ + kDefaultLog).find("App " + *identifier + " is already installed, so not creating placeholder."),
+      std::string::npos);
+  expectMigratedAndVerified();
+}
+
+TEST_F(Migration, ContainerThatCannotMoveIsKeptAndASecondRunFinishes) {
+  createImage({"--apps", "8", "--vpn-only", "1", "--groups", "3", "--seed", "7"});
+  std::string container;
+  for (const std::string& path : entriesOf(oldApplications())) {
+    if (fs::is_directory(path + "/Documents")) {
+      container = path;
+      break;
+    }
+  }
+  ASSERT_FALSE(container.empty());
+  ASSERT_TRUE(setImmutable(container + "/Documents", true));  // the flags are cleared by TempDir
+
+  EXPECT_EQ(migrate(), kExitRunFailed);
+  EXPECT_TRUE(pathExists(container + "/" + kQSMigrationMarkerFileName));
+  EXPECT_TRUE(pathExists(image_ + kOldInstallMap));
+  EXPECT_EQ(entriesOf(oldApplications()), std::vector<std::string>{container});
+  EXPECT_NE(verify(), kExitSuccess);
+
+  ASSERT_TRUE(setImmutable(container + "/Documents", false));
+  ASSERT_EQ(migrate(), kExitSuccess);
+  expectMigratedAndVerified();
+}
+
+TEST_F(Migration, RunKilledAtRandomPointsFinishesWhenRestarted) {
+  createImage({"--apps", "60", "--vpn-only", "3", "--groups", "6", "--harbors", "2", "--placeholders", "2",
+               "--builtin-older", "2", "--files-per-app", "4", "--bytes-per-file", "2000", "--seed", "23"});
+  // Each run is killed once a few more containers have started, a moment
+  // later, so that the kills fall anywhere in a container's work.
+  std::mt19937 random(23);
+  std::uniform_int_distribution<size_t> containersBeforeKill(1, 8);
+  std::uniform_int_distribution<int> extraDelayUs(0, 40000);
+  constexpr int kKills = 6;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(3);
+  int killed = 0;
+  for (int attempt = 0; attempt < kKills; ++attempt) {
+    const size_t target = containersStarted() + containersBeforeKill(random);
+    Process run(transvale(), dir_.path());
+    while (run.running() && containersStarted() < target) {
+      if (std::chrono::steady_clock::now() > deadline) run.kill();
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    ASSERT_LT(std::chrono::steady_clock::now(), deadline) << "a run stopped making progress";
+    std::this_thread::sleep_for(std::chrono::microseconds(extraDelayUs(random)));
+    if (!run.running()) {
+      // The run ended before the kill: it must have succeeded.
+      EXPECT_EQ(run.exited(), kExitSuccess) << "after " << killed << " kills";
+      break;
+    }
+    run.kill();
+    EXPECT_EQ(run.wait(), -SIGKILL);
+    ++killed;
+  }
+  EXPECT_GE(killed, 2) << "the runs ended before they could be killed";
+  // A run killed after an installation but before its container was removed
+  // leaves a container that fails once (its bundle is gone) and is removed;
+  // the next run then finds nothing left.
+  int status = migrate();
+  if (status != kExitSuccess) status = migrate();
+  ASSERT_EQ(status, kExitSuccess);
+  expectMigratedAndVerified(true);
 }
 
 }  // namespace
+}  // namespace qstest
