@@ -1,12 +1,6 @@
 // Data-protection classes and the bundle attributes on real files.
-
-#include <cstdint>
-#include <vector>
-
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/DataProtection.h"
-#include "Shared/FileManager/QSFileManager.h"
-#include "Shared/Support/QSLog.h"
 
 using platform::Error;
 using platform::URL;
@@ -14,235 +8,149 @@ using platform::Value;
 
 namespace {
 
-constexpr char kInstallTypeFn[] = "-[QSFileManager installTypeForBundle:error:]";
-
-// The attribute's bytes, empty when it is absent.
-std::vector<uint8_t> attribute(const std::string& path, const char* name) {
-  std::string bytes = qstest::xattrOf(path, name).value_or("");
-  return std::vector<uint8_t>(bytes.begin(), bytes.end());
-}
-
-void setAttribute(const std::string& path, const char* name, const std::vector<uint8_t>& bytes) {
-  ASSERT_EQ(lsetxattr(path.c_str(), name, bytes.data(), bytes.size(), 0), 0) << strerror(errno);
-}
-
-class AttributesFixture : public testing::Test {
+class Attributes : public qstest::FileLayerTest {
  protected:
   void SetUp() override {
-    bundle_ = tmp_ / "App.app";
     ASSERT_TRUE(qstest::makeDirs(bundle_));
-    file_ = tmp_ / "file";
     ASSERT_TRUE(qstest::writeFile(file_, "x"));
   }
-
   URL bundleURL() const { return URL::fileURL(bundle_, true); }
+  std::optional<int32_t> classOf(const std::string& path) {
+    int32_t cls = -100;
+    if (!fm.dataProtectionClassOfItemAtURL(URL::fileURL(path), &cls)) return std::nullopt;
+    return cls;
+  }
+  bool setClass(const std::string& path, int32_t cls, Error* error = nullptr) {
+    return fm.setDataProtectionClassOfItemAtURL(URL::fileURL(path), cls, nullptr, error);
+  }
 
-  QSFileManager& fm_ = QSFileManager::defaultManager();
-  qstest::TempDir tmp_{"attributes"};
-  qstest::LogCapture log_;
-  std::string bundle_;
-  std::string file_;
+  std::string bundle_ = dir / "App.app";
+  std::string file_ = dir / "file";
 };
 
-// --- Data-protection classes -----------------------------------------------------
-
-using AttributesClass = AttributesFixture;
-
-TEST_F(AttributesClass, SetClassReadsBackOnFilesAndDirectories) {
-  for (const std::string& path : {file_, bundle_}) {
-    ASSERT_TRUE(fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(path), 3, nullptr));
-    int32_t cls = 0;
-    ASSERT_TRUE(fm_.dataProtectionClassOfItemAtURL(URL::fileURL(path), &cls));
-    EXPECT_EQ(cls, 3) << path;
-  }
+TEST_F(Attributes, ClassesReadBackAndARefusingPredicateChangesNothing) {
+  EXPECT_EQ(classOf(file_), 0) << "an item without a class reads as 0";
+  ASSERT_TRUE(setClass(file_, -2));
+  int32_t seen = 0;
+  Error error = qstest::untouchedSentinel();
+  auto refuse = [&](int32_t current) {
+    seen = current;
+    return false;
+  };
+  EXPECT_TRUE(fm.setDataProtectionClassOfItemAtURL(URL::fileURL(file_), 4, refuse, &error));
+  EXPECT_EQ(seen, -2);
+  EXPECT_TRUE(error.is("Sentinel", 99));
+  EXPECT_EQ(classOf(file_), -2);
+  // "No class to set" is never stored.
+  EXPECT_FALSE(setClass(file_, kQSNoDataProtectionClass, &error));
+  EXPECT_TRUE(error.isPOSIX(EINVAL));
+  EXPECT_EQ(classOf(file_), -2);
 }
 
-TEST_F(AttributesClass, RefusingPredicateSeesTheCurrentClassAndChangesNothing) {
-  ASSERT_TRUE(fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(file_), 2, nullptr));
-  int32_t seen = -7;
-  int calls = 0;
-  Error error("Untouched", 1);
-  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(
-      URL::fileURL(file_), 4,
-      [&](int32_t current) {
-        seen = current;
-        ++calls;
-        return false;
-      },
-      &error));
-  EXPECT_EQ(seen, 2);
-  EXPECT_EQ(calls, 1);
-  EXPECT_TRUE(error.is("Untouched", 1));
-  int32_t cls = 0;
-  ASSERT_TRUE(fm_.dataProtectionClassOfItemAtURL(URL::fileURL(file_), &cls));
-  EXPECT_EQ(cls, 2);
-}
-
-TEST_F(AttributesClass, SymbolicLinkFailsAtTheOpen) {
-  std::string link = tmp_ / "link";
-  ASSERT_EQ(symlink(file_.c_str(), link.c_str()), 0);
+TEST_F(Attributes, ClassOfASymbolicLinkFailsAtTheOpen) {
+  const std::string link = dir / "link";
+  qstest::makeSymlink(file_, link);
   for (bool set : {false, true}) {
     Error error;
     int32_t cls = 99;
-    bool ok = set ? fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(link), 1, nullptr, &error)
-                  : fm_.dataProtectionClassOfItemAtURL(URL::fileURL(link), &cls, &error);
-    EXPECT_FALSE(ok);
+    EXPECT_FALSE(set ? setClass(link, 1, &error) : fm.dataProtectionClassOfItemAtURL(URL::fileURL(link), &cls, &error));
     EXPECT_EQ(cls, 99);
     EXPECT_TRUE(error.isPOSIX(ELOOP)) << error.description();
     EXPECT_EQ(error.localizedDescription(), "Failed to open " + link + " : Too many levels of symbolic links");
   }
-  EXPECT_EQ(attribute(file_, qsfs::kDataProtectionClassAttributeName).size(), 0u);
-  EXPECT_TRUE(log_.systemLines().empty());
+  EXPECT_FALSE(qstest::xattrOf(file_, qsfs::kDataProtectionClassAttributeName));
 }
 
-TEST_F(AttributesClass, UnreadableClassFailsBothTheReadAndAGuardedChange) {
-  // A stored class of the wrong size cannot be read.
-  setAttribute(file_, qsfs::kDataProtectionClassAttributeName, {1, 2});
-  Error error;
-  int32_t cls = 0;
-  EXPECT_FALSE(fm_.dataProtectionClassOfItemAtURL(URL::fileURL(file_), &cls, &error));
+TEST_F(Attributes, UnreadableClassFailsTheReadAndAGuardedChangeOnly) {
+  qstest::setXattr(file_, qsfs::kDataProtectionClassAttributeName, std::string(2, '\1'));
+  Error error, guarded;
+  EXPECT_FALSE(fm.dataProtectionClassOfItemAtURL(URL::fileURL(file_), nullptr, &error));
   EXPECT_TRUE(error.isPOSIX(ERANGE));
   EXPECT_EQ(error.localizedDescription(), "Failed to getclass of file " + file_ + ": Numerical result out of range");
-
-  bool called = false;
-  Error guarded;
-  EXPECT_FALSE(fm_.setDataProtectionClassOfItemAtURL(
-      URL::fileURL(file_), 1,
-      [&](int32_t) {
-        called = true;
-        return true;
-      },
-      &guarded));
-  EXPECT_FALSE(called);
+  auto never = [](int32_t) {
+    ADD_FAILURE() << "predicate called";
+    return true;
+  };
+  EXPECT_FALSE(fm.setDataProtectionClassOfItemAtURL(URL::fileURL(file_), 1, never, &guarded));
   EXPECT_TRUE(guarded.isPOSIX(ERANGE));
   // Without a predicate the current class is never read, so the change works.
-  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(file_), 1, nullptr));
+  EXPECT_TRUE(setClass(file_, 1));
+  EXPECT_EQ(classOf(file_), 1);
 }
 
-TEST_F(AttributesClass, ImmutableItemKeepsItsClass) {
-  ASSERT_TRUE(fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(file_), 2, nullptr));
+TEST_F(Attributes, ImmutableItemKeepsItsClass) {
+  ASSERT_TRUE(setClass(file_, 2));
   ASSERT_TRUE(qstest::setImmutable(file_, true));
   Error error;
-  bool ok = fm_.setDataProtectionClassOfItemAtURL(URL::fileURL(file_), 3, nullptr, &error);
+  bool ok = setClass(file_, 3, &error);
   ASSERT_TRUE(qstest::setImmutable(file_, false));
   EXPECT_FALSE(ok);
-  EXPECT_TRUE(error.isPOSIX(EPERM));
-  EXPECT_EQ(error.localizedDescription(), "Failed to setclass(3) on file " + file_ + ": Operation not permitted");
-  int32_t cls = 0;
-  ASSERT_TRUE(fm_.dataProtectionClassOfItemAtURL(URL::fileURL(file_), &cls));
-  EXPECT_EQ(cls, 2);
+  qstest::expectPOSIXError(error, EPERM, "Failed to setclass(3) on file " + file_ + ": Operation not permitted",
+                           "-[QSFileManager setDataProtectionClassOfItemAtURL:toClass:ifPredicate:error:]");
+  EXPECT_EQ(classOf(file_), 2);
 }
 
-// --- Placeholder mark ---------------------------------------------------------------
-
-using AttributesPlaceholder = AttributesFixture;
-
-TEST_F(AttributesPlaceholder, MarkIsAFourByteOneInNativeOrder) {
-  ASSERT_TRUE(fm_.markBundleAsPlaceholder(bundleURL()));
-  EXPECT_EQ(attribute(bundle_, kQSPlaceholderAttributeName), (std::vector<uint8_t>{1, 0, 0, 0}));
-  EXPECT_TRUE(fm_.bundleAtURLIsPlaceholder(bundleURL()));
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(AttributesPlaceholder, AnyFourBytesAndOnlyFourMarkAPlaceholder) {
-  EXPECT_FALSE(fm_.bundleAtURLIsPlaceholder(bundleURL()));
-  EXPECT_FALSE(fm_.bundleAtURLIsPlaceholder(URL::fileURL(tmp_ / "absent.app", true)));
-  const std::pair<std::vector<uint8_t>, bool> cases[] = {
-      {{0, 0, 0, 0}, true}, {{9, 8, 7, 6}, true}, {{1}, false}, {{1, 0, 0, 0, 0, 0, 0, 0}, false}};
-  for (const auto& [bytes, marked] : cases) {
-    setAttribute(bundle_, kQSPlaceholderAttributeName, bytes);
-    EXPECT_EQ(fm_.bundleAtURLIsPlaceholder(bundleURL()), marked) << bytes.size();
+TEST_F(Attributes, PlaceholderMarkIsAnyFourBytesOnTheBundleItself) {
+  EXPECT_FALSE(fm.bundleAtURLIsPlaceholder(bundleURL()));
+  ASSERT_TRUE(fm.markBundleAsPlaceholder(bundleURL()));
+  const uint32_t one = 1;
+  EXPECT_EQ(qstest::xattrOf(bundle_, kQSPlaceholderAttributeName), std::string(reinterpret_cast<const char*>(&one), 4));
+  EXPECT_TRUE(fm.bundleAtURLIsPlaceholder(bundleURL()));
+  qstest::makeSymlink(bundle_, dir / "Link.app");
+  EXPECT_FALSE(fm.bundleAtURLIsPlaceholder(URL::fileURL(dir / "Link.app")));
+  for (const auto& [bytes, marked] : {std::pair{std::string("\x09\x08\x07\x06"), true}, {std::string(8, '\1'), false}}) {
+    qstest::setXattr(bundle_, kQSPlaceholderAttributeName, bytes);
+    EXPECT_EQ(fm.bundleAtURLIsPlaceholder(bundleURL()), marked) << bytes.size();
   }
-  EXPECT_TRUE(log_.systemLines().empty());
-}
-
-TEST_F(AttributesPlaceholder, LinkToAMarkedBundleIsNotFollowed) {
-  ASSERT_TRUE(fm_.markBundleAsPlaceholder(bundleURL()));
-  std::string link = tmp_ / "Link.app";
-  ASSERT_EQ(symlink(bundle_.c_str(), link.c_str()), 0);
-  EXPECT_FALSE(fm_.bundleAtURLIsPlaceholder(URL::fileURL(link)));
-}
-
-TEST_F(AttributesPlaceholder, FailedMarkIsLoggedWithTheUnderlyingError) {
-  std::string missing = tmp_ / "absent.app";
+  EXPECT_TRUE(log.systemLines().empty());
+  const std::string missing = dir / "absent.app";
   Error error;
-  EXPECT_FALSE(fm_.markBundleAsPlaceholder(URL::fileURL(missing, true), &error));
-  EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeFileOperationFailed));
-  std::string message = "Could't set placeholder EA on \"" + missing + "\": No such file or directory";
-  EXPECT_EQ(error.localizedDescription(), message);
-  ASSERT_NE(error.underlyingError(), nullptr);
-  EXPECT_TRUE(error.underlyingError()->isPOSIX(ENOENT));
-  EXPECT_TRUE(error.underlyingError()->userInfo().empty());
-  auto lines = log_.systemLines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].function, "-[QSFileManager markBundleAsPlaceholder:withError:]");
-  EXPECT_NE(lines[0].message.find(": " + message + " ("), std::string::npos);
+  EXPECT_FALSE(fm.markBundleAsPlaceholder(URL::fileURL(missing, true), &error));
+  const std::string message = "Could't set placeholder EA on \"" + missing + "\": No such file or directory";
+  qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed, message, ENOENT);
+  EXPECT_EQ(log.count(message), 1u);
 }
 
-// --- Install type -------------------------------------------------------------------
-
-using AttributesInstallType = AttributesFixture;
-
-TEST_F(AttributesInstallType, AbsentAttributeReadsZeroWithoutError) {
-  Error error("Untouched", 1);
-  auto value = fm_.installTypeForBundle(bundleURL(), &error);
-  ASSERT_TRUE(value);
-  EXPECT_TRUE(value->isInteger());
-  EXPECT_EQ(value->uint64Value(), 0u);
-  EXPECT_TRUE(error.is("Untouched", 1));
-  EXPECT_TRUE(log_.systemLines().empty());
+TEST_F(Attributes, InstallTypeIsZeroWhenAbsentAndReadsBackUnchanged) {
+  Error error = qstest::untouchedSentinel();
+  auto absent = fm.installTypeForBundle(bundleURL(), &error);
+  ASSERT_TRUE(absent && absent->isInteger());
+  EXPECT_EQ(absent->uint64Value(), 0u);
+  EXPECT_TRUE(error.is("Sentinel", 99));
+  ASSERT_TRUE(fm.setInstallType(Value(UINT64_MAX), bundleURL()));
+  EXPECT_EQ(qstest::xattrOf(bundle_, kQSInstallTypeAttributeName)->size(), 8u);
+  EXPECT_EQ(fm.installTypeForBundle(bundleURL())->uint64Value(), UINT64_MAX);
+  EXPECT_TRUE(log.systemLines().empty());
 }
 
-TEST_F(AttributesInstallType, ValuesReadBackUnchanged) {
-  for (uint64_t v : {uint64_t{0}, uint64_t{1}, UINT64_MAX}) {
-    ASSERT_TRUE(fm_.setInstallType(Value(v), bundleURL()));
-    EXPECT_EQ(attribute(bundle_, kQSInstallTypeAttributeName).size(), 8u);
-    auto value = fm_.installTypeForBundle(bundleURL());
-    ASSERT_TRUE(value);
-    EXPECT_EQ(value->uint64Value(), v);
-  }
-}
-
-TEST_F(AttributesInstallType, ShortValueIsReportedWithItsSize) {
-  setAttribute(bundle_, kQSInstallTypeAttributeName, {1, 2, 3, 4});
+TEST_F(Attributes, InstallTypeOfTheWrongSizeIsReported) {
+  qstest::setXattr(bundle_, kQSInstallTypeAttributeName, "1234");
   Error error;
-  EXPECT_FALSE(fm_.installTypeForBundle(bundleURL(), &error));
+  EXPECT_FALSE(fm.installTypeForBundle(bundleURL(), &error));
   EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeFileOperationFailed));
-  std::string message = "getxattr for installType EA on " + bundle_ + " returned 4 (expected 8)";
+  const std::string message = "getxattr for installType EA on " + bundle_ + " returned 4 (expected 8)";
   EXPECT_EQ(error.localizedDescription(), message);
   EXPECT_EQ(error.underlyingError(), nullptr);
-  auto lines = log_.systemLines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].function, kInstallTypeFn);
-  EXPECT_EQ(lines[0].level, kQSLogLevelError);
-  EXPECT_NE(lines[0].message.find(": " + message), std::string::npos);
+  EXPECT_EQ(log.count(message), 1u);
+  // Longer than the value: it does not fit the buffer.
+  qstest::setXattr(bundle_, kQSInstallTypeAttributeName, std::string(12, '\xAB'));
+  EXPECT_FALSE(fm.installTypeForBundle(bundleURL(), &error));
+  const std::string tooLong = "Couldn't get installType EA from \"" + bundle_ + "\": Numerical result out of range";
+  qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed, tooLong, ERANGE);
+  EXPECT_EQ(log.count(tooLong), 1u);
 }
 
-TEST_F(AttributesInstallType, LongValueDoesNotFitTheBuffer) {
-  setAttribute(bundle_, kQSInstallTypeAttributeName, std::vector<uint8_t>(12, 0xAB));
-  Error error;
-  EXPECT_FALSE(fm_.installTypeForBundle(bundleURL(), &error));
-  EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeFileOperationFailed));
-  EXPECT_EQ(error.localizedDescription(),
-            "Couldn't get installType EA from \"" + bundle_ + "\": Numerical result out of range");
-  ASSERT_NE(error.underlyingError(), nullptr);
-  EXPECT_TRUE(error.underlyingError()->isPOSIX(ERANGE));
-  EXPECT_EQ(log_.count("Couldn't get installType EA from"), 1u);
-}
-
-TEST_F(AttributesInstallType, FailedWriteLeavesTheOldValue) {
-  ASSERT_TRUE(fm_.setInstallType(Value(uint64_t{7}), bundleURL()));
+TEST_F(Attributes, FailedInstallTypeWriteLeavesTheOldValue) {
+  ASSERT_TRUE(fm.setInstallType(Value(uint64_t{7}), bundleURL()));
   ASSERT_TRUE(qstest::setImmutable(bundle_, true));
   Error error;
-  bool ok = fm_.setInstallType(Value(uint64_t{9}), bundleURL(), &error);
+  bool ok = fm.setInstallType(Value(uint64_t{9}), bundleURL(), &error);
   ASSERT_TRUE(qstest::setImmutable(bundle_, false));
   EXPECT_FALSE(ok);
-  EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeFileOperationFailed));
-  EXPECT_EQ(error.localizedDescription(), "Could't set installType EA on \"" + bundle_ + "\": Operation not permitted");
-  ASSERT_NE(error.underlyingError(), nullptr);
-  EXPECT_TRUE(error.underlyingError()->isPOSIX(EPERM));
-  EXPECT_EQ(log_.count("Could't set installType EA on"), 1u);
-  EXPECT_EQ(fm_.installTypeForBundle(bundleURL())->uint64Value(), 7u);
+  const std::string message = "Could't set installType EA on \"" + bundle_ + "\": Operation not permitted";
+  qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed, message, EPERM);
+  EXPECT_EQ(log.count(message), 1u);
+  EXPECT_EQ(fm.installTypeForBundle(bundleURL())->uint64Value(), 7u);
 }
 
 }  // namespace

@@ -1,12 +1,13 @@
-#include <sys/sysmacros.h>
+// Copy and move on real trees, within and across file systems.
+#include <tuple>
 
 #include "FileLayerTestSupport.h"
-#include "Shared/FileManager/QSFileManager.h"
 #include "Shared/FileManager/TreeWalk.h"
 
 namespace {
 
 using platform::Error;
+using qstest::exists;
 using qstest::fileURL;
 
 constexpr char kCopyFn[] = "-[QSFileManager _copyItemAtURL:toURL:failIfSrcMissing:error:]";
@@ -14,6 +15,7 @@ constexpr char kMoveFn[] = "-[QSFileManager _moveItemAtURL:toURL:failIfSrcMissin
 constexpr uid_t kOwner = 1234;
 constexpr gid_t kGroup = 5678;
 constexpr time_t kMTime = 1000000000;  // 2001-09-09
+const char* const kSourceItems[] = {"", "/data", "/link", "/dangling", "/sub", "/sub/big", "/sub/fifo"};
 
 // A POSIX access ACL with an extra named-user entry, in the kernel's
 // extended-attribute layout (version 2; entries sorted by tag).
@@ -30,19 +32,15 @@ std::string accessACL() {
   return out;
 }
 
-void setTimes(const std::string& path, time_t seconds) {
-  const timespec times[2] = {{seconds - 100, 0}, {seconds, 123456789}};
-  ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW), 0) << path;
-}
-
-class FileManagerCopy : public testing::Test {
+class FileManagerCopy : public qstest::FileLayerTest {
  protected:
-  // src/ (0750, owned 1234:5678, xattrs)
-  //   data      (0640, owned 1234:5678, user and trusted xattrs, an access ACL)
-  //   sub/big   (3 MiB)
+  // src/ (0750, owned 1234:5678, an attribute)
+  //   data      (0640, owned 1234:5678, user and trusted attributes, an access ACL)
+  //   sub/big   (3 MiB, more than one kernel copy call)
   //   sub/fifo
   //   link      -> data (owned 1234:5678)
   //   dangling  -> nowhere
+  // Every item has the same nanosecond modification time.
   void buildSource(const std::string& src) {
     ASSERT_TRUE(qstest::makeDirs(src + "/sub"));
     ASSERT_TRUE(qstest::writeFile(src + "/data", "payload"));
@@ -50,52 +48,40 @@ class FileManagerCopy : public testing::Test {
     for (size_t i = 0; i < big.size(); ++i) big[i] = static_cast<char>(i * 7 + i / 4096);
     ASSERT_TRUE(qstest::writeFile(src + "/sub/big", big));
     ASSERT_EQ(mkfifo((src + "/sub/fifo").c_str(), 0604), 0);
-    ASSERT_EQ(symlink("data", (src + "/link").c_str()), 0);
-    ASSERT_EQ(symlink("nowhere", (src + "/dangling").c_str()), 0);
-    ASSERT_EQ(lsetxattr((src + "/data").c_str(), "user.note", "hello", 5, 0), 0);
-    ASSERT_EQ(lsetxattr((src + "/data").c_str(), "trusted.secret", "s", 1, 0), 0);
-    std::string acl = accessACL();
-    ASSERT_EQ(lsetxattr((src + "/data").c_str(), "system.posix_acl_access", acl.data(), acl.size(), 0), 0);
-    ASSERT_EQ(lsetxattr(src.c_str(), "user.dir", "d", 1, 0), 0);
+    qstest::makeSymlink("data", src + "/link");
+    qstest::makeSymlink("nowhere", src + "/dangling");
+    qstest::setXattr(src + "/data", "user.note", "hello");
+    qstest::setXattr(src + "/data", "trusted.secret", "s");
+    qstest::setXattr(src + "/data", "system.posix_acl_access", accessACL());
+    qstest::setXattr(src, "user.dir", "d");
     for (const char* item : {"", "/data", "/link", "/sub/big"}) {
       ASSERT_EQ(lchown((src + item).c_str(), kOwner, kGroup), 0) << item;
     }
     ASSERT_EQ(chmod((src + "/data").c_str(), 0640), 0);
     ASSERT_EQ(chmod(src.c_str(), 0750), 0);
-    for (const char* item : {"/data", "/link", "/dangling", "/sub/big", "/sub/fifo", "/sub", ""})
-      setTimes(src + item, kMTime);
-  }
-
-  void expectSameItem(const std::string& src, const std::string& dst) {
-    auto a = qstest::lstatOf(src);
-    auto b = qstest::lstatOf(dst);
-    ASSERT_TRUE(a) << src;
-    ASSERT_TRUE(b) << dst;
-    EXPECT_EQ(a->st_mode, b->st_mode) << dst;
-    EXPECT_EQ(a->st_uid, b->st_uid) << dst;
-    EXPECT_EQ(a->st_gid, b->st_gid) << dst;
-    EXPECT_EQ(a->st_mtim.tv_sec, b->st_mtim.tv_sec) << dst;
-    EXPECT_EQ(a->st_mtim.tv_nsec, b->st_mtim.tv_nsec) << dst;
+    const timespec times[2] = {{kMTime - 100, 0}, {kMTime, 123456789}};
+    for (const char* item : kSourceItems) {
+      ASSERT_EQ(utimensat(AT_FDCWD, (src + item).c_str(), times, AT_SYMLINK_NOFOLLOW), 0) << item;
+    }
   }
 
   void expectCopied(const std::string& src, const std::string& dst) {
-    for (const char* item : {"", "/data", "/link", "/dangling", "/sub", "/sub/big", "/sub/fifo"}) {
-      expectSameItem(src + item, dst + item);
+    for (const char* item : kSourceItems) {
+      auto a = qstest::lstatOf(src + item), b = qstest::lstatOf(dst + item);
+      ASSERT_TRUE(a && b) << item;
+      EXPECT_EQ(std::tie(a->st_mode, a->st_uid, a->st_gid, a->st_mtim.tv_sec, a->st_mtim.tv_nsec),
+                std::tie(b->st_mode, b->st_uid, b->st_gid, b->st_mtim.tv_sec, b->st_mtim.tv_nsec))
+          << item;
     }
     EXPECT_EQ(qstest::readFile(dst + "/data"), "payload");
     EXPECT_EQ(qstest::readFile(dst + "/sub/big"), qstest::readFile(src + "/sub/big"));
-    char target[64] = {};
-    ASSERT_GT(readlink((dst + "/link").c_str(), target, sizeof target), 0);
-    EXPECT_STREQ(target, "data");
+    EXPECT_EQ(fm.destinationOfSymbolicLinkAtURL(fileURL(dst + "/link"))->path(), "data");
     EXPECT_EQ(qstest::xattrOf(dst + "/data", "user.note"), "hello");
     EXPECT_EQ(qstest::xattrOf(dst + "/data", "trusted.secret"), "s");
     EXPECT_EQ(qstest::xattrOf(dst + "/data", "system.posix_acl_access"),
               qstest::xattrOf(src + "/data", "system.posix_acl_access"));
     EXPECT_EQ(qstest::xattrOf(dst, "user.dir"), "d");
   }
-
-  QSFileManager& fm = QSFileManager::defaultManager();
-  qstest::TempDir dir{"copy"};
 };
 
 TEST_F(FileManagerCopy, TreeKeepsDataAttributesOwnersModesTimesAndLinks) {
@@ -104,37 +90,7 @@ TEST_F(FileManagerCopy, TreeKeepsDataAttributesOwnersModesTimesAndLinks) {
   ASSERT_TRUE(fm.copyItemAtURL(fileURL(dir / "src", true), fileURL(dir / "dst", true), &error)) << error.description();
   EXPECT_TRUE(error.is("Sentinel", 99));
   expectCopied(dir / "src", dir / "dst");
-  EXPECT_TRUE(qstest::exists(dir / "src/data")) << "a copy leaves its source";
-}
-
-TEST_F(FileManagerCopy, ExistingDestinationFailsWithFileExists) {
-  ASSERT_TRUE(qstest::writeFile(dir / "src", "new"));
-  ASSERT_TRUE(qstest::writeFile(dir / "dst", "old"));
-  ASSERT_TRUE(qstest::makeDirs(dir / "srcdir"));
-  ASSERT_TRUE(qstest::makeDirs(dir / "dstdir"));
-  Error error;
-  EXPECT_FALSE(fm.copyItemAtURL(fileURL(dir / "src"), fileURL(dir / "dst"), &error));
-  qstest::expectPOSIXError(
-      error, EEXIST, "copyfile of file://" + dir.path() + "/src to file://" + dir.path() + "/dst failed: File exists",
-      kCopyFn);
-  EXPECT_EQ(qstest::readFile(dir / "dst"), "old");
-  EXPECT_FALSE(fm.copyItemAtURL(fileURL(dir / "srcdir", true), fileURL(dir / "dstdir", true), &error));
-  EXPECT_TRUE(error.isPOSIX(EEXIST));
-}
-
-TEST_F(FileManagerCopy, AbsentSourceIsNoFailureOnlyForTheIfExistsForm) {
-  qstest::LogCapture log;
-  Error error = qstest::untouchedSentinel();
-  EXPECT_TRUE(fm.copyItemIfExistsAtURL(fileURL(dir / "none"), fileURL(dir / "dst"), &error));
-  EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_FALSE(qstest::exists(dir / "dst"));
-  EXPECT_FALSE(fm.copyItemAtURL(fileURL(dir / "none"), fileURL(dir / "dst"), &error));
-  qstest::expectPOSIXError(
-      error, ENOENT,
-      "copyfile of file://" + dir.path() + "/none to file://" + dir.path() + "/dst failed: No such file or directory",
-      kCopyFn);
-  EXPECT_FALSE(qstest::exists(dir / "dst"));
-  EXPECT_TRUE(log.systemLines().empty());
+  EXPECT_TRUE(exists(dir / "src/data")) << "a copy leaves its source";
 }
 
 TEST_F(FileManagerCopy, DirectoryIntoItselfFails) {
@@ -145,39 +101,30 @@ TEST_F(FileManagerCopy, DirectoryIntoItselfFails) {
 }
 
 TEST_F(FileManagerCopy, UnreadableFileStopsTheCopyAndKeepsWhatWasCopied) {
-  ASSERT_TRUE(qstest::makeDirs(dir / "src"));
-  ASSERT_TRUE(qstest::writeFile(dir / "src/secret", "x"));
+  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(dir / "src", {"secret"}));
   ASSERT_EQ(chmod((dir / "src/secret").c_str(), 0600), 0);
   ASSERT_EQ(chmod(dir.path().c_str(), 0777), 0);
-  const std::string root = dir.path();
   int status = qstest::runAsNobody([&] {
     Error error;
-    if (QSFileManager::defaultManager().copyItemAtURL(fileURL(root + "/src", true), fileURL(root + "/dst", true),
-                                                      &error)) {
-      return 1;
-    }
+    if (fm.copyItemAtURL(fileURL(dir / "src", true), fileURL(dir / "dst", true), &error)) return 1;
     if (!error.isPOSIX(EACCES)) return 2;
-    struct stat st {};
-    return stat((root + "/dst").c_str(), &st) == 0 && S_ISDIR(st.st_mode) ? 0 : 3;
+    auto copied = qstest::lstatOf(dir / "dst");
+    return copied && S_ISDIR(copied->st_mode) ? 0 : 3;
   });
   EXPECT_EQ(status, 0);
 }
 
-TEST_F(FileManagerCopy, SourceStatusFailureIsReportedByTheIfExistsForm) {
-  ASSERT_TRUE(qstest::makeDirs(dir / "private", 0700));
-  ASSERT_TRUE(qstest::writeFile(dir / "private/item", "x"));
-  const std::string item = dir / "private/item";
-  const std::string dst = dir / "dst";
+TEST_F(FileManagerCopy, SourceStatusFailureIsReportedByTheIfExistsForms) {
+  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(dir / "private", {"item"}));
+  ASSERT_EQ(chmod((dir / "private").c_str(), 0700), 0);
+  const std::string item = dir / "private/item", dst = dir / "dst";
   int status = qstest::runAsNobody([&] {
     Error copyError, moveError;
-    auto& manager = QSFileManager::defaultManager();
-    if (manager.copyItemIfExistsAtURL(fileURL(item), fileURL(dst), &copyError)) return 1;
-    if (manager.moveItemIfExistsAtURL(fileURL(item), fileURL(dst), &moveError)) return 2;
+    if (fm.copyItemIfExistsAtURL(fileURL(item), fileURL(dst), &copyError)) return 1;
+    if (fm.moveItemIfExistsAtURL(fileURL(item), fileURL(dst), &moveError)) return 2;
     const std::string expected = "stat of file://" + item + " failed: Permission denied";
     if (!copyError.isPOSIX(EACCES) || copyError.localizedDescription() != expected) return 3;
-    if (!moveError.isPOSIX(EACCES) || moveError.localizedDescription() != expected) return 4;
-    if (qstest::functionNameOf(copyError) != kCopyFn || qstest::functionNameOf(moveError) != kMoveFn) return 5;
-    return 0;
+    return moveError.isPOSIX(EACCES) && qstest::functionNameOf(moveError) == kMoveFn ? 0 : 4;
   });
   EXPECT_EQ(status, 0);
 }
@@ -188,104 +135,72 @@ TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitIsCopied) {
   // level of this tree would need 2,000.
   constexpr rlim_t kDescriptorLimit = 2 * qsfs::kMaxOpenDirectories + 64;
   qstest::ShmDir shm;
-  ASSERT_TRUE(qstest::makeDirs(shm / "src"));
-  ASSERT_NO_FATAL_FAILURE(qstest::makeChain(shm / "src", kDepth));
-  std::string chain;
-  for (int i = 0; i < kDepth; ++i) chain += "/d";
-  ASSERT_TRUE(qstest::writeFile(shm / "src" + chain + "/bottom", "deep"));
-  ASSERT_EQ(chmod((shm / "src" + chain.substr(0, 100)).c_str(), 0705), 0);
-  const std::string src = shm / "src";
-  const std::string dst = shm / "dst";
+  const std::string src = shm / "src", dst = shm / "dst", chain = qstest::chainPath(kDepth);
+  ASSERT_NO_FATAL_FAILURE(qstest::makeChain(src, kDepth));
+  ASSERT_TRUE(qstest::writeFile(src + chain + "/bottom", "deep"));
+  ASSERT_EQ(chmod((src + chain.substr(0, 100)).c_str(), 0705), 0);
   int status = qstest::runWithDescriptorLimit(kDescriptorLimit, [&] {
-    return QSFileManager::defaultManager().copyItemAtURL(fileURL(src, true), fileURL(dst, true)) ? 0 : 1;
+    return fm.copyItemAtURL(fileURL(src, true), fileURL(dst, true)) ? 0 : 1;
   });
   EXPECT_EQ(status, 0);
   EXPECT_EQ(qstest::readFile(dst + chain + "/bottom"), "deep");
   EXPECT_EQ(qstest::readFile(dst + chain.substr(0, 1000) + "/f"), "");
-  auto copiedMode = qstest::lstatOf(dst + chain.substr(0, 100));
-  ASSERT_TRUE(copiedMode);
-  EXPECT_EQ(copiedMode->st_mode & 07777, 0705u) << "status is applied to levels that were reopened";
+  EXPECT_EQ(qstest::permissionsOf(dst + chain.substr(0, 100)), 0705u) << "status goes on levels that were reopened";
   EXPECT_TRUE(fm.removeItemAtURL(fileURL(dst, true)));
   EXPECT_TRUE(fm.removeItemAtURL(fileURL(src, true)));
 }
 
-class FileManagerMove : public FileManagerCopy {};
+using FileManagerMove = FileManagerCopy;
 
-TEST_F(FileManagerMove, RenameWithinTheFileSystem) {
+TEST_F(FileManagerMove, RenameWithinTheFileSystemKeepsTheItemAndReportsOtherFailures) {
   ASSERT_TRUE(qstest::makeDirs(dir / "src/sub"));
-  ASSERT_TRUE(qstest::writeFile(dir / "src/sub/file", "x"));
+  ASSERT_TRUE(qstest::makeDirs(dir / "occupied/x"));
   ino_t inode = qstest::lstatOf(dir / "src")->st_ino;
   Error error = qstest::untouchedSentinel();
   EXPECT_TRUE(fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(dir / "dst", true), &error));
   EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_FALSE(qstest::exists(dir / "src"));
+  EXPECT_FALSE(exists(dir / "src"));
   EXPECT_EQ(qstest::lstatOf(dir / "dst")->st_ino, inode);
-  EXPECT_EQ(qstest::readFile(dir / "dst/sub/file"), "x");
-}
-
-TEST_F(FileManagerMove, AbsentSourceIsNoFailureOnlyForTheIfExistsForm) {
-  Error error = qstest::untouchedSentinel();
-  EXPECT_TRUE(fm.moveItemIfExistsAtURL(fileURL(dir / "none"), fileURL(dir / "dst"), &error));
-  EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_FALSE(qstest::exists(dir / "dst"));
-  EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "none"), fileURL(dir / "dst"), &error));
-  qstest::expectPOSIXError(
-      error, ENOENT,
-      "rename of file://" + dir.path() + "/none to file://" + dir.path() + "/dst failed: No such file or directory",
-      kMoveFn);
-}
-
-TEST_F(FileManagerMove, RenameFailureOtherThanCrossDeviceIsReported) {
-  ASSERT_TRUE(qstest::makeDirs(dir / "src"));
-  ASSERT_TRUE(qstest::makeDirs(dir / "dst/occupied"));
-  Error error;
-  EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(dir / "dst", true), &error));
+  EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "dst", true), fileURL(dir / "occupied", true), &error));
   qstest::expectPOSIXError(
       error, ENOTEMPTY,
-      "rename of file://" + dir.path() + "/src/ to file://" + dir.path() + "/dst/ failed: Directory not empty",
+      "rename of file://" + dir.path() + "/dst/ to file://" + dir.path() + "/occupied/ failed: Directory not empty",
       kMoveFn);
-  EXPECT_TRUE(qstest::exists(dir / "src"));
+  EXPECT_TRUE(exists(dir / "dst/sub"));
 }
 
 TEST_F(FileManagerMove, CrossDeviceCopiesThenRemovesTheSource) {
   qstest::ShmDir shm;
   ASSERT_NO_FATAL_FAILURE(buildSource(dir / "src"));
   ASSERT_NO_FATAL_FAILURE(buildSource(dir / "reference"));
-  qstest::LogCapture log;
   Error error = qstest::untouchedSentinel();
   ASSERT_TRUE(fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error)) << error.description();
   EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_FALSE(qstest::exists(dir / "src"));
+  EXPECT_FALSE(exists(dir / "src"));
   expectCopied(dir / "reference", shm / "dst");
   EXPECT_TRUE(log.systemLines().empty());
 }
 
 TEST_F(FileManagerMove, CrossDeviceKeepsDestinationWhenSourceRemovalFails) {
   qstest::ShmDir shm;
-  ASSERT_TRUE(qstest::makeDirs(dir / "src/locked"));
-  ASSERT_TRUE(qstest::writeFile(dir / "src/locked/file", "kept"));
-  ASSERT_TRUE(qstest::setImmutable(dir / "src/locked", true));
-  qstest::LogCapture log;
+  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(dir / "src", {"locked/file"}));
   Error error = qstest::untouchedSentinel();
-  bool moved = fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error);
-  ASSERT_TRUE(qstest::setImmutable(dir / "src/locked", false));
-  EXPECT_TRUE(moved);
+  EXPECT_TRUE(qstest::whileImmutable(
+      dir / "src/locked", [&] { return fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error); }));
   EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_EQ(qstest::readFile(shm / "dst/locked/file"), "kept");
-  EXPECT_EQ(qstest::readFile(dir / "src/locked/file"), "kept");
-
-  std::vector<platform::SystemLogLine> moveLines;
-  for (const auto& line : log.systemLines()) {
-    if (line.function == kMoveFn) moveLines.push_back(line);
-  }
-  ASSERT_EQ(moveLines.size(), 1u);
-  EXPECT_EQ(moveLines[0].level, 3);
-  const std::string prefix = "Failed to remove move source after copy at " + dir.path() + "/src : ";
-  EXPECT_EQ(moveLines[0].message.substr(0, prefix.size()), prefix);
-  EXPECT_NE(moveLines[0].message.find("Error Domain=POSIXErrorDomain Code=1 \"removefile of file://" + dir.path() +
-                                      "/src/ failed: Operation not permitted\""),
+  EXPECT_EQ(qstest::readFile(shm / "dst/locked/file"), "x");
+  EXPECT_EQ(qstest::readFile(dir / "src/locked/file"), "x");
+  // The line that tells both copies are left.
+  auto lines = log.systemLines();
+  ASSERT_FALSE(lines.empty());
+  const auto& line = lines.back();
+  EXPECT_EQ(line.function, kMoveFn);
+  EXPECT_EQ(line.level, kQSLogLevelError);
+  EXPECT_EQ(line.message.rfind("Failed to remove move source after copy at " + dir.path() + "/src : ", 0), 0u);
+  EXPECT_NE(line.message.find("Error Domain=POSIXErrorDomain Code=1 \"removefile of file://" + dir.path() +
+                              "/src/ failed: Operation not permitted\""),
             std::string::npos)
-      << moveLines[0].message;
+      << line.message;
 }
 
 TEST_F(FileManagerMove, CrossDeviceCopyFailureIsTheMovesFailureAndKeepsTheSource) {

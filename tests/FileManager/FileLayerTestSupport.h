@@ -1,12 +1,12 @@
-// Helpers for the file layer's tests: a directory on another file system (for
-// cross-device moves), status and attribute probes, and error-record checks.
+// Helpers for the file layer's tests: a fixture with a fresh directory and a
+// log capture, a directory on another file system (for cross-device moves),
+// status and attribute probes, and error-record checks.
 #pragma once
 
 #include <fcntl.h>
 #include <ftw.h>
 #include <stdlib.h>
 #include <sys/resource.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -14,15 +14,14 @@
 #include <cerrno>
 #include <cstring>
 #include <functional>
-#include <optional>
 #include <string>
 
 #include <gtest/gtest.h>
 
-#include "Platform/Foundation/Error.h"
-#include "Platform/Foundation/URL.h"
 #include "Shared/FileManager/PosixHandles.h"
+#include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
+#include "Shared/Support/QSLog.h"
 #include "support/TestSupport.h"
 
 namespace qstest {
@@ -55,6 +54,14 @@ class ShmDir {
   std::string path_;
 };
 
+// The shared manager, a fresh directory and a capture of both logs.
+class FileLayerTest : public testing::Test {
+ protected:
+  QSFileManager& fm = QSFileManager::defaultManager();
+  TempDir dir{"filelayer"};
+  LogCapture log;
+};
+
 inline platform::URL fileURL(const std::string& path, bool isDirectory = false) {
   return platform::URL::fileURL(path, isDirectory);
 }
@@ -69,11 +76,22 @@ inline bool exists(const std::string& path) {
   return lstatOf(path).has_value();
 }
 
+// Permission bits of `path`; a missing item fails the test.
+inline mode_t permissionsOf(const std::string& path) {
+  auto status = lstatOf(path);
+  EXPECT_TRUE(status) << path;
+  return status ? status->st_mode & 07777 : 0;
+}
+
 inline std::optional<std::string> xattrOf(const std::string& path, const char* name) {
   char buffer[4096];
   ssize_t size = lgetxattr(path.c_str(), name, buffer, sizeof buffer);
   if (size < 0) return std::nullopt;
   return std::string(buffer, static_cast<size_t>(size));
+}
+
+inline void setXattr(const std::string& path, const char* name, const std::string& bytes) {
+  ASSERT_EQ(lsetxattr(path.c_str(), name, bytes.data(), bytes.size(), 0), 0) << path << ": " << strerror(errno);
 }
 
 inline std::string functionNameOf(const platform::Error& error) {
@@ -89,6 +107,14 @@ inline void expectPOSIXError(const platform::Error& error, int code, const std::
   EXPECT_EQ(error.code(), code);
   EXPECT_EQ(error.localizedDescription(), message);
   EXPECT_EQ(functionNameOf(error), function);
+}
+
+// Expects an installer record of `code` whose underlying record is POSIX `errnum`.
+inline void expectInstallerError(const platform::Error& error, int64_t code, const std::string& message, int errnum) {
+  EXPECT_TRUE(error.is(QSInstallerErrorDomain, code)) << error.description();
+  EXPECT_EQ(error.localizedDescription(), message);
+  ASSERT_NE(error.underlyingError(), nullptr);
+  EXPECT_TRUE(error.underlyingError()->isPOSIX(errnum)) << error.underlyingError()->description();
 }
 
 // Creates a symbolic link at `at` holding `text`; fails the test otherwise.
@@ -111,21 +137,49 @@ inline int runWithDescriptorLimit(rlim_t limit, const std::function<int()>& fn) 
   return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
-// Builds a chain of `depth` directories named "d" below `root` without ever
-// naming the whole path (it is far longer than PATH_MAX).
+// "/d" repeated `depth` times: the path of the bottom of a chain below its root.
+inline std::string chainPath(int depth) {
+  std::string chain;
+  for (int i = 0; i < depth; ++i) chain += "/d";
+  return chain;
+}
+
+// Builds a chain of `depth` directories named "d" below `root`, with an empty
+// file "f" every hundred levels, without ever naming the whole path (it is far
+// longer than PATH_MAX).
 inline void makeChain(const std::string& root, int depth) {
+  ASSERT_TRUE(makeDirs(root));
   qsfs::ScopedFD current(open(root.c_str(), O_RDONLY | O_DIRECTORY));
   ASSERT_TRUE(current.valid());
   for (int i = 0; i < depth; ++i) {
     ASSERT_EQ(mkdirat(current.get(), "d", 0755), 0) << "level " << i;
     if (i % 100 == 0) {
-      int fd = openat(current.get(), "f", O_WRONLY | O_CREAT, 0644);
-      ASSERT_GE(fd, 0);
-      close(fd);
+      ASSERT_TRUE(qsfs::ScopedFD(openat(current.get(), "f", O_WRONLY | O_CREAT, 0644)).valid());
     }
     current.reset(openat(current.get(), "d", O_RDONLY | O_DIRECTORY));
     ASSERT_TRUE(current.valid());
   }
+}
+
+// Builds items below `root` with their parents: a name ending in '/' is a
+// directory, any other a file holding "x".
+inline void makeTree(const std::string& root, std::initializer_list<std::string> items) {
+  for (const std::string& item : items) {
+    const std::string path = root + "/" + item;
+    ASSERT_TRUE(makeDirs(item.back() == '/' ? path : path.substr(0, path.rfind('/')))) << item;
+    if (item.back() != '/') {
+      ASSERT_TRUE(writeFile(path, "x")) << item;
+    }
+  }
+}
+
+// Runs `fn` while `path` is immutable and returns its result.
+template <class Fn>
+auto whileImmutable(const std::string& path, const Fn& fn) {
+  EXPECT_TRUE(setImmutable(path, true)) << path;
+  auto result = fn();
+  EXPECT_TRUE(setImmutable(path, false)) << path;
+  return result;
 }
 
 // An error record that a successful call must leave as it was.

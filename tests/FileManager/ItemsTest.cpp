@@ -1,0 +1,104 @@
+// Existence, link status and listing of single items and directories.
+#include <map>
+#include <set>
+
+#include "FileLayerTestSupport.h"
+#include "Shared/FileManager/QuillsetAdditions.h"
+
+namespace {
+
+using platform::Error;
+using platform::URL;
+using qstest::fileURL;
+
+constexpr char kListFn[] = "-[QSFileManager urlsForItemsInDirectoryAtURL:ignoringSymlinks:error:]";
+
+// file, sub/, link-to-dir -> sub, dangling -> nowhere
+class FileManagerItems : public qstest::FileLayerTest {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(qstest::writeFile(dir / "file", "x"));
+    ASSERT_TRUE(qstest::makeDirs(dir / "sub"));
+    qstest::makeSymlink("sub", dir / "link-to-dir");
+    qstest::makeSymlink("nowhere", dir / "dangling");
+  }
+  // name -> is-directory flag of each listed URL
+  std::optional<std::map<std::string, bool>> list(bool ignoringSymlinks) {
+    auto urls = fm.urlsForItemsInDirectoryAtURL(fileURL(dir.path(), true), ignoringSymlinks);
+    if (!urls) return std::nullopt;
+    std::map<std::string, bool> out;
+    for (const URL& u : *urls) {
+      EXPECT_EQ(u.deletingLastPathComponent().path(), dir.path());
+      out[u.lastPathComponent()] = u.isDirectory();
+    }
+    return out;
+  }
+};
+
+TEST_F(FileManagerItems, ExistenceIsThatOfTheItemItselfAndUnknownWhenItCannotBeTold) {
+  for (const char* name : {"file", "dangling", "sub"}) {
+    EXPECT_TRUE(fm.itemExistsAtURL(fileURL(dir / name)) && !fm.itemDoesNotExistAtURL(fileURL(dir / name))) << name;
+  }
+  EXPECT_TRUE(!fm.itemExistsAtURL(fileURL(dir / "nothing")) && fm.itemDoesNotExistAtURL(fileURL(dir / "nothing")));
+  EXPECT_TRUE(log.systemLines().empty());
+  // Neither present nor absent: a file in the middle of the path.
+  EXPECT_FALSE(fm.itemExistsAtURL(fileURL(dir / "file/below")));
+  EXPECT_FALSE(fm.itemDoesNotExistAtURL(fileURL(dir / "file/below")));
+  const std::string line = "Failed to determine if file://" + dir.path() + "/file/below exists: Not a directory";
+  EXPECT_EQ(log.systemMessages(), (std::vector<std::string>{line, line}));
+}
+
+TEST_F(FileManagerItems, LinkStatusIsThatOfTheItemItself) {
+  for (const auto& [name, expected] :
+       {std::pair{"link-to-dir", true}, {"dangling", true}, {"sub", false}, {"file", false}}) {
+    bool isLink = !expected;
+    Error error = qstest::untouchedSentinel();
+    EXPECT_TRUE(fm.isSymbolicLinkAtURL(fileURL(dir / name), &isLink, &error)) << name;
+    EXPECT_EQ(isLink, expected) << name;
+    EXPECT_TRUE(error.is("Sentinel", 99));
+  }
+  bool isLink = true;
+  Error error;
+  EXPECT_FALSE(fm.isSymbolicLinkAtURL(fileURL(dir / "missing"), &isLink, &error));
+  EXPECT_TRUE(error.isPOSIX(ENOENT)) << error.description();
+  EXPECT_EQ(error.localizedDescription(), "lstat of " + (dir / "missing") + " failed: No such file or directory");
+  EXPECT_TRUE(isLink) << "flag written on failure";
+}
+
+TEST_F(FileManagerItems, ListingFlagsOnlyRealDirectoriesAndCanLeaveLinksOut) {
+  EXPECT_EQ(list(false),
+            (std::map<std::string, bool>{{"file", false}, {"sub", true}, {"link-to-dir", false}, {"dangling", false}}));
+  EXPECT_TRUE(log.systemLines().empty());
+  EXPECT_EQ(list(true), (std::map<std::string, bool>{{"file", false}, {"sub", true}}));
+  std::set<std::string> messages;
+  for (const auto& line : log.systemLines()) {
+    EXPECT_EQ(line.level, kQSLogLevelNotice);
+    EXPECT_EQ(line.function, kListFn);
+    messages.insert(line.message);
+  }
+  EXPECT_EQ(messages, (std::set<std::string>{"Ignoring symlink at " + dir.path() + "/link-to-dir",
+                                             "Ignoring symlink at " + dir.path() + "/dangling"}));
+}
+
+TEST_F(FileManagerItems, ListingFailsOnAnythingButADirectoryWithoutALine) {
+  const std::pair<const char*, std::string> cases[] = {
+      {"link-to-dir", "Not a directory"}, {"file", "Not a directory"}, {"none", "No such file or directory"}};
+  for (const auto& [name, reason] : cases) {
+    Error error;
+    EXPECT_FALSE(fm.urlsForItemsInDirectoryAtURL(fileURL(dir / name), false, &error).has_value());
+    qstest::expectPOSIXError(error, reason == "Not a directory" ? ENOTDIR : ENOENT,
+                             "_IterateDirectory for " + (dir / name) + " returned " + reason, kListFn);
+  }
+  EXPECT_TRUE(log.systemLines().empty());
+}
+
+TEST(QuillsetAdditions, DotDotCountsOnlyAsAWholeComponent) {
+  for (const char* path : {"..", "a/../b", "/..", "a/..", "a//../"}) {
+    EXPECT_TRUE(QuillsetAdditions::containsDotDotPathComponents(path)) << path;
+  }
+  for (const char* path : {"", "a/...b", "..a", "a..", "a/.b/."}) {
+    EXPECT_FALSE(QuillsetAdditions::containsDotDotPathComponents(path)) << path;
+  }
+}
+
+}  // namespace
