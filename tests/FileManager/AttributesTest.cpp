@@ -1,12 +1,18 @@
-// Data-protection classes and the bundle attributes on real files.
+// Data-protection classes, directory creation and the bundle attributes on
+// real files.
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/DataProtection.h"
 
 using platform::Error;
 using platform::URL;
 using platform::Value;
+using qstest::fileURL;
 
 namespace {
+
+constexpr char kCreateFn[] = "-[QSFileManager createDirectoryAtURL:withIntermediateDirectories:mode:class:error:]";
+constexpr mode_t kMode = 0700;  // the same under any usual umask
+constexpr int32_t kClass = 4;
 
 class Attributes : public qstest::FileLayerTest {
  protected:
@@ -80,14 +86,85 @@ TEST_F(Attributes, UnreadableClassFailsTheReadAndAGuardedChangeOnly) {
 
 TEST_F(Attributes, ImmutableItemKeepsItsClass) {
   ASSERT_TRUE(setClass(file_, 2));
-  ASSERT_TRUE(qstest::setImmutable(file_, true));
   Error error;
-  bool ok = setClass(file_, 3, &error);
-  ASSERT_TRUE(qstest::setImmutable(file_, false));
-  EXPECT_FALSE(ok);
+  EXPECT_FALSE(qstest::whileImmutable(file_, [&] { return setClass(file_, 3, &error); }));
   qstest::expectPOSIXError(error, EPERM, "Failed to setclass(3) on file " + file_ + ": Operation not permitted",
                            "-[QSFileManager setDataProtectionClassOfItemAtURL:toClass:ifPredicate:error:]");
   EXPECT_EQ(classOf(file_), 2);
+}
+
+using FileManagerDirectories = Attributes;
+
+TEST_F(FileManagerDirectories, IntermediatesGetTheModeAndTheLastOneTheClass) {
+  Error error = qstest::untouchedSentinel();
+  EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a/b/c", true), true, kMode, kClass, &error));
+  EXPECT_TRUE(error.is("Sentinel", 99));
+  for (const char* p : {"a", "a/b", "a/b/c"}) {
+    EXPECT_TRUE(S_ISDIR(qstest::lstatOf(dir / p)->st_mode));
+    EXPECT_EQ(qstest::permissionsOf(dir / p), kMode) << p;
+  }
+  EXPECT_EQ(classOf(dir / "a/b/c"), kClass);
+  EXPECT_FALSE(qstest::xattrOf(dir / "a/b", qsfs::kDataProtectionClassAttributeName));
+  // An existing directory keeps its mode and gets the class again.
+  ASSERT_EQ(chmod((dir / "a").c_str(), 0750), 0);
+  ASSERT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), false, kMode, 2));
+  EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), true, kMode, kClass));
+  EXPECT_EQ(classOf(dir / "a"), kClass);
+  EXPECT_EQ(qstest::permissionsOf(dir / "a"), 0750u);
+}
+
+TEST_F(FileManagerDirectories, FailuresNameTheCallAndThePath) {
+  // Without intermediates a file at the path is no failure until a class is to be set.
+  EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "file", true), false, kMode));
+  const struct {
+    const char* path;
+    bool intermediates;
+    int32_t cls;
+    int code;
+    std::string message;
+  } cases[] = {
+      {"missing/a", false, kQSNoDataProtectionClass, ENOENT,
+       "mkdir of " + dir.path() + "/missing/a failed: No such file or directory"},
+      {"file/a/b", true, kQSNoDataProtectionClass, ENOTDIR,
+       "mkpath_np of " + dir.path() + "/file/a/b failed: Not a directory"},
+      {"file", true, kQSNoDataProtectionClass, EEXIST, "mkpath_np of " + dir.path() + "/file failed: File exists"},
+      {"file", false, kClass, ENOTDIR, "opendir of " + dir.path() + "/file failed: Not a directory"},
+  };
+  for (const auto& c : cases) {
+    Error error;
+    EXPECT_FALSE(fm.createDirectoryAtURL(fileURL(dir / c.path, true), c.intermediates, kMode, c.cls, &error)) << c.path;
+    qstest::expectPOSIXError(error, c.code, c.message, kCreateFn);
+  }
+  EXPECT_EQ(qstest::readFile(dir / "file"), "x");
+}
+
+TEST_F(FileManagerDirectories, ImmutableDirectoryRefusesTheClass) {
+  ASSERT_TRUE(qstest::makeDirs(dir / "locked"));
+  Error error;
+  EXPECT_FALSE(qstest::whileImmutable(
+      dir / "locked", [&] { return fm.createDirectoryAtURL(fileURL(dir / "locked", true), true, kMode, kClass, &error); }));
+  qstest::expectPOSIXError(
+      error, EPERM, "Failed to setclass(4) on directory " + dir.path() + "/locked: Operation not permitted", kCreateFn);
+  EXPECT_FALSE(qstest::xattrOf(dir / "locked", qsfs::kDataProtectionClassAttributeName));
+}
+
+TEST_F(FileManagerDirectories, TemporaryDirectoriesArePrivateAndUniqueOrAnInstallerErrorWithTheTemplate) {
+  Error error = qstest::untouchedSentinel();
+  auto first = fm.createTemporaryDirectoryInDirectoryURL(fileURL(dir.path(), true), &error);
+  auto second = fm.createTemporaryDirectoryInDirectoryURL(fileURL(dir.path(), true), &error);
+  ASSERT_TRUE(first && second && first->isDirectory());
+  EXPECT_TRUE(error.is("", 0)) << "the error is cleared at entry";
+  EXPECT_NE(first->path(), second->path());
+  EXPECT_EQ(first->deletingLastPathComponent().path() + "/" + first->lastPathComponent().substr(0, 5), dir / "temp.");
+  EXPECT_EQ(qstest::lstatOf(first->path())->st_mode, S_IFDIR | 0700);
+  const std::string templatePath = dir / "missing/temp.XXXXXX";
+  EXPECT_FALSE(fm.createTemporaryDirectoryInDirectoryURL(fileURL(dir / "missing", true), &error));
+  qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed,
+                               "Failed to create temp dir at path " + templatePath, ENOENT);
+  const platform::URL* argument = error.userInfo().at(QSPathArgumentErrorKey).asURL();
+  ASSERT_TRUE(argument && argument->isDirectory());
+  EXPECT_EQ(argument->path(), templatePath);
+  EXPECT_EQ(log.count("Failed to create temp dir at path " + templatePath), 1u);
 }
 
 TEST_F(Attributes, PlaceholderMarkIsAnyFourBytesOnTheBundleItself) {
@@ -111,46 +188,31 @@ TEST_F(Attributes, PlaceholderMarkIsAnyFourBytesOnTheBundleItself) {
   EXPECT_EQ(log.count(message), 1u);
 }
 
-TEST_F(Attributes, InstallTypeIsZeroWhenAbsentAndReadsBackUnchanged) {
+TEST_F(Attributes, InstallTypeReadsBackAndFailuresOfEveryKindAreLoggedRecords) {
   Error error = qstest::untouchedSentinel();
-  auto absent = fm.installTypeForBundle(bundleURL(), &error);
-  ASSERT_TRUE(absent && absent->isInteger());
-  EXPECT_EQ(absent->uint64Value(), 0u);
+  EXPECT_EQ(fm.installTypeForBundle(bundleURL(), &error), Value(uint64_t{0})) << "absent reads 0";
   EXPECT_TRUE(error.is("Sentinel", 99));
   ASSERT_TRUE(fm.setInstallType(Value(UINT64_MAX), bundleURL()));
-  EXPECT_EQ(qstest::xattrOf(bundle_, kQSInstallTypeAttributeName)->size(), 8u);
-  EXPECT_EQ(fm.installTypeForBundle(bundleURL())->uint64Value(), UINT64_MAX);
+  EXPECT_EQ(fm.installTypeForBundle(bundleURL()), Value(UINT64_MAX));
   EXPECT_TRUE(log.systemLines().empty());
-}
 
-TEST_F(Attributes, InstallTypeOfTheWrongSizeIsReported) {
-  qstest::setXattr(bundle_, kQSInstallTypeAttributeName, "1234");
-  Error error;
-  EXPECT_FALSE(fm.installTypeForBundle(bundleURL(), &error));
-  EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeFileOperationFailed));
-  const std::string message = "getxattr for installType EA on " + bundle_ + " returned 4 (expected 8)";
-  EXPECT_EQ(error.localizedDescription(), message);
-  EXPECT_EQ(error.underlyingError(), nullptr);
-  EXPECT_EQ(log.count(message), 1u);
-  // Longer than the value: it does not fit the buffer.
-  qstest::setXattr(bundle_, kQSInstallTypeAttributeName, std::string(12, '\xAB'));
+  const std::string unwritable = "Could't set installType EA on \"" + bundle_ + "\": Operation not permitted";
+  EXPECT_FALSE(qstest::whileImmutable(bundle_, [&] { return fm.setInstallType(Value(uint64_t{9}), bundleURL(), &error); }));
+  qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed, unwritable, EPERM);
+  EXPECT_EQ(fm.installTypeForBundle(bundleURL()), Value(UINT64_MAX));
+
+  qstest::setXattr(bundle_, kQSInstallTypeAttributeName, std::string(12, '\xAB'));  // does not fit the value
   EXPECT_FALSE(fm.installTypeForBundle(bundleURL(), &error));
   const std::string tooLong = "Couldn't get installType EA from \"" + bundle_ + "\": Numerical result out of range";
   qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed, tooLong, ERANGE);
-  EXPECT_EQ(log.count(tooLong), 1u);
-}
 
-TEST_F(Attributes, FailedInstallTypeWriteLeavesTheOldValue) {
-  ASSERT_TRUE(fm.setInstallType(Value(uint64_t{7}), bundleURL()));
-  ASSERT_TRUE(qstest::setImmutable(bundle_, true));
-  Error error;
-  bool ok = fm.setInstallType(Value(uint64_t{9}), bundleURL(), &error);
-  ASSERT_TRUE(qstest::setImmutable(bundle_, false));
-  EXPECT_FALSE(ok);
-  const std::string message = "Could't set installType EA on \"" + bundle_ + "\": Operation not permitted";
-  qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed, message, EPERM);
-  EXPECT_EQ(log.count(message), 1u);
-  EXPECT_EQ(fm.installTypeForBundle(bundleURL())->uint64Value(), 7u);
+  qstest::setXattr(bundle_, kQSInstallTypeAttributeName, "1234");
+  EXPECT_FALSE(fm.installTypeForBundle(bundleURL(), &error));
+  const std::string tooShort = "getxattr for installType EA on " + bundle_ + " returned 4 (expected 8)";
+  EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeFileOperationFailed));
+  EXPECT_EQ(error.localizedDescription(), tooShort);
+  EXPECT_EQ(error.underlyingError(), nullptr);
+  for (const std::string& line : {unwritable, tooLong, tooShort}) EXPECT_EQ(log.count(line), 1u) << line;
 }
 
 }  // namespace

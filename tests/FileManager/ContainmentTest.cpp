@@ -20,14 +20,8 @@ bool isInside(const std::string& path, const std::string& base) {
   return path == base || path.rfind(base + "/", 0) == 0;
 }
 
-// A tree of directories, files and links. In every text {B} is the base, {R}
-// its real path, {T} the directory holding the base and {X} the real path of
-// {T}; relative item paths lie below the base.
-struct Tree {
-  std::vector<std::string> dirs{}, files{};
-  std::vector<std::pair<std::string, std::string>> links{};  // text, place
-};
-
+// In every text {B} is the base, {R} its real path, {T} the directory holding
+// the base and {X} the real path of {T}.
 class Containment : public qstest::FileLayerTest {
  protected:
   // A fresh base (in a directory of its own) for the next case.
@@ -47,14 +41,19 @@ class Containment : public qstest::FileLayerTest {
     }
     return text;
   }
-  std::string place(const std::string& item) const {
-    std::string path = expand(item);
-    return path.front() == '/' ? path : base_ + "/" + path;
-  }
-  void build(const Tree& tree) {
-    for (const auto& d : tree.dirs) ASSERT_TRUE(qstest::makeDirs(place(d))) << d;
-    for (const auto& f : tree.files) ASSERT_TRUE(qstest::writeFile(place(f), "x")) << f;
-    for (const auto& [text, at] : tree.links) qstest::makeSymlink(expand(text), place(at));
+  // Items in order, relative to the base unless absolute: "name/" is a
+  // directory, "name -> text" a link, anything else a file.
+  void build(const std::vector<std::string>& items) {
+    for (const std::string& item : items) {
+      const size_t arrow = item.find(" -> ");
+      std::string path = expand(item.substr(0, arrow));
+      if (path.front() != '/') path = base_ + "/" + path;
+      if (arrow != std::string::npos) {
+        qstest::makeSymlink(expand(item.substr(arrow + 4)), path);
+      } else {
+        ASSERT_TRUE(item.back() == '/' ? qstest::makeDirs(path) : qstest::writeFile(path, "x")) << item;
+      }
+    }
   }
   std::optional<URL> check(const std::string& suspicious, const std::string& base) {
     return fm.realPathForURL(URL::fileURL(expand(suspicious)), URL::fileURL(expand(base), true));
@@ -80,36 +79,30 @@ TEST_F(Containment, MissingArgumentIsRejected) {
 
 TEST_F(Containment, RejectionsNameTheirReason) {
   const struct {
-    Tree tree;
+    std::vector<std::string> tree;
     std::string suspicious, base, message;
   } cases[] = {
       // A leading "/private" is dropped from both paths, and from the line.
       {{}, "/private{T}/elsewhere", "/private{B}", "supiscious path {T}/elsewhere does not contain base path {B} as a prefix"},
-      {{{"sub"}}, "{B}/sub/../sub", "{B}", "The suspicious path {B}/sub/../sub contains '..' paths, which are invalid"},
+      {{"sub/"}, "{B}/sub/../sub", "{B}", "The suspicious path {B}/sub/../sub contains '..' paths, which are invalid"},
       // "/private" alone is kept as it is; here it does not exist.
       {{}, "/private", "/", "Failed to retrieve realpath for suspicious path /private"},
-      {{{}, {"inside"}, {{"{B}/inside", "abs"}}},
-       "{B}/abs", "{B}", "Rejecting {B}/abs -> {B}/inside, as absolute symlinks are not allowed"},
-      {{{}, {}, {{"../d", "up"}}},
-       "{B}/up", "{B}", "Rejecting {B}/up -> /../d, as it is points outside or to the base {B}"},
-      {{{}, {"file"}}, "{B}/file/x", "{B}", "Readlink failed: Not a directory"},
+      {{"inside", "abs -> {B}/inside"}, "{B}/abs", "{B}", "Rejecting {B}/abs -> {B}/inside, as absolute symlinks are not allowed"},
+      {{"up -> ../d"}, "{B}/up", "{B}", "Rejecting {B}/up -> /../d, as it is points outside or to the base {B}"},
+      {{"file"}, "{B}/file/x", "{B}", "Readlink failed: Not a directory"},
       {{}, "{T}/absent/x", "{T}/absent", "Failed to retrieve realpath for base path {T}/absent "},
       // A chain ending in an absolute link is caught by its real path.
-      {{{"{T}/outside"}, {}, {{"second", "first"}, {"{T}/outside", "second"}}},
-       "{B}/first", "{B}",
+      {{"{T}/outside/", "first -> second", "second -> {T}/outside"}, "{B}/first", "{B}",
        "Rejecting {B}/first with base {B} (reals {X}/outside ; {R}) because components diverge at base != outside"},
       // Each link passes the textual check, but "a/sub" is a link to the base,
       // so "a/sub/.." is the directory above it.
-      {{{"a"}, {}, {{"..", "a/sub"}, {"a/sub/..", "escape"}}},
-       "{B}/escape", "{B}",
+      {{"a/", "a/sub -> ..", "escape -> a/sub/.."}, "{B}/escape", "{B}",
        "Rejecting {B}/escape with base {B} because base component count is greater than child component count "
        "(reals {X} ; {R})"},
       // A sibling with the base as text prefix diverges at the last base component.
-      {{{"{B}x"}, {"{B}x/f"}},
-       "{B}x/f", "{B}",
+      {{"{B}x/", "{B}x/f"}, "{B}x/f", "{B}",
        "Rejecting {B}x/f with base {B} (reals {R}x/f ; {R}) because components diverge at base != basex"},
-      {{{}, {"f"}},
-       "{B}/f", "/",
+      {{"f"}, "{B}/f", "/",
        "Rejecting {B}/f with base / because real component counts don't make sense (reals {R}/f ; /)"},
   };
   for (const auto& c : cases) {
@@ -123,15 +116,15 @@ TEST_F(Containment, RejectionsNameTheirReason) {
 
 TEST_F(Containment, AcceptedPathsResolveToTheirRealPlace) {
   const struct {
-    Tree tree;
+    std::vector<std::string> tree;
     std::string suspicious, result, base = "{B}";
   } cases[] = {
-      {{{"sub/e"}, {"sub/f"}, {{"e/../f", "sub/link"}}}, "{B}/sub/link", "{R}/sub/f"},
-      {{{"sub"}, {}, {{"..", "sub/top"}}}, "{B}/sub/top", "{R}"},
-      {{{}, {}, {{"not-yet", "dangling"}}}, "{B}/dangling", "{R}/dangling"},
+      {{"sub/e/", "sub/f", "sub/link -> e/../f"}, "{B}/sub/link", "{R}/sub/f"},
+      {{"sub/", "sub/top -> .."}, "{B}/sub/top", "{R}"},
+      {{"dangling -> not-yet"}, "{B}/dangling", "{R}/dangling"},
       // A missing tail is appended to the real path of what exists.
       {{}, "{B}/new/file", "{R}/new/file"},
-      {{{}, {"f"}}, "/private{B}/f", "{R}/f", "/private{B}"},
+      {{"f"}, "/private{B}/f", "{R}/f", "/private{B}"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.suspicious);
@@ -168,12 +161,14 @@ TEST_F(Containment, RandomTreesNeverLetAPathOut) {
           qstest::writeFile(path, "x");
           break;
         default: {
-          std::string text = rng() % 5 == 0 ? pick(rng() % 2 ? dirs : all) : "";
-          if (text.empty() && rng() % 4 == 0) text = outside + (rng() % 2 ? "/o" : "");
-          for (int p = 0, parts = 1 + rng() % 4; text.empty() && p < parts; ++p) {
-            text += (p ? "/" : "") + std::string(kNames[2 + rng() % 6]);
+          std::string text;
+          const unsigned kind = rng() % 5;
+          if (kind == 0) text = pick(rng() % 2 ? dirs : all);
+          if (kind == 1) text = outside + (rng() % 2 ? "/o" : "");
+          for (unsigned p = 0, parts = kind < 2 ? 0 : 1 + rng() % 4; p < parts; ++p) {
+            text += (p ? "/" : "") + std::string(kNames[rng() % 8]);
           }
-          (void)symlink(text.c_str(), path.c_str());
+          (void)symlink(text.c_str(), path.c_str());  // a collision just leaves fewer links
         }
       }
       all.push_back(path);

@@ -140,21 +140,16 @@ TEST_F(Traversal, UnchangeableItemIsLoggedAndPassedOver) {
   EXPECT_EQ(qstest::lstatOf(root_ + "/other")->st_uid, kUID);
 }
 
-TEST_F(Traversal, LinksAreCreatedOnlyOnFreeNamesAndReadBackUnresolved) {
-  ASSERT_TRUE(qstest::writeFile(root_ + "/taken", "x"));
+TEST_F(Traversal, LinksAreCreatedOnlyOnFreeNamesAndReadBackUnresolvedUpTo1024Bytes) {
   Error error;
   ASSERT_TRUE(fm.createSymbolicLinkAtURL(URL::fileURL(root_ + "/link"), URL::fileURL("sub/../target"), &error));
   EXPECT_EQ(fm.destinationOfSymbolicLinkAtURL(URL::fileURL(root_ + "/link"))->path(), "sub/../target");
-  EXPECT_FALSE(fm.createSymbolicLinkAtURL(URL::fileURL(root_ + "/taken"), URL::fileURL("/dest"), &error));
-  EXPECT_TRUE(error.isPOSIX(EEXIST));
-  EXPECT_EQ(error.localizedDescription(), "Could not create symlink containing /dest at " + root_ + "/taken: File exists");
-  EXPECT_EQ(qstest::readFile(root_ + "/taken"), "x");
-  // Texts are cut to 1024 bytes.
+  EXPECT_FALSE(fm.createSymbolicLinkAtURL(URL::fileURL(root_ + "/link"), URL::fileURL("/dest"), &error));
+  EXPECT_EQ(error.localizedDescription(), "Could not create symlink containing /dest at " + root_ + "/link: File exists");
   qstest::makeSymlink(std::string(1500, 'n'), root_ + "/long");
   EXPECT_EQ(fm.destinationOfSymbolicLinkAtURL(URL::fileURL(root_ + "/long"))->path(), std::string(1024, 'n'));
-  EXPECT_FALSE(fm.destinationOfSymbolicLinkAtURL(URL::fileURL(root_ + "/taken"), &error));
-  EXPECT_TRUE(error.isPOSIX(EINVAL));
-  EXPECT_EQ(error.localizedDescription(), "Could not readlink " + root_ + "/taken : Invalid argument");
+  EXPECT_FALSE(fm.destinationOfSymbolicLinkAtURL(rootURL(), &error));
+  EXPECT_EQ(error.localizedDescription(), "Could not readlink " + root_ + " : Invalid argument");
 }
 
 }  // namespace
