@@ -5,6 +5,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
@@ -250,18 +251,23 @@ class Migration : public EndToEnd {
     EXPECT_TRUE(killedRuns || entriesOf(dir_ / "tmp/com.vantrel.quill.set.migrator").empty());
   }
 
-  // The containers whose migration has started, from what the log gained
-  // since the last call (complete lines only).
-  size_t containersStarted() {
+  // In what the log gained since the last call (complete lines only), counts
+  // the containers whose migration started [0] and the installations begun [1].
+  const std::array<size_t, 2>& logProgress() {
     std::ifstream in(image_ + kDefaultLog, std::ios::binary);
     in.seekg(static_cast<std::streamoff>(logRead_));
     std::string gained{std::istreambuf_iterator<char>(in), {}};
     gained.resize(gained.rfind('\n') + 1);
-    for (size_t at = 0; (at = gained.find("QSAppMigrator: Migrating ", at)) != std::string::npos; ++at) ++started_;
+    for (size_t k = 0; k < seen_.size(); ++k) {
+      for (size_t at = 0; (at = gained.find(kProgressMarks[k], at)) != std::string::npos; ++at) ++seen_[k];
+    }
     logRead_ += gained.size();
-    return started_;
+    return seen_;
   }
-  size_t logRead_ = 0, started_ = 0;
+  static constexpr const char* kProgressMarks[] = {"QSAppMigrator: Migrating ",
+                                                   "QSAppMigrator: Staging and installing app "};
+  size_t logRead_ = 0;
+  std::array<size_t, 2> seen_{};
 };
 
 TEST_F(Migration, ImageOfEveryShapeMigratesAndVerifies) {
@@ -347,23 +353,25 @@ TEST_F(Migration, ContainerThatCannotMoveIsKeptAndASecondRunFinishes) {
 TEST_F(Migration, RunKilledAtRandomPointsFinishesWhenRestarted) {
   createImage({"--apps", "60", "--vpn-only", "3", "--groups", "6", "--harbors", "2", "--placeholders", "2",
                "--builtin-older", "2", "--files-per-app", "4", "--bytes-per-file", "2000", "--seed", "23"});
-  // Each run is killed once a few more containers have started, a moment
-  // later, so that the kills fall anywhere in a container's work.
+  // Each run is killed a few containers further on: on even attempts a
+  // moment later, anywhere in a container's work; on odd ones just after an
+  // installation began, so that the registry's recovery is exercised too.
   std::mt19937 random(23);
-  std::uniform_int_distribution<size_t> containersBeforeKill(1, 8);
-  std::uniform_int_distribution<int> extraDelayUs(0, 40000);
-  constexpr int kKills = 6;
+  std::uniform_int_distribution<size_t> stepsBeforeKill(1, 8);
+  std::uniform_int_distribution<int> containerDelayUs(0, 40000), installDelayUs(0, 6000);
+  constexpr int kKills = 8;
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(3);
   int killed = 0;
   for (int attempt = 0; attempt < kKills; ++attempt) {
-    const size_t target = containersStarted() + containersBeforeKill(random);
+    const int mark = attempt % 2;
+    const size_t target = logProgress()[mark] + stepsBeforeKill(random);
     Process run(transvale(), dir_.path());
-    while (run.running() && containersStarted() < target) {
+    while (run.running() && logProgress()[mark] < target) {
       if (std::chrono::steady_clock::now() > deadline) run.kill();
       std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     ASSERT_LT(std::chrono::steady_clock::now(), deadline) << "a run stopped making progress";
-    std::this_thread::sleep_for(std::chrono::microseconds(extraDelayUs(random)));
+    std::this_thread::sleep_for(std::chrono::microseconds(mark ? installDelayUs(random) : containerDelayUs(random)));
     if (!run.running()) {
       // The run ended before the kill: it must have succeeded.
       EXPECT_EQ(run.exited(), kExitSuccess) << "after " << killed << " kills";
