@@ -4,200 +4,162 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <thread>
 
-#include "Platform/Foundation/Error.h"
 #include "Platform/RegistryFixture.h"
 
 namespace qstest {
 namespace {
 
 using platform::BundleRecord;
-using platform::Dictionary;
 using platform::Error;
 
-class RegistryRecovery : public RegistryTest {
- protected:
-  // Installs `package` in a forked child that kills itself with SIGKILL when
-  // the installation reports `status`. True when the child died that way.
-  bool installKilledAt(const std::string& package, const std::string& identifier, const std::string& status) {
-    pid_t child = fork();
-    if (child == 0) {
-      auto registry = platform::SQLiteApplicationRegistry::open(root());
-      if (!registry) _exit(2);
-      registry->installPackage(
-          platform::URL::fileURL(package, true), customerOptions(identifier),
-          [&](const Dictionary& report) {
-            if (report.at(platform::kRegistryProgressStatusKey).description() == status) {
-              raise(SIGKILL);
-            }
-          },
-          nullptr);
-      _exit(3);  // the installation finished: the kill never came
-    }
-    int status_ = 0;
-    if (child < 0 || waitpid(child, &status_, 0) != child) return false;
-    return WIFSIGNALED(status_) && WTERMSIG(status_) == SIGKILL;
+using RegistryRecovery = RegistryTest;
+
+// Installs `package` in a forked child that kills itself with SIGKILL when
+// the installation reports `status`. True when the child died that way.
+bool installKilledAt(const std::string& root, const std::string& package, const std::string& id, const char* status) {
+  pid_t child = fork();
+  if (child == 0) {
+    auto registry = platform::SQLiteApplicationRegistry::open(root);
+    auto kill = [&](const platform::Dictionary& report) {
+      if (report.at(platform::kRegistryProgressStatusKey).description() == status) raise(SIGKILL);
+    };
+    if (registry) registry->installPackage(platform::URL::fileURL(package, true), customerOptions(id), kill, nullptr);
+    _exit(3);  // the kill never came
   }
-};
-
-TEST_F(RegistryRecovery, KilledBeforeTheCommitIsRolledBackWhenOpened) {
-  std::string package = makePackage("notes", BundleSpec("com.example.notes").withGroups({"group.notes"}),
-                                    BundleSpec("com.example.notes.tunnel"), {"VendraMetadata.plist"});
-  ASSERT_TRUE(installKilledAt(package, "com.example.notes", "RegisteringApplication"));
-  // The files were moved when the process died.
-  EXPECT_FALSE(exists(package + "/Payload/App.app"));
-  EXPECT_EQ(entries(bundleContainers()).size(), 2u);
-
-  LogCapture log;
-  auto registry = openRegistry();
-  EXPECT_TRUE(log.contains("Recovered interrupted installation"));
-  EXPECT_FALSE(registry->isInstalled("com.example.notes"));
-  EXPECT_FALSE(registry->isInstalled("com.example.notes.tunnel"));
-  EXPECT_EQ(readFile(package + "/Payload/App.app/main"), "executable of com.example.notes");
-  EXPECT_TRUE(isDirectory(package + "/Payload/Tunnel.vpnplugin"));
-  EXPECT_EQ(readFile(package + "/VendraMetadata.plist"), "metadata VendraMetadata.plist");
-  EXPECT_TRUE(entries(bundleContainers()).empty());
-  EXPECT_TRUE(entries(appDataContainers()).empty());
-  EXPECT_TRUE(entries(pluginDataContainers()).empty());
-  EXPECT_TRUE(entries(groupContainers()).empty());
-
-  Error error;
-  ASSERT_TRUE(install(*registry, package, "com.example.notes", &error)) << error.description();
-  EXPECT_TRUE(registry->recordForIdentifier("com.example.notes")->foundBackingBundle);
-  EXPECT_TRUE(registry->isInstalled("com.example.notes.tunnel"));
+  int result = 0;
+  return child > 0 && waitpid(child, &result, 0) == child && WIFSIGNALED(result) && WTERMSIG(result) == SIGKILL;
 }
 
-TEST_F(RegistryRecovery, KilledWhileStagingKeepsTheDataContainerOfAReinstall) {
-  ASSERT_TRUE(installApp(*openRegistry(), BundleSpec("com.example.mail").withVersion("1")));
-  std::string data = openRegistry()->recordForIdentifier("com.example.mail")->dataContainerURL->path();
-  ASSERT_TRUE(writeFile(data + "/inbox", "mail"));
-  std::string package = makePackage("v2", BundleSpec("com.example.mail").withVersion("2"));
-  ASSERT_TRUE(installKilledAt(package, "com.example.mail", "StagingFiles"));
+// A reinstall that adds a group, a plug-in and store metadata, killed at each
+// stage: opening the registry again rolls back what was not committed (the
+// package whole again, nothing new left, the old record and its data) or
+// finishes what was (the old container and the package removed), after
+// which the caller's retry succeeds.
+TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpened) {
+  const struct {
+    const char* status;
+    bool journalled, committed;
+  } stages[] = {{"VerifyingApplication", false, false}, {"StagingFiles", true, false},
+                {"RegisteringApplication", true, false}, {"CleaningUp", true, true}, {"Complete", false, true}};
+  for (const auto& stage : stages) {
+    SCOPED_TRACE(stage.status);
+    const std::string id = std::string("com.example.") + stage.status;
+    ASSERT_TRUE(installApp(*openRegistry(), {.identifier = id, .version = "1"}));
+    const BundleRecord old = *openRegistry()->recordForIdentifier(id);
+    ASSERT_TRUE(writeFile(old.dataContainerURL->path() + "/inbox", "mail"));
+    const auto before = allContainers();
+    const std::string package = makePackage(stage.status, {.identifier = id, .version = "2", .groups = {"group." + id}},
+                                            {.identifier = id + ".tunnel"}, {"VendraMetadata.plist"});
+    ASSERT_TRUE(installKilledAt(root_.path(), package, id, stage.status));
 
-  auto registry = openRegistry();
-  BundleRecord record = *registry->recordForIdentifier("com.example.mail");
-  EXPECT_EQ(record.version, "1");
-  EXPECT_TRUE(record.foundBackingBundle);
-  EXPECT_EQ(readFile(data + "/inbox"), "mail");
-  EXPECT_TRUE(isDirectory(package + "/Payload/App.app"));
-  EXPECT_EQ(entries(bundleContainers()).size(), 1u);
+    LogCapture log;
+    auto registry = openRegistry();
+    EXPECT_EQ(log.contains("Recovered interrupted installation"), stage.journalled);
+    BundleRecord record = *registry->recordForIdentifier(id);
+    EXPECT_EQ(record.version, stage.committed ? "2" : "1");
+    EXPECT_TRUE(record.foundBackingBundle);
+    EXPECT_EQ(record.dataContainerURL, old.dataContainerURL);
+    EXPECT_EQ(readFile(old.dataContainerURL->path() + "/inbox"), "mail");
+    EXPECT_EQ(registry->isInstalled(id + ".tunnel"), stage.committed);
+    EXPECT_EQ(exists(package), !stage.committed);
+    Error error;
+    if (!stage.committed) {
+      EXPECT_EQ(readFile(package + "/Payload/App.app/main"), "executable of " + id);
+      EXPECT_EQ(readFile(package + "/VendraMetadata.plist"), "metadata VendraMetadata.plist");
+      EXPECT_EQ(allContainers(), before);
+      ASSERT_TRUE(install(*registry, package, id, &error)) << error.description();
+      EXPECT_TRUE(registry->isInstalled(id + ".tunnel"));
+      continue;
+    }
+    EXPECT_FALSE(exists(old.bundleContainerURL.path()));
+    // Resuming, the caller finds its package gone or stages it again: a
+    // replay, but not from another package or for another identifier.
+    EXPECT_TRUE(install(*registry, package, id, &error)) << error.description();
+    ASSERT_TRUE(makeDirs(package + "/Payload") && makeDirs(at("elsewhere/Payload")));
+    EXPECT_FALSE(install(*registry, at("elsewhere"), id, &error));
+    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage));
+    EXPECT_FALSE(install(*registry, package, "com.example.other", &error));
+    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage));
+    EXPECT_TRUE(install(*registry, package, id, &error)) << error.description();
+    EXPECT_EQ(statuses_.back(), "AlreadyInstalledFromPackage");
+    EXPECT_FALSE(exists(package));
+    EXPECT_EQ(registry->recordForIdentifier(id)->bundleContainerURL, record.bundleContainerURL);
+  }
 }
 
-TEST_F(RegistryRecovery, KilledAfterTheCommitFinishesTheRemovalsWhenOpened) {
-  ASSERT_TRUE(installApp(*openRegistry(), BundleSpec("com.example.mail").withVersion("1")));
-  std::string oldContainer = openRegistry()->recordForIdentifier("com.example.mail")->bundleContainerURL.path();
-  std::string package = makePackage("v2", BundleSpec("com.example.mail").withVersion("2"));
-  ASSERT_TRUE(installKilledAt(package, "com.example.mail", "CleaningUp"));
-  EXPECT_TRUE(exists(oldContainer));
-  EXPECT_TRUE(exists(package));
-
+TEST_F(RegistryRecovery, ReadersSeeWholeRecordsWhileAnotherThreadInstalls) {
   auto registry = openRegistry();
-  BundleRecord record = *registry->recordForIdentifier("com.example.mail");
-  EXPECT_EQ(record.version, "2");
-  EXPECT_TRUE(record.foundBackingBundle);
-  EXPECT_FALSE(exists(oldContainer));
-  EXPECT_FALSE(exists(package));
-  // The caller, resuming, stages again and installs: a replay.
-  ASSERT_TRUE(makeDirs(package + "/Payload"));
-  Error error;
-  EXPECT_TRUE(install(*registry, package, "com.example.mail", &error)) << error.description();
-}
-
-using RegistryConcurrency = RegistryTest;
-
-TEST_F(RegistryConcurrency, ReadersSeeWholeRecordsWhileAnotherThreadInstalls) {
-  auto registry = openRegistry();
-  ASSERT_TRUE(installApp(*registry, BundleSpec("com.example.app").withVersion("0").withGroups({"group.g"})));
-  const std::string data = registry->recordForIdentifier("com.example.app")->dataContainerURL->path();
+  const BundleSpec app{.identifier = "com.example.app", .version = "0", .groups = {"group.g"}};
+  ASSERT_TRUE(installApp(*registry, app));
+  const auto data = registry->recordForIdentifier(app.identifier)->dataContainerURL;
   std::atomic<bool> done{false};
   std::atomic<int> inconsistent{0}, lookups{0};
   std::vector<std::thread> readers;
   for (int i = 0; i < 3; ++i) {
     readers.emplace_back([&] {
-      while (!done) {
-        std::optional<BundleRecord> record = registry->recordForIdentifier("com.example.app");
-        bool whole = record && record->dataContainerURL && record->dataContainerURL->path() == data &&
-                     record->groupContainerURLs && record->groupContainerURLs->size() == 1 &&
-                     record->bundleURL.deletingLastPathComponent() == record->bundleContainerURL &&
-                     registry->isInstalled("com.example.app");
-        if (!whole) ++inconsistent;
-        ++lookups;
+      for (; !done; ++lookups) {
+        std::optional<BundleRecord> r = registry->recordForIdentifier(app.identifier);
+        inconsistent += !(r && r->dataContainerURL == data && r->groupContainerURLs && r->groupContainerURLs->size() == 1 &&
+                          r->bundleURL.deletingLastPathComponent() == r->bundleContainerURL &&
+                          registry->isInstalled(app.identifier));
       }
     });
   }
-  for (const char* v : {"1", "2", "3", "4", "5"}) {
-    EXPECT_TRUE(installApp(*registry, BundleSpec("com.example.app").withVersion(v).withGroups({"group.g"})));
-  }
+  for (const char* v : {"1", "2", "3", "4", "5"}) EXPECT_TRUE(installApp(*registry, {app.identifier, v, app.groups}));
   done = true;
   for (std::thread& reader : readers) reader.join();
   EXPECT_EQ(inconsistent.load(), 0);
   EXPECT_GT(lookups.load(), 0);
-  EXPECT_EQ(registry->recordForIdentifier("com.example.app")->version, "5");
-  EXPECT_EQ(entries(bundleContainers()).size(), 1u);
+  EXPECT_EQ(registry->recordForIdentifier(app.identifier)->version, "5");
+  EXPECT_EQ(entries(bundleContainers()).size(), 1u) << "each reinstall removes the container it replaced";
 }
 
-using RegistryDatabase = RegistryTest;
-
-TEST_F(RegistryDatabase, OpenFailsWhenTheDatabaseDirectoryCannotBeWrittenOrMade) {
-  for (const std::string& locked : {at("private/var/db"), databaseDirectory()}) {
-    ASSERT_TRUE(makeDirs(locked));
-    ASSERT_TRUE(setImmutable(locked, true));
+TEST_F(RegistryRecovery, OpenFailsWhenTheDatabaseDirectoryCannotBeWrittenOrMade) {
+  const std::string database = at("private/var/db/appregistry");
+  for (const std::string& locked : {at("private/var/db"), database}) {
+    ASSERT_TRUE(makeDirs(locked) && setImmutable(locked, true));
     Error error;
-    EXPECT_FALSE(platform::SQLiteApplicationRegistry::open(root(), &error));
+    EXPECT_FALSE(platform::SQLiteApplicationRegistry::open(root_.path(), &error));
     ASSERT_TRUE(setImmutable(locked, false));
     EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorDatabase)) << error.description();
-    if (locked == databaseDirectory()) {
-      EXPECT_NE(error.localizedDescription().find(databaseDirectory()), std::string::npos) << error.description();
+    if (locked == database) {
+      EXPECT_NE(error.localizedDescription().find(database), std::string::npos) << error.description();
     } else {
-      ASSERT_TRUE(error.underlyingError());
-      EXPECT_TRUE(error.underlyingError()->isPOSIX(EPERM)) << error.description();
+      EXPECT_TRUE(error.underlyingError() && error.underlyingError()->isPOSIX(EPERM)) << error.description();
     }
   }
 }
 
-TEST_F(RegistryDatabase, CommitThatCannotBeWrittenLeavesNothingHalfInstalled) {
+// The commit's write fails (the database's log made immutable), then the
+// bundle container cannot be made: each time the package stays whole,
+// nothing is half installed, and a later attempt succeeds.
+TEST_F(RegistryRecovery, CommitOrContainerThatCannotBeWrittenLeavesThePackageWhole) {
   auto registry = openRegistry();
-  std::string wal = databaseDirectory() + "/registry.sqlite-wal";
-  std::string package = makePackage("notes", BundleSpec("com.example.notes"), {}, {"Manifest.plist"});
+  const std::string wal = at("private/var/db/appregistry/registry.sqlite-wal");
+  std::string package = makePackage("notes", {.identifier = "com.example.notes"}, {}, {"Manifest.plist"});
   Error error;
-  bool installed = registry->installPackage(
-      platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
-      [&](const Dictionary& report) {
-        reports_.push_back(report);
-        if (report.at(platform::kRegistryProgressStatusKey).description() == "RegisteringApplication") {
-          EXPECT_TRUE(setImmutable(wal, true));
-        }
-      },
-      &error);
+  auto lockTheLog = [&](const platform::Dictionary& report) {
+    if (report.at(platform::kRegistryProgressStatusKey).description() == "RegisteringApplication") {
+      EXPECT_TRUE(setImmutable(wal, true));
+    }
+  };
+  EXPECT_FALSE(registry->installPackage(platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
+                                        lockTheLog, &error));
   ASSERT_TRUE(setImmutable(wal, false));
-  EXPECT_FALSE(installed);
   EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorDatabase)) << error.description();
-  EXPECT_EQ(reportedError(reports_), "DatabaseError");
-  EXPECT_TRUE(isDirectory(package + "/Payload/App.app"));
-  EXPECT_TRUE(exists(package + "/Manifest.plist"));
-  EXPECT_TRUE(entries(bundleContainers()).empty());
-  EXPECT_TRUE(entries(appDataContainers()).empty());
-  EXPECT_FALSE(registry->isInstalled("com.example.notes"));
 
-  ASSERT_TRUE(install(*registry, package, "com.example.notes", &error)) << error.description();
-  EXPECT_TRUE(registry->isInstalled("com.example.notes"));
-}
-
-TEST_F(RegistryDatabase, ContainerThatCannotBeMadeLeavesThePackageWhole) {
-  auto registry = openRegistry();
-  ASSERT_TRUE(makeDirs(bundleContainers()));
-  ASSERT_TRUE(setImmutable(bundleContainers(), true));
-  std::string package = makePackage("notes", BundleSpec("com.example.notes"));
-  Error error;
+  ASSERT_TRUE(makeDirs(bundleContainers()) && setImmutable(bundleContainers(), true));
   EXPECT_FALSE(install(*registry, package, "com.example.notes", &error));
   ASSERT_TRUE(setImmutable(bundleContainers(), false));
   EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorFileOperation)) << error.description();
   EXPECT_TRUE(error.underlyingError() && error.underlyingError()->isPOSIX(EPERM)) << error.description();
-  EXPECT_EQ(reportedError(reports_), "FileOperationFailed");
-  EXPECT_TRUE(isDirectory(package + "/Payload/App.app"));
-  EXPECT_TRUE(entries(appDataContainers()).empty());
+  EXPECT_EQ(errors_, std::vector<std::string>{"FileOperationFailed"});
+
+  EXPECT_TRUE(isDirectory(package + "/Payload/App.app") && exists(package + "/Manifest.plist"));
+  EXPECT_EQ(allContainers(), (std::vector<std::vector<std::string>>(4)));
   EXPECT_FALSE(registry->isInstalled("com.example.notes"));
+  ASSERT_TRUE(install(*registry, package, "com.example.notes", &error)) << error.description();
 }
 
 }  // namespace
