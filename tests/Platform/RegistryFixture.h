@@ -91,8 +91,9 @@ class RegistryTest : public testing::Test {
   // failing the test when the registry refuses it.
   bool installApp(Registry& registry, const BundleSpec& bundle, const BundleSpec& plugin = {}) {
     platform::Error error;
-    const bool installed = install(
-        registry, makePackage(bundle.identifier + std::to_string(++packages_), bundle, plugin), bundle.identifier, &error);
+    const bool installed =
+        install(registry, makePackage(bundle.identifier + std::to_string(++packages_), bundle, plugin),
+                bundle.identifier, &error);
     EXPECT_TRUE(installed) << error.description();
     return installed;
   }
@@ -112,7 +113,8 @@ class RegistryTest : public testing::Test {
   static std::vector<std::string> entries(const std::string& directory) {
     std::vector<std::string> names;
     std::error_code missing;
-    for (const auto& entry : std::filesystem::directory_iterator(directory, missing)) names.push_back(entry.path().filename());
+    for (const auto& entry : std::filesystem::directory_iterator(directory, missing))
+      names.push_back(entry.path().filename());
     std::sort(names.begin(), names.end());
     return names;
   }

@@ -1,5 +1,6 @@
 // Installing packages, placeholders and built-in applications: containers,
-// records, groups, VPN plug-ins and refusals.
+// records, groups, VPN plug-ins and refusals; the daemon's calls.
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -28,50 +29,34 @@ TEST_F(RegistryInstall, MovesBundleAndPluginIntoNewContainersAndRemovesPackage) 
                                                  "CleaningUp", "Complete"}));
   for (std::thread::id id : reporterThreads_) EXPECT_NE(id, std::this_thread::get_id()) << "from the worker thread";
   EXPECT_FALSE(exists(package));
-
-  std::optional<BundleRecord> app = registry->recordForIdentifier("com.example.vpn");
-  ASSERT_TRUE(app && app->dataContainerURL && app->groupContainerURLs);
-  EXPECT_EQ(app->bundleType, platform::kBundleTypeUser);
-  EXPECT_EQ(app->bundleURL.path(), app->bundleContainerURL.path() + "/App.app");
-  EXPECT_EQ(app->bundleContainerURL.deletingLastPathComponent().path(), bundleContainers());
-  EXPECT_EQ(readFile(app->bundleURL.path() + "/main"), "executable of com.example.vpn");
-  EXPECT_EQ(readFile(app->bundleContainerURL.path() + "/VendraMetadata.plist"), "metadata VendraMetadata.plist");
-  EXPECT_EQ(app->dataContainerURL->deletingLastPathComponent().path(), appDataContainers());
-  EXPECT_TRUE(isDirectory(app->dataContainerURL->path()));
-  EXPECT_TRUE(app->groupContainerURLs->empty()) << "an installed bundle always has a group dictionary";
-
-  std::optional<BundleRecord> plugin = registry->recordForIdentifier("com.example.vpn.tunnel");
-  ASSERT_TRUE(plugin && plugin->dataContainerURL && plugin->groupContainerURLs);
-  EXPECT_EQ(plugin->bundleType, platform::kBundleTypeVPNPlugin);
-  EXPECT_EQ(plugin->bundleURL.lastPathComponent(), "Tunnel.vpnplugin");
-  EXPECT_EQ(plugin->bundleContainerURL.deletingLastPathComponent().path(), bundleContainers());
-  EXPECT_EQ(plugin->dataContainerURL->deletingLastPathComponent().lastPathComponent(), "PluginKitPlugin");
+  for (const char* id : {"com.example.vpn", "com.example.vpn.tunnel"}) {
+    std::optional<BundleRecord> r = registry->recordForIdentifier(id);
+    ASSERT_TRUE(r && r->dataContainerURL && r->groupContainerURLs) << "an installed bundle has a group dictionary";
+    EXPECT_EQ(r->bundleContainerURL.deletingLastPathComponent().path(), bundleContainers());
+    EXPECT_EQ(readFile(r->bundleURL.path() + "/main"), std::string("executable of ") + id);
+    EXPECT_TRUE(isDirectory(r->dataContainerURL->path()));
+    EXPECT_TRUE(r->groupContainerURLs->empty());
+  }
+  BundleRecord app = *registry->recordForIdentifier("com.example.vpn");
+  BundleRecord plugin = *registry->recordForIdentifier("com.example.vpn.tunnel");
+  EXPECT_EQ(app.bundleType, platform::kBundleTypeUser);
+  EXPECT_EQ(app.bundleURL.path(), app.bundleContainerURL.path() + "/App.app");
+  EXPECT_EQ(readFile(app.bundleContainerURL.path() + "/VendraMetadata.plist"), "metadata VendraMetadata.plist");
+  EXPECT_EQ(app.dataContainerURL->deletingLastPathComponent().path(), appDataContainers());
+  EXPECT_EQ(plugin.bundleType, platform::kBundleTypeVPNPlugin);
+  EXPECT_EQ(plugin.bundleURL.lastPathComponent(), "Tunnel.vpnplugin");
+  EXPECT_EQ(plugin.dataContainerURL->deletingLastPathComponent().lastPathComponent(), "PluginKitPlugin");
 }
 
 TEST_F(RegistryInstall, ThrowingProgressCallbackDoesNotStopTheInstallation) {
   auto registry = openRegistry();
   std::string package = makePackage("notes", {.identifier = "com.example.notes"});
   LogCapture log;
-  EXPECT_TRUE(registry->installPackage(platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
-                                       [](const Dictionary&) { throw std::runtime_error("callback failure"); },
-                                       nullptr));
+  EXPECT_TRUE(registry->installPackage(
+      platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
+      [](const Dictionary&) { throw std::runtime_error("callback failure"); }, nullptr));
   EXPECT_EQ(log.count("Progress callback threw on report"), 5u);
   EXPECT_TRUE(registry->isInstalled("com.example.notes"));
-}
-
-TEST_F(RegistryInstall, GroupContainerIsSharedByApplicationsOfTheGroupBuiltInOrNot) {
-  makeBuiltIn("Photos.app", {.identifier = "com.example.photos", .groups = {"group.shared"}});
-  auto registry = openRegistry();
-  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.a", .groups = {"group.shared", "group.a"}}));
-  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.b", .groups = {"group.shared"}}));
-  auto a = *registry->recordForIdentifier("com.example.a")->groupContainerURLs;
-  ASSERT_EQ(a.size(), 2u);
-  EXPECT_EQ(registry->recordForIdentifier("com.example.b")->groupContainerURLs->at("group.shared"), a.at("group.shared"));
-  EXPECT_EQ(registry->recordForIdentifier("com.example.photos")->groupContainerURLs->at("group.shared"),
-            a.at("group.shared"));
-  EXPECT_EQ(a.at("group.a").deletingLastPathComponent().path(), groupContainers());
-  EXPECT_TRUE(isDirectory(a.at("group.shared").path()));
-  EXPECT_EQ(entries(groupContainers()).size(), 2u);
 }
 
 TEST_F(RegistryInstall, OlderOrEqualToBuiltInIsRefusedAndPackageRemovedNewerIsInstalled) {
@@ -94,7 +79,8 @@ TEST_F(RegistryInstall, OlderOrEqualToBuiltInIsRefusedAndPackageRemovedNewerIsIn
 // Any other refusal leaves the package as it was and makes no container.
 TEST_F(RegistryInstall, BadPackagesAreRefusedAndLeftAsTheyWere) {
   const std::string plist = "/Payload/App.app/Info.plist", invalid = "InvalidPackage";
-  const std::string arrayPlist = "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>";
+  const std::string arrayPlist =
+      "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>";
   const struct {
     const char* name;
     std::function<void(const std::string& package)> damage;  // none: the options claim another identifier
@@ -149,73 +135,58 @@ TEST_F(RegistryInstall, BadPackagesAreRefusedAndLeftAsTheyWere) {
   EXPECT_TRUE(exists(package + "/Payload/App.app"));
 }
 
-class RegistryPlaceholder : public RegistryTest {
- protected:
-  // Installs a copy of the bundle at `staged` as the placeholder of `identifier`.
-  bool installPlaceholder(Registry& registry, const std::string& identifier,
-                          const std::optional<Value>& metadata = std::nullopt, Error* error = nullptr,
-                          const std::string& staged = "") {
+// A placeholder is a copy of a staged bundle, installed for the options'
+// identifier (never its Info.plist's), with the store metadata and a data
+// container but no group dictionary. The data container outlives a second
+// placeholder and the real application; a placeholder cannot replace that.
+TEST_F(RegistryInstall, PlaceholderIsACopyWhoseDataContainerOutlivesItsReplacements) {
+  auto registry = openRegistry();
+  TempDir staging("staging");
+  const std::string staged = staging / "Staged.app";
+  makeBundle(staged, {.identifier = "com.example.inner", .groups = {"group.game"}});
+  auto placeholder = [&](const std::string& identifier, std::optional<Value> metadata, const std::string& bundle) {
     Dictionary options{{platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypePlaceholder},
                        {platform::kBundleIdentifierKey, identifier}};
     if (metadata) options[platform::kRegistryStoreMetadataKey] = *metadata;
-    return registry.installBundle(platform::URL::fileURL(staged.empty() ? staged_ : staged, true), options, error);
-  }
-  TempDir staging_{"staging"};
-  const std::string staged_ = staging_ / "Staged.app";
-};
-
-// The identity is the options' identifier, never the Info.plist's.
-TEST_F(RegistryPlaceholder, IsCopiedWithStoreMetadataADataContainerAndNoGroups) {
-  auto registry = openRegistry();
-  makeBundle(staged_, {.identifier = "com.example.inner", .groups = {"group.game"}});
-  Error error;
-  ASSERT_TRUE(installPlaceholder(*registry, "com.example.game", Value(platform::Data{'<', 0, 0xFF}), &error))
-      << error.description();
+    Error error;  // the code in the registry's domain, 0 on success
+    if (registry->installBundle(platform::URL::fileURL(bundle, true), options, &error)) return int64_t{0};
+    return error.is(platform::kRegistryErrorDomain, error.code()) ? error.code() : -1;
+  };
+  ASSERT_EQ(placeholder("com.example.game", Value(platform::Data{'<', 0, 0xFF}), staged), 0);
   EXPECT_FALSE(registry->isInstalled("com.example.inner"));
-  std::optional<BundleRecord> record = registry->recordForIdentifier("com.example.game");
-  ASSERT_TRUE(record && record->dataContainerURL);
-  EXPECT_EQ(record->bundleType, platform::kBundleTypePlaceholder);
-  EXPECT_TRUE(record->isPlaceholder);
-  EXPECT_FALSE(record->groupContainerURLs) << "a placeholder's record has no group dictionary";
-  EXPECT_TRUE(isDirectory(record->dataContainerURL->path()));
-  EXPECT_EQ(record->bundleURL.lastPathComponent(), "Staged.app");
-  EXPECT_EQ(readFile(record->bundleURL.path() + "/Info.plist"), readFile(staged_ + "/Info.plist"));
-  EXPECT_EQ(readFile(record->bundleContainerURL.path() + "/VendraMetadata.plist"), std::string("<\0\xFF", 3));
-  EXPECT_TRUE(isDirectory(staged_)) << "the caller removes its staged directory";
+  const BundleRecord first = *registry->recordForIdentifier("com.example.game");
+  EXPECT_EQ(first.bundleType, platform::kBundleTypePlaceholder);
+  EXPECT_TRUE(first.isPlaceholder);
+  EXPECT_FALSE(first.groupContainerURLs) << "a placeholder's record has no group dictionary";
   EXPECT_TRUE(entries(groupContainers()).empty());
-}
-
-// An anonymous placeholder replaced by another, then by the real
-// application: the data container stays throughout; then a placeholder can
-// no longer replace it.
-TEST_F(RegistryPlaceholder, DataContainerOutlivesReplacementsAndOnlyAPlaceholderIsReplaceable) {
-  auto registry = openRegistry();
-  makeBundle(staged_, {});
-  ASSERT_TRUE(installPlaceholder(*registry, "com.example.game"));
-  BundleRecord first = *registry->recordForIdentifier("com.example.game");
+  EXPECT_EQ(readFile(first.bundleURL.path() + "/Info.plist"), readFile(staged + "/Info.plist"));
+  EXPECT_EQ(readFile(first.bundleContainerURL.path() + "/VendraMetadata.plist"), std::string("<\0\xFF", 3));
+  EXPECT_TRUE(isDirectory(staged)) << "the caller removes its staged directory";
   ASSERT_TRUE(writeFile(first.dataContainerURL->path() + "/save.dat", "level 9"));
-  ASSERT_TRUE(installPlaceholder(*registry, "com.example.game"));
-  BundleRecord second = *registry->recordForIdentifier("com.example.game");
+
+  makeBundle(staged, {});
+  ASSERT_EQ(placeholder("com.example.game", std::nullopt, staged), 0);
+  const BundleRecord second = *registry->recordForIdentifier("com.example.game");
   EXPECT_FALSE(exists(first.bundleContainerURL.path()));
   ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.game", .groups = {"group.game"}}));
-  BundleRecord real = *registry->recordForIdentifier("com.example.game");
+  const BundleRecord real = *registry->recordForIdentifier("com.example.game");
   EXPECT_FALSE(real.isPlaceholder);
   EXPECT_EQ(readFile(real.dataContainerURL->path() + "/save.dat"), "level 9");
   EXPECT_FALSE(exists(second.bundleContainerURL.path()));
   EXPECT_EQ(real.groupContainerURLs->size(), 1u);
 
-  Error error;
-  EXPECT_FALSE(installPlaceholder(*registry, "com.example.game", std::nullopt, &error));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorNotReplaceable)) << error.description();
-  EXPECT_FALSE(installPlaceholder(*registry, "com.example.x", std::nullopt, &error, staging_ / "missing.app"));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage)) << error.description();
-  EXPECT_FALSE(installPlaceholder(*registry, "com.example.x", Value("not data"), &error));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidOptions)) << error.description();
+  EXPECT_EQ(placeholder("com.example.game", std::nullopt, staged), platform::kRegistryErrorNotReplaceable);
+  EXPECT_EQ(placeholder("com.example.x", std::nullopt, staging / "missing.app"),
+            platform::kRegistryErrorInvalidPackage);
+  EXPECT_EQ(placeholder("com.example.x", Value("not data"), staged), platform::kRegistryErrorInvalidOptions);
   EXPECT_EQ(entries(bundleContainers()).size(), 1u);
 }
 
-TEST_F(RegistryInstall, BuiltInGetsADataContainerOnFirstLookupUnlessItHasNoneAndIsSeenWhenAddedLater) {
-  std::string bundle = makeBuiltIn("Weather.app", {.identifier = "com.example.weather", .version = "3"});
+// A built-in application's data container is made on its first lookup
+// (unless it has none) and kept; its group container is the one installed
+// applications of the group share. One added later is seen.
+TEST_F(RegistryInstall, BuiltInGetsItsContainersOnFirstLookupAndIsSeenWhenAddedLater) {
+  makeBuiltIn("Weather.app", {.identifier = "com.example.weather", .version = "3", .groups = {"group.shared"}});
   makeBuiltIn("Settings.app", {.identifier = "com.example.settings", .noDataContainer = true});
   auto registry = openRegistry();
   EXPECT_TRUE(registry->isInstalled("com.example.weather"));
@@ -224,19 +195,81 @@ TEST_F(RegistryInstall, BuiltInGetsADataContainerOnFirstLookupUnlessItHasNoneAnd
   std::optional<BundleRecord> record = registry->recordForIdentifier("com.example.weather");
   ASSERT_TRUE(record && record->dataContainerURL && record->groupContainerURLs);
   EXPECT_EQ(record->bundleType, platform::kBundleTypeSystem);
-  EXPECT_EQ(record->bundleURL.path(), bundle);
+  EXPECT_EQ(record->bundleURL.path(), at("Applications/Weather.app"));
   EXPECT_EQ(record->version, "3");
   EXPECT_TRUE(isDirectory(record->dataContainerURL->path()));
   EXPECT_EQ(openRegistry()->recordForIdentifier("com.example.weather")->dataContainerURL, record->dataContainerURL);
   EXPECT_EQ(entries(appDataContainers()).size(), 1u);
 
+  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.a", .groups = {"group.shared", "group.a"}}));
+  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.b", .groups = {"group.shared"}}));
+  auto a = *registry->recordForIdentifier("com.example.a")->groupContainerURLs;
+  EXPECT_EQ(record->groupContainerURLs->at("group.shared"), a.at("group.shared"));
+  EXPECT_EQ(registry->recordForIdentifier("com.example.b")->groupContainerURLs->at("group.shared"),
+            a.at("group.shared"));
+  EXPECT_EQ(a.at("group.a").deletingLastPathComponent().path(), groupContainers());
+  EXPECT_EQ(entries(groupContainers()).size(), 2u);
+
   makeBuiltIn("Late.app", {.identifier = "com.example.late"});
-  EXPECT_TRUE(registry->isInstalled("com.example.late"));
-  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.a"}));
   std::vector<std::string> all;
   for (const BundleRecord& r : registry->allRecords()) all.push_back(r.identifier);
-  EXPECT_EQ(all, (std::vector<std::string>{"com.example.a", "com.example.late", "com.example.settings",
+  EXPECT_EQ(all, (std::vector<std::string>{"com.example.a", "com.example.b", "com.example.late", "com.example.settings",
                                            "com.example.weather"}));
+}
+
+using RegistryDaemon = RegistryTest;
+
+TEST_F(RegistryDaemon, SafeHarborIsRegisteredOnlyForAnExistingDirectoryAndReplacedByTheNextOne) {
+  auto registry = openRegistry();
+  ASSERT_TRUE(makeDirs(at("harbors/game")) && makeDirs(at("harbors/two")) && writeFile(at("harbors/file"), "x"));
+  LogCapture log;
+  EXPECT_FALSE(
+      registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/missing"), "com.example.a", 2, nullptr));
+  EXPECT_FALSE(registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/file"), "com.example.b", 2, nullptr));
+  EXPECT_TRUE(log.contains("Safe harbor " + at("harbors/missing") + " of com.example.a is not an existing directory"));
+  EXPECT_TRUE(registry->safeHarbors().empty());
+  for (const char* path : {"harbors/game", "harbors/two"}) {
+    EXPECT_TRUE(registry->QuillsetRegisterSafeHarborForContainerType(at(path), "com.example.game", 2, nullptr));
+    std::vector<platform::SafeHarborRecord> harbors = openRegistry()->safeHarbors();
+    ASSERT_EQ(harbors.size(), 1u);
+    EXPECT_EQ(std::tie(harbors[0].identifier, harbors[0].path, harbors[0].containerType),
+              std::make_tuple(std::string("com.example.game"), at(path), 2));
+  }
+}
+
+// The protection class of a directory; -1 when the attribute is missing.
+int32_t protectionClass(const std::string& path) {
+  int32_t value = 0;
+  return getxattr(path.c_str(), platform::kProtectionClassAttributeName, &value, sizeof value) == sizeof value ? value
+                                                                                                               : -1;
+}
+
+// Class three goes on every built-in data container, made when missing; a
+// container that refuses it fails the update but not the others'.
+TEST_F(RegistryDaemon, DataProtectionUpdateSetsClassThreeOnEverySystemDataContainer) {
+  makeBuiltIn("Mail.app", {.identifier = "com.example.mail"});
+  makeBuiltIn("Maps.app", {.identifier = "com.example.maps"});
+  makeBuiltIn("Settings.app", {.identifier = "com.example.settings", .noDataContainer = true});
+  auto registry = openRegistry();
+  std::string mail = registry->recordForIdentifier("com.example.mail")->dataContainerURL->path();
+  const std::string key = platform::kQSUpdateSystemAppDataContainerDataProtection;
+  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({}));
+  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{key, false}}));
+  EXPECT_EQ(protectionClass(mail), -1) << "without the option nothing changes";
+  EXPECT_EQ(entries(appDataContainers()).size(), 1u);
+
+  ASSERT_TRUE(setImmutable(mail, true));
+  LogCapture log;
+  EXPECT_FALSE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{key, true}}));
+  EXPECT_TRUE(log.contains("Could not update the data protection of com.example.mail"));
+  ASSERT_TRUE(setImmutable(mail, false));
+  EXPECT_EQ(protectionClass(mail), -1);
+  std::optional<platform::URL> maps = registry->recordForIdentifier("com.example.maps")->dataContainerURL;
+  ASSERT_TRUE(maps) << "the update makes the containers not looked up yet";
+  EXPECT_EQ(protectionClass(maps->path()), 3) << "the other containers are still updated";
+  ASSERT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{key, true}}));
+  EXPECT_EQ(protectionClass(mail), 3);
+  EXPECT_EQ(entries(appDataContainers()).size(), 2u);
 }
 
 }  // namespace

@@ -40,8 +40,11 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
   const struct {
     const char* status;
     bool journalled, committed;
-  } stages[] = {{"VerifyingApplication", false, false}, {"StagingFiles", true, false},
-                {"RegisteringApplication", true, false}, {"CleaningUp", true, true}, {"Complete", false, true}};
+  } stages[] = {{"VerifyingApplication", false, false},
+                {"StagingFiles", true, false},
+                {"RegisteringApplication", true, false},
+                {"CleaningUp", true, true},
+                {"Complete", false, true}};
   for (const auto& stage : stages) {
     SCOPED_TRACE(stage.status);
     const std::string id = std::string("com.example.") + stage.status;
@@ -100,9 +103,9 @@ TEST_F(RegistryRecovery, ReadersSeeWholeRecordsWhileAnotherThreadInstalls) {
     readers.emplace_back([&] {
       for (; !done; ++lookups) {
         std::optional<BundleRecord> r = registry->recordForIdentifier(app.identifier);
-        inconsistent += !(r && r->dataContainerURL == data && r->groupContainerURLs && r->groupContainerURLs->size() == 1 &&
-                          r->bundleURL.deletingLastPathComponent() == r->bundleContainerURL &&
-                          registry->isInstalled(app.identifier));
+        inconsistent += !(
+            r && r->dataContainerURL == data && r->groupContainerURLs && r->groupContainerURLs->size() == 1 &&
+            r->bundleURL.deletingLastPathComponent() == r->bundleContainerURL && registry->isInstalled(app.identifier));
       }
     });
   }
