@@ -50,11 +50,11 @@ inline void makeBundle(const std::string& path, const BundleSpec& b) {
 class RegistryTest : public testing::Test {
  protected:
   using Registry = platform::SQLiteApplicationRegistry;
-  std::string at(const std::string& relative) const { return root_ / relative; }
+  std::string at(const std::string& relative) const { return base_ + "/" + relative; }
 
   std::unique_ptr<Registry> openRegistry() {
     platform::Error error;
-    auto registry = Registry::open(root_.path(), &error);
+    auto registry = Registry::open(base_, &error);
     EXPECT_TRUE(registry) << error.description();
     return registry;
   }
@@ -122,6 +122,7 @@ class RegistryTest : public testing::Test {
   static bool exists(const std::string& path) { return std::filesystem::exists(std::filesystem::symlink_status(path)); }
 
   TempDir root_{"registry"};
+  std::string base_ = root_.path();  // the system root: the temporary directory unless a test names another
   int packages_ = 0;
 };
 

@@ -54,7 +54,7 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
     const auto before = allContainers();
     const std::string package = makePackage(stage.status, {.identifier = id, .version = "2", .groups = {"group." + id}},
                                             {.identifier = id + ".tunnel"}, {"VendraMetadata.plist"});
-    ASSERT_TRUE(installKilledAt(root_.path(), package, id, stage.status));
+    ASSERT_TRUE(installKilledAt(base_, package, id, stage.status));
 
     LogCapture log;
     auto registry = openRegistry();
@@ -123,7 +123,7 @@ TEST_F(RegistryRecovery, OpenFailsWhenTheDatabaseDirectoryCannotBeWrittenOrMade)
   for (const std::string& locked : {at("private/var/db"), database}) {
     ASSERT_TRUE(makeDirs(locked) && setImmutable(locked, true));
     Error error;
-    EXPECT_FALSE(platform::SQLiteApplicationRegistry::open(root_.path(), &error));
+    EXPECT_FALSE(platform::SQLiteApplicationRegistry::open(base_, &error));
     ASSERT_TRUE(setImmutable(locked, false));
     EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorDatabase)) << error.description();
     if (locked == database) {

@@ -3,54 +3,134 @@
 // and the places of an image's layout as the tests expect them.
 #pragma once
 
+#include <fcntl.h>
+#include <spawn.h>
+#include <sys/wait.h>
+
+#include <openssl/evp.h>
+
+#include <cstdlib>
+#include <filesystem>
 #include <map>
 #include <string>
 #include <vector>
 
+#include <gtest/gtest.h>
+
+#include "Platform/Foundation/PropertyList.h"
 #include "Platform/Foundation/Value.h"
+#include "support/TestSupport.h"
+
+extern char** environ;
 
 namespace tooltest {
+
+namespace fs = std::filesystem;
+using platform::Dictionary;
+using platform::Value;
 
 // Layout of an image under its root, as the programs must produce it.
 inline constexpr char kOldApplications[] = "/private/var/mobile/Applications";
 inline constexpr char kInstallMap[] = "/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist";
-inline constexpr char kDataDirectory[] = "/private/var/quilld/Library/Quillset";
 inline constexpr char kSafeHarborMap[] = "/private/var/quilld/Library/Quillset/SafeHarbor.plist";
 inline constexpr char kLastSystemVersion[] = "/private/var/quilld/Library/Quillset/AppMigratorLastSystemVersion.plist";
 inline constexpr char kSystemVersion[] = "/System/Library/CoreServices/SystemVersion.plist";
-inline constexpr char kSystemApplications[] = "/Applications";
 inline constexpr char kManifest[] = "/devicegen-manifest.plist";
-inline constexpr char kPlaceholderAttribute[] = "user.com.vantrel.quilld.placeholder";
 inline constexpr int kUsageStatus = 64;
 
 struct RunResult {
   int status = -1;  // exit status; -1 when the program did not exit normally
-  std::string out;
-  std::string err;
+  std::string out, err;
 };
 
-// Runs $QS_BUILD_DIR/bin/<program> with `args` and waits for it.
-RunResult runTool(const std::string& program, const std::vector<std::string>& args);
+// Runs $QS_BUILD_DIR/bin/<program> with `args` and waits for it. The output
+// goes to files, which cannot fill up and stall the program.
+inline RunResult runTool(const std::string& program, const std::vector<std::string>& args) {
+  RunResult result;
+  const char* buildDir = std::getenv("QS_BUILD_DIR");
+  if (!buildDir) {
+    ADD_FAILURE() << "QS_BUILD_DIR is not set (run the tests through ctest)";
+    return result;
+  }
+  const std::string path = std::string(buildDir) + "/bin/" + program;
+  std::vector<char*> argv{const_cast<char*>(path.c_str())};
+  for (const auto& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
+  argv.push_back(nullptr);
+  qstest::TempDir output("output");
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, (output / "out").c_str(), O_WRONLY | O_CREAT, 0600);
+  posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, (output / "err").c_str(), O_WRONLY | O_CREAT, 0600);
+  pid_t pid = -1;
+  int status = 0;
+  const int spawned = posix_spawn(&pid, path.c_str(), &actions, nullptr, argv.data(), environ);
+  posix_spawn_file_actions_destroy(&actions);
+  if (spawned != 0) {
+    ADD_FAILURE() << "cannot run " << path;
+    return result;
+  }
+  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+  }
+  result.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  result.out = qstest::readFile(output / "out");
+  result.err = qstest::readFile(output / "err");
+  return result;
+}
 
-struct TreeEntry {
-  enum class Kind { File, Directory, Link, Other } kind = Kind::Other;
-  std::string content;  // file bytes or link text
-  bool operator==(const TreeEntry&) const = default;
-};
-// Every item below `root` (not following links), by path relative to it.
-std::map<std::string, TreeEntry> snapshotTree(const std::string& root);
+// Every item below `root` (not following links) by path relative to it:
+// "d" for a directory, "l" + link text, "f" + file bytes.
+inline std::map<std::string, std::string> snapshotTree(const std::string& root) {
+  std::map<std::string, std::string> tree;
+  std::error_code error;
+  for (fs::recursive_directory_iterator it(root, error), end; !error && it != end; it.increment(error)) {
+    const fs::file_status status = it->symlink_status();
+    tree[it->path().native().substr(root.size() + 1)] =
+        fs::is_directory(status)      ? "d"
+        : fs::is_symlink(status)      ? "l" + fs::read_symlink(it->path()).native()
+        : fs::is_regular_file(status) ? "f" + qstest::readFile(it->path())
+                                      : "?";
+  }
+  if (error) ADD_FAILURE() << "cannot walk " << root << ": " << error.message();
+  return tree;
+}
 
-std::string sha256Hex(const std::string& bytes);
+inline std::string sha256Hex(const std::string& bytes) {
+  unsigned char digest[EVP_MAX_MD_SIZE];
+  unsigned int length = 0;
+  EVP_Digest(bytes.data(), bytes.size(), digest, &length, EVP_sha256(), nullptr);
+  std::string hex;
+  for (unsigned int i = 0; i < length; ++i)
+    hex += {"0123456789abcdef"[digest[i] >> 4], "0123456789abcdef"[digest[i] & 15]};
+  return hex;
+}
+
 // The dictionary in the property list at `path`; an empty one (and a test
 // failure) when it cannot be read.
-platform::Dictionary readDictionary(const std::string& path);
-// Removes `path` and everything below it; true when nothing is left.
-bool removeTree(const std::string& path);
-bool exists(const std::string& path);
-std::vector<std::string> listDirectory(const std::string& path);
-
-// A string Value's text, or "" (for terse lookups in manifests).
-std::string stringAt(const platform::Dictionary& d, const char* key);
-const platform::Array& arrayAt(const platform::Dictionary& d, const char* key);
+inline Dictionary readDictionary(const std::string& path) {
+  platform::Error error;
+  auto dict = platform::plist::readDictionary(platform::URL::fileURL(path), &error);
+  if (!dict) ADD_FAILURE() << "cannot read " << path << ": " << error.description();
+  return dict ? *dict : Dictionary{};
+}
+inline bool exists(const std::string& path) {
+  std::error_code error;
+  return fs::exists(fs::symlink_status(path, error));
+}
+inline std::vector<std::string> listDirectory(const std::string& path) {
+  std::vector<std::string> names;
+  std::error_code missing;
+  for (const auto& entry : fs::directory_iterator(path, missing)) names.push_back(entry.path().filename());
+  return names;
+}
+// A string value's text, or "" (for terse lookups in manifests).
+inline std::string stringAt(const Dictionary& d, const char* key) {
+  auto it = d.find(key);
+  return it != d.end() && it->second.isString() ? *it->second.asString() : std::string();
+}
+inline const platform::Array& arrayAt(const Dictionary& d, const char* key) {
+  static const platform::Array* empty = new platform::Array;
+  auto it = d.find(key);
+  return it != d.end() && it->second.isArray() ? *it->second.asArray() : *empty;
+}
 
 }  // namespace tooltest
