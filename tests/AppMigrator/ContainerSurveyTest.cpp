@@ -2,8 +2,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <filesystem>
-
 #include "FakePlatform.h"
 #include "Shared/FileManager/QSFileManager.h"
 
@@ -14,8 +12,6 @@ using platform::Value;
 namespace qstest {
 namespace {
 
-constexpr char kIntrospect[] = "-[QSAppMigrator _introspectContainer:orderResultEarly:]";
-constexpr char kLoadMarker[] = "-[QSAppMigrator _loadAndValidateMigrationMarkerAtURL:]";
 constexpr char kMarkerName[] = "com.vantrel.quill.set.container_migrator.plist";
 
 class Introspection : public MigratorTest {
@@ -27,69 +23,54 @@ class Introspection : public MigratorTest {
     // Made after creation, which would remove it while empty.
     ASSERT_TRUE(makeDirs(oldApplicationsPath()));
   }
-
-  std::optional<Dictionary> introspect(const std::string& path, bool* flag) {
-    *flag = false;
-    return migrator_->_introspectContainer(URL::fileURL(path, true), flag);
+  // The description, with the early flag in *early (set to `initial` first).
+  std::optional<Dictionary> introspect(const std::string& path, bool* early = nullptr, bool initial = false) {
+    bool flag = initial;
+    auto info = migrator_->_introspectContainer(URL::fileURL(path, true), &flag);
+    if (early) *early = flag;
+    return info;
+  }
+  std::string markerLoadFailedLine(const std::string& markerPath) const {
+    return "QSAppMigrator: Failed to load migration marker file from file://" + markerPath;
   }
 
   std::unique_ptr<QSAppMigrator> migrator_;
 };
 
-TEST_F(Introspection, RegularFileIsRemoved) {
+TEST_F(Introspection, StrayFileIsRemovedAndVanishedEntryIgnored) {
   const std::string file = oldApplicationsPath() + "/stray";
   ASSERT_TRUE(writeFile(file, "x"));
-  bool flag = false;
-  EXPECT_FALSE(introspect(file, &flag).has_value());
+  EXPECT_FALSE(introspect(file).has_value());
   EXPECT_FALSE(pathExists(file));
-  auto lines = hostLines("QSAppMigrator: Found regular file at " + file + " ; removing");
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].level, 3);
-  EXPECT_EQ(lines[0].function, kIntrospect);
-}
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Found regular file at " + file + " ; removing"));
 
-TEST_F(Introspection, VanishedEntryIsIgnored) {
   const std::string gone = oldApplicationsPath() + "/gone";
-  bool flag = false;
-  EXPECT_FALSE(introspect(gone, &flag).has_value());
-  auto lines =
-      hostLines("QSAppMigrator: Got ENOENT when introspecting " + gone + " ; ignoring (likely raced with quilld)");
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].level, 5);
+  EXPECT_FALSE(introspect(gone).has_value());
+  EXPECT_TRUE(
+      loggedOnce("QSAppMigrator: Got ENOENT when introspecting " + gone + " ; ignoring (likely raced with quilld)"));
 }
 
-TEST_F(Introspection, UnreadableEntryIsLeftInPlace) {
-  const std::string container = makeContainer("locked");
-  makeBundle(container + "/a.app", "com.example.a");
-  ASSERT_EQ(chmod(container.c_str(), 0700), 0);
+TEST_F(Introspection, ContainerThatCannotBeLookedIntoIsLeftInPlace) {
+  // Unlistable (no read permission), and listable but not searchable, so that
+  // the status of a child cannot be read.
+  const std::string locked = makeBundleContainer("locked", "com.example.a");
+  const std::string unsearchable = makeBundleContainer("unsearchable", "com.example.b");
+  ASSERT_EQ(chmod(locked.c_str(), 0700), 0);
+  ASSERT_EQ(chmod(unsearchable.c_str(), 0744), 0);
   const int status = runAsNobody([&] {
-    bool flag = false;
     log_->clear();
-    if (introspect(container, &flag).has_value()) return 1;
-    return hostMessagesStartingWith("QSAppMigrator: Failed to get URLs in container " + container +
-                                    " : Error Domain=POSIXErrorDomain Code=13 ")
-                       .size() == 1
+    if (introspect(locked) || introspect(unsearchable)) return 1;
+    if (!loggedOnce(
+            "QSAppMigrator: Failed to get URLs in container " + locked + " : Error Domain=POSIXErrorDomain Code=13 ",
+            true))
+      return 2;
+    return loggedOnce("QSAppMigrator: Failed to stat path " + unsearchable + "/com.example.b.app : Permission denied")
                ? 0
-               : 2;
+               : 3;
   });
   EXPECT_EQ(status, 0);
-  EXPECT_TRUE(pathExists(container + "/a.app"));
-}
-
-TEST_F(Introspection, ChildWhoseStatusCannotBeReadLeavesContainerInPlace) {
-  // Readable but not searchable: the listing works, the status of a child does not.
-  const std::string container = makeContainer("unsearchable");
-  makeBundle(container + "/a.app", "com.example.a");
-  ASSERT_EQ(chmod(container.c_str(), 0744), 0);
-  const int status = runAsNobody([&] {
-    bool flag = false;
-    log_->clear();
-    if (introspect(container, &flag).has_value()) return 1;
-    return hostLineCount("QSAppMigrator: Failed to stat path " + container + "/a.app : Permission denied") == 1 ? 0
-                                                                                                              : 2;
-  });
-  EXPECT_EQ(status, 0);
-  EXPECT_TRUE(pathExists(container + "/a.app"));
+  EXPECT_TRUE(pathExists(locked + "/com.example.a.app"));
+  EXPECT_TRUE(pathExists(unsearchable + "/com.example.b.app"));
 }
 
 TEST_F(Introspection, ApplicationAndVPNPluginInEitherListingOrder) {
@@ -101,216 +82,116 @@ TEST_F(Introspection, ApplicationAndVPNPluginInEitherListingOrder) {
     const std::string plugin = container + "/Tunnel" + std::to_string(i) + ".vpnplugin";
     makeBundle(application, "com.example.main");
     makeBundle(plugin, "com.example.tunnel");
-    auto children = QSFileManager::defaultManager().urlsForItemsInDirectoryAtURL(URL::fileURL(container, true), false);
-    ASSERT_TRUE(children.has_value());
-    for (const URL& child : *children) {
+    const auto children = QSFileManager::defaultManager().urlsForItemsInDirectoryAtURL(URL::fileURL(container), false);
+    for (const URL& child : children.value()) {
       if (child.pathExtension() == "app" || child.pathExtension() == "vpnplugin") {
         (child.pathExtension() == "app" ? sawApplicationFirst : sawPluginFirst) = true;
         break;
       }
     }
-
-    bool flag = false;
-    auto info = introspect(container, &flag);
-    ASSERT_TRUE(info.has_value());
-    EXPECT_TRUE(flag);
-    EXPECT_EQ(*info, containerInfo(container, application, "com.example.main", "App", plugin));
+    bool early = false;
+    EXPECT_EQ(introspect(container, &early), containerInfo(container, application, "com.example.main", "App", plugin));
+    EXPECT_TRUE(early);
   }
   EXPECT_TRUE(sawApplicationFirst && sawPluginFirst) << "the directory gave only one order";
 }
 
-TEST_F(Introspection, VPNPluginAloneGoesLate) {
-  const std::string container = makeContainer("vpn");
-  makeBundle(container + "/Tunnel.vpnplugin", "com.example.tunnel");
-  makeBundle(container + "/Documents", "");
-  bool flag = true;
-  auto info = migrator_->_introspectContainer(URL::fileURL(container, true), &flag);
-  ASSERT_TRUE(info.has_value());
-  EXPECT_FALSE(flag);
-  EXPECT_EQ(*info, containerInfo(container, container + "/Tunnel.vpnplugin", "com.example.tunnel", "VPNBundle"));
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Found vpn plugin " + container + "/Tunnel.vpnplugin"), 1u);
+TEST_F(Introspection, VPNPluginAloneGoesLateAndAnUnopenableOneIsPassedOver) {
+  const std::string vpn = makeBundleContainer("vpn", "com.example.tunnel", "vpnplugin");
+  ASSERT_TRUE(makeDirs(vpn + "/Documents"));
+  bool early = true;
+  EXPECT_EQ(introspect(vpn, &early, true),
+            containerInfo(vpn, vpn + "/com.example.tunnel.vpnplugin", "com.example.tunnel", "VPNBundle"));
+  EXPECT_FALSE(early);
+
+  const std::string both = makeBundleContainer("both", "com.example.main");
+  makeBundle(both + "/Tunnel.vpnplugin", "com.example.tunnel");
+  platform_->bundleReader.unopenable = {both + "/Tunnel.vpnplugin"};
+  EXPECT_EQ(introspect(both), containerInfo(both, both + "/com.example.main.app", "com.example.main", "App"));
 }
 
-TEST_F(Introspection, ApplicationWithoutIdentifierLeavesNoBundleAndContainerIsRemoved) {
-  const std::string container = makeContainer("noid");
-  makeBundle(container + "/Main.app", "");
-  ASSERT_TRUE(makeDirs(container + "/Documents"));
-  bool flag = false;
-  EXPECT_FALSE(introspect(container, &flag).has_value());
-  EXPECT_FALSE(flag);
-  EXPECT_FALSE(pathExists(container));
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Found app " + container + "/Main.app"), 1u);
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Could not get identifier for bundle at " + container + "/Main.app"), 1u);
-  EXPECT_EQ(hostLineCount("QSAppMigrator: No app or vpn bundle found in container " + container + " ; removing it"),
-            1u);
+TEST_F(Introspection, ContainerWithoutUsableBundleIsRemoved) {
+  // An application without identifier, and an extension in capitals.
+  const std::string noIdentifier = makeContainer("noid");
+  makeBundle(noIdentifier + "/Main.app", "");
+  ASSERT_TRUE(makeDirs(noIdentifier + "/Documents"));
+  const std::string capitals = makeContainer("caps");
+  makeBundle(capitals + "/Main.APP", "com.example.main");
+  for (const std::string& container : {noIdentifier, capitals}) {
+    bool early = false;
+    EXPECT_FALSE(introspect(container, &early).has_value()) << container;
+    EXPECT_FALSE(early);
+    EXPECT_FALSE(pathExists(container)) << container;
+    EXPECT_TRUE(loggedOnce("QSAppMigrator: No app or vpn bundle found in container " + container + " ; removing it"));
+  }
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Could not get identifier for bundle at " + noIdentifier + "/Main.app"));
 }
 
-TEST_F(Introspection, UnopenableVPNPluginIsPassedOverSilently) {
-  const std::string container = makeContainer("vpn");
-  makeBundle(container + "/Main.app", "com.example.main");
-  makeBundle(container + "/Tunnel.vpnplugin", "com.example.tunnel");
-  platform_->bundleReader.unopenable = {container + "/Tunnel.vpnplugin"};
-  bool flag = false;
-  auto info = introspect(container, &flag);
-  ASSERT_TRUE(info.has_value());
-  EXPECT_EQ(*info, containerInfo(container, container + "/Main.app", "com.example.main", "App"));
-  EXPECT_TRUE(hostMessagesStartingWith("QSAppMigrator: Could not").empty());
-}
-
-TEST_F(Introspection, ContainerWithOnlyDataIsRemoved) {
-  const std::string container = makeContainer("data");
-  for (const char* name : {"Documents", "Library", "tmp"}) ASSERT_TRUE(makeDirs(container + "/" + name));
-  ASSERT_TRUE(writeFile(container + "/Documents/precious", "x"));
-  bool flag = false;
-  EXPECT_FALSE(introspect(container, &flag).has_value());
-  EXPECT_FALSE(pathExists(container));
-  auto lines = hostLines("QSAppMigrator: No app or vpn bundle found in container " + container + " ; removing it");
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].level, 3);
-}
-
-TEST_F(Introspection, ExtensionInCapitalsIsNoBundle) {
-  const std::string container = makeContainer("caps");
-  makeBundle(container + "/Main.APP", "com.example.main");
-  bool flag = false;
-  EXPECT_FALSE(introspect(container, &flag).has_value());
-  EXPECT_FALSE(pathExists(container));
-}
-
-TEST_F(Introspection, SymbolicLinkedApplicationLeavesContainerUntouched) {
-  const std::string container = makeContainer("link");
-  makeBundle(scratch_->path() + "/Real.app", "com.example.real");
-  ASSERT_EQ(symlink((scratch_->path() + "/Real.app").c_str(), (container + "/Main.app").c_str()), 0);
-  bool flag = false;
-  EXPECT_FALSE(introspect(container, &flag).has_value());
-  EXPECT_TRUE(pathExists(container + "/Main.app"));
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Skipping container with app symlink at " + container + "/Main.app"), 1u);
-}
-
-TEST_F(Introspection, SymbolicLinkedVPNPluginLeavesContainerUntouched) {
-  const std::string container = makeContainer("link");
-  ASSERT_EQ(symlink("/nowhere", (container + "/Tunnel.vpnplugin").c_str()), 0);
-  bool flag = false;
-  EXPECT_FALSE(introspect(container, &flag).has_value());
-  EXPECT_TRUE(pathExists(container + "/Tunnel.vpnplugin"));
-  EXPECT_EQ(hostLineCount("QSAppMigrator: VPN plugin was symlink; skipping container " + container +
-                          "/Tunnel.vpnplugin"),
-            1u);
-}
-
-TEST_F(Introspection, SymbolicLinkedMarkerLeavesContainerUntouched) {
-  const std::string container = makeContainer("link");
-  makeBundle(container + "/Main.app", "com.example.main");
-  ASSERT_EQ(symlink("/nowhere", (container + "/" + kMarkerName).c_str()), 0);
-  bool flag = false;
-  EXPECT_FALSE(introspect(container, &flag).has_value());
-  EXPECT_TRUE(pathExists(container + "/Main.app"));
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Found migration marker " + container + "/" + kMarkerName), 1u);
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Migration marker was symlink; skipping container " + container + "/" +
-                          kMarkerName),
-            1u);
-}
-
-TEST_F(Introspection, ValidMarkerWinsOverTheChildrenAndIsReturnedAsRecorded) {
-  const std::string container = makeContainer("marked");
-  makeBundle(container + "/Main.app", "com.example.main");
-  // Recorded elsewhere on purpose: the marker's paths are passed on unchanged.
-  Dictionary marker = containerInfo("/recorded/container", "/recorded/Tunnel.vpnplugin", "com.example.recorded",
-                                    "VPNBundle");
-  marker["Extra"] = Value(7);
-  writePlist(container + "/" + kMarkerName, Value(marker));
-  bool flag = false;
-  auto info = introspect(container, &flag);
-  ASSERT_TRUE(info.has_value());
-  EXPECT_EQ(*info, marker);
-  EXPECT_FALSE(flag);
-}
-
-TEST_F(Introspection, ValidApplicationMarkerGoesEarly) {
-  const std::string container = makeContainer("marked");
-  const Dictionary marker = containerInfo(container, container + "/Main.app", "com.example.main", "App");
-  writePlist(container + "/" + kMarkerName, Value(marker));
-  bool flag = false;
-  auto info = introspect(container, &flag);
-  ASSERT_TRUE(info.has_value());
-  EXPECT_EQ(*info, marker);
-  EXPECT_TRUE(flag);
-}
-
-TEST_F(Introspection, MarkerWithNumericSecondBundlePathIsInvalidAndChildrenDecide) {
-  const std::string container = makeContainer("marked");
-  makeBundle(container + "/Main.app", "com.example.main");
-  Dictionary marker = containerInfo("/elsewhere", "/elsewhere/Other.app", "com.example.other", "App");
-  marker["SecondBundlePath"] = Value(5);
-  const std::string markerPath = container + "/" + kMarkerName;
-  writePlist(markerPath, Value(marker));
-  bool flag = false;
-  auto info = introspect(container, &flag);
-  ASSERT_TRUE(info.has_value());
-  EXPECT_EQ(*info, containerInfo(container, container + "/Main.app", "com.example.main", "App"));
-  EXPECT_TRUE(flag);
-  auto specific = hostLines("QSAppMigrator: Second bundle path was not a string: 5");
-  ASSERT_EQ(specific.size(), 1u);
-  EXPECT_EQ(specific[0].function, kLoadMarker);
-  auto general = hostLines("QSAppMigrator: Failed to load migration marker file from file://" + markerPath);
-  ASSERT_EQ(general.size(), 1u);
-  EXPECT_EQ(general[0].function, kIntrospect);
-}
-
-TEST_F(Introspection, InvalidMarkerInContainerWithoutBundlesStillRemovesIt) {
-  const std::string container = makeContainer("marked");
-  ASSERT_TRUE(writeFile(container + "/" + kMarkerName, "garbage"));
-  bool flag = false;
-  EXPECT_FALSE(introspect(container, &flag).has_value());
-  EXPECT_FALSE(pathExists(container));
-  // Once from the loader, once from introspection.
-  EXPECT_EQ(hostLineCount("QSAppMigrator: Failed to load migration marker file from file://" + container + "/" +
-                          kMarkerName),
-            2u);
-}
-
-// Each required key of a marker, removed or given a non-string value, fails
-// validation with its own line; earlier keys are checked first.
-TEST_F(Introspection, MarkerValidationChecksEachKeyInOrder) {
-  const std::string markerPath = scratch_->path() + "/" + kMarkerName;
-  const std::vector<std::pair<std::string, std::string>> checks = {
-      {"BundlePath", "QSAppMigrator: Failed to get bundle path from migration marker file "},
-      {"ContainerType", "QSAppMigrator: Failed to get container type from migration marker file "},
-      {"ContainerPath", "QSAppMigrator: Failed to get container path from migration marker file "},
-      {"BundleIdentifier", "QSAppMigrator: Failed to get container bundle ID from migration marker file "},
+TEST_F(Introspection, SymbolicLinkedBundleOrMarkerLeavesContainerUntouched) {
+  const std::pair<std::string, std::string> cases[] = {
+      {"Main.app", "QSAppMigrator: Skipping container with app symlink at "},
+      {"Tunnel.vpnplugin", "QSAppMigrator: VPN plugin was symlink; skipping container "},
+      {kMarkerName, "QSAppMigrator: Migration marker was symlink; skipping container "},
   };
-  for (size_t i = 0; i < checks.size(); ++i) {
-    for (bool remove : {true, false}) {
-      Dictionary marker = containerInfo("/c", "/c/a.app", "com.example.a", "App");
-      if (remove) {
-        marker.erase(checks[i].first);
-      } else {
-        marker[checks[i].first] = Value(1);
-      }
-      // Later keys broken too: only the first broken one is reported.
-      for (size_t j = i + 1; j < checks.size(); ++j) marker.erase(checks[j].first);
-      writePlist(markerPath, Value(marker));
-      log_->clear();
-      EXPECT_FALSE(migrator_->_loadAndValidateMigrationMarkerAtURL(URL::fileURL(markerPath)).has_value());
-      EXPECT_EQ(log_->hostMessages(), std::vector<std::string>{checks[i].second + markerPath}) << checks[i].first;
-    }
+  makeBundle(scratch_->path() + "/Real.app", "com.example.real");
+  for (const auto& [name, line] : cases) {
+    const std::string container = makeContainer("link-" + name);
+    ASSERT_TRUE(makeDirs(container + "/Documents"));
+    ASSERT_EQ(symlink((scratch_->path() + "/Real.app").c_str(), (container + "/" + name).c_str()), 0);
+    EXPECT_FALSE(introspect(container).has_value()) << name;
+    EXPECT_TRUE(pathExists(container + "/" + name));
+    EXPECT_TRUE(pathExists(container + "/Documents"));
+    EXPECT_TRUE(loggedOnce(line + container + "/" + name));
   }
 }
 
-TEST_F(Introspection, MarkerThatIsNoDictionaryFailsToLoad) {
-  const std::string markerPath = scratch_->path() + "/" + kMarkerName;
-  writePlist(markerPath, Value(platform::makeStringArray({"a"})));
-  EXPECT_FALSE(migrator_->_loadAndValidateMigrationMarkerAtURL(URL::fileURL(markerPath)).has_value());
-  EXPECT_EQ(log_->hostMessages(),
-            std::vector<std::string>{"QSAppMigrator: Failed to load migration marker file from file://" + markerPath});
+TEST_F(Introspection, ValidMarkerWinsOverTheChildrenAndIsReturnedAsRecorded) {
+  // Recorded elsewhere on purpose: the marker's paths are passed on unchanged.
+  const std::string vpn = makeBundleContainer("vpn", "com.example.main");
+  Dictionary marker =
+      containerInfo("/recorded/container", "/recorded/Tunnel.vpnplugin", "com.example.recorded", "VPNBundle");
+  marker["Extra"] = Value(7);
+  writePlist(vpn + "/" + kMarkerName, Value(marker));
+  bool early = true;
+  EXPECT_EQ(introspect(vpn, &early, true), marker);
+  EXPECT_FALSE(early);
+
+  // The bundle already left this one; its marker still says it is an application's.
+  const std::string app = makeContainer("app");
+  const Dictionary appMarker = containerInfo(app, app + "/Main.app", "com.example.main", "App");
+  writePlist(app + "/" + kMarkerName, Value(appMarker));
+  EXPECT_EQ(introspect(app, &early), appMarker);
+  EXPECT_TRUE(early);
 }
 
-TEST_F(Introspection, BundleIdentifierComesFromTheBundleReader) {
-  makeBundle(scratch_->path() + "/A.app", "com.example.a");
-  EXPECT_EQ(migrator_->_bundleIdentifierForBundle(URL::fileURL(scratch_->path() + "/A.app", true)), "com.example.a");
-  EXPECT_FALSE(migrator_->_bundleIdentifierForBundle(URL::fileURL(scratch_->path() + "/missing.app", true)));
-  platform_->bundleReader.unopenable = {scratch_->path() + "/A.app"};
-  EXPECT_FALSE(migrator_->_bundleIdentifierForBundle(URL::fileURL(scratch_->path() + "/A.app", true)));
+TEST_F(Introspection, InvalidMarkerLeavesTheDecisionToTheChildren) {
+  const std::string container = makeBundleContainer("marked", "com.example.main");
+  Dictionary marker = containerInfo("/elsewhere", "/elsewhere/Other.app", "com.example.other", "App");
+  marker["SecondBundlePath"] = Value(5);
+  writePlist(container + "/" + kMarkerName, Value(marker));
+  EXPECT_EQ(introspect(container),
+            containerInfo(container, container + "/com.example.main.app", "com.example.main", "App"));
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Second bundle path was not a string: 5"));
+  EXPECT_TRUE(loggedOnce(markerLoadFailedLine(container + "/" + kMarkerName)));
+
+  // Unreadable, in a container without bundles: removed like any other.
+  const std::string garbage = makeContainer("garbage");
+  ASSERT_TRUE(writeFile(garbage + "/" + kMarkerName, "garbage"));
+  EXPECT_FALSE(introspect(garbage).has_value());
+  EXPECT_FALSE(pathExists(garbage));
+  // Once from the loader, once from introspection.
+  EXPECT_EQ(hostMessagesStartingWith(markerLoadFailedLine(garbage + "/" + kMarkerName)).size(), 2u);
+}
+
+TEST_F(Introspection, MarkerValidationRequiresEveryKeyAsAString) {
+  const std::string markerPath = scratch_->path() + "/" + kMarkerName;
+  Dictionary marker = containerInfo("/c", "/c/a.app", "com.example.a", "App");
+  marker["BundleIdentifier"] = Value(1);
+  writePlist(markerPath, Value(marker));
+  EXPECT_FALSE(migrator_->_loadAndValidateMigrationMarkerAtURL(URL::fileURL(markerPath)).has_value());
+  EXPECT_EQ(log_->hostMessages(),
+            std::vector<std::string>{"QSAppMigrator: Failed to get container bundle ID from migration marker file " +
+                                     markerPath});
 }
 
 }  // namespace
