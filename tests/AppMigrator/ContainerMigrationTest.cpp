@@ -37,9 +37,6 @@ class ContainerMigration : public MigratorTest {
     EXPECT_EQ(readPlist(container_ + "/" + kMarker), info);
   }
   std::string dataPath() const { return platform_->registry.dataContainerPath(kIdentifier); }
-  void writeGroupMap(const Dictionary& groups) {
-    writePlist(oldInstallMapPath(), Value(Dictionary{{"GroupContainers", Value(groups)}}));
-  }
 
   std::string container_;
   std::string bundle_;
@@ -49,7 +46,8 @@ class ContainerMigration : public MigratorTest {
 TEST_F(ContainerMigration, NewApplicationGetsPlaceholderThenDataThenBundleThenGroups) {
   const std::string oldGroup = scratch_->path() + "/OldGroups/group.notes";
   ASSERT_TRUE(makeDirs(oldGroup) && writeFile(oldGroup + "/shared", "s"));
-  writeGroupMap(Dictionary{{"group.notes", Value(Dictionary{{"Container", Value(oldGroup)}})}});
+  writeInstallMap(Dictionary{
+      {"GroupContainers", Value(Dictionary{{"group.notes", Value(Dictionary{{"Container", Value(oldGroup)}})}})}});
   platform_->registry.groupsOf[kIdentifier] = {"group.notes"};
 
   ASSERT_TRUE(migrate());
@@ -64,14 +62,6 @@ TEST_F(ContainerMigration, NewApplicationGetsPlaceholderThenDataThenBundleThenGr
   EXPECT_FALSE(record.isPlaceholder);
   EXPECT_TRUE(pathExists(record.bundleURL.path() + "/Info.plist"));
   EXPECT_EQ(readFile(record.groupContainerURLs->at("group.notes").path() + "/shared"), "s");
-}
-
-TEST_F(ContainerMigration, InstalledApplicationSkipsThePlaceholder) {
-  platform_->registry.addInstalledApplication(kIdentifier);
-  ASSERT_TRUE(migrate());
-  EXPECT_EQ(log_->hostMessages().at(0),
-            "QSAppMigrator: App com.example.notes is already installed, so not creating placeholder.");
-  for (const auto& call : platform_->registry.installCalls) EXPECT_NE(call.call, "installBundle");
 }
 
 TEST_F(ContainerMigration, FailedPlaceholderKeepsContainerWithMarker) {
@@ -128,7 +118,7 @@ TEST_F(ContainerMigration, FailedStagingAfterDataMovedStillRemovesContainer) {
 }
 
 TEST_F(ContainerMigration, FailedGroupMigrationKeepsContainerWithMarker) {
-  writeGroupMap(Dictionary{{"group.x", Value(Dictionary{})}});
+  writeInstallMap(Dictionary{{"GroupContainers", Value(Dictionary{{"group.x", Value(Dictionary{})}})}});
   platform_->registry.addInstalledApplication(kIdentifier);
   // After the installation the record loses its group-container dictionary.
   int lookups = 0;

@@ -85,20 +85,16 @@ class FakeApplicationRegistry final : public platform::ApplicationRegistry {
 
 class FakeInstallationDaemon final : public platform::InstallationDaemonClient {
  public:
-  struct SafeHarborCall {
-    std::string path;
-    std::string identifier;
-    int containerType = 0;
-    bool optionsWereNull = false;
-  };
   std::set<std::string> refuseSafeHarborOf;  // knob
   bool dataProtectionUpdateSucceeds = true;  // knob
-  std::vector<SafeHarborCall> safeHarborCalls;
+  // "<identifier> <path> <container type>", with " options" when options were given.
+  std::vector<std::string> safeHarborCalls;
   std::vector<platform::Dictionary> dataProtectionCalls;
 
   bool QuillsetRegisterSafeHarborForContainerType(const std::string& path, const std::string& identifier,
                                                   int containerType, const platform::Value* options) override {
-    safeHarborCalls.push_back({path, identifier, containerType, options == nullptr});
+    safeHarborCalls.push_back(identifier + " " + path + " " + std::to_string(containerType) +
+                              (options ? " options" : ""));
     return refuseSafeHarborOf.count(identifier) == 0;
   }
   bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const platform::Dictionary& options) override {
@@ -117,12 +113,10 @@ class FakeSystemVersionSource final : public platform::SystemVersionSource {
 // directory path) it is told to fail.
 class FaultyBundleReader final : public platform::BundleReader {
  public:
-  std::set<std::string> unopenable;                  // openBundle yields null
-  std::set<std::string> noInfoDictionary;            // infoDictionary yields none
-  std::function<void(const platform::URL&)> onOpen;  // called first in every openBundle
+  std::set<std::string> unopenable;        // openBundle yields null
+  std::set<std::string> noInfoDictionary;  // infoDictionary yields none
 
   std::shared_ptr<platform::Bundle> openBundle(const platform::URL& url) override {
-    if (onOpen) onOpen(url);
     return unopenable.count(url.path()) ? nullptr : inner_.openBundle(url);
   }
   std::optional<platform::Dictionary> infoDictionary(const platform::Bundle& bundle) override {
@@ -138,17 +132,6 @@ class FaultyBundleReader final : public platform::BundleReader {
   platform::FileBundleReader inner_;
 };
 
-// An icon renderer that draws a plain opaque square.
-class FakeIconRenderer final : public platform::IconRenderer {
- public:
-  std::optional<platform::Image> homeScreenIconForBundle(const platform::Bundle&) override {
-    platform::Image image;
-    image.width = image.height = platform::kHomeScreenIconSize;
-    image.rgba.assign(static_cast<size_t>(image.width) * image.height * 4, 0xff);
-    return image;
-  }
-};
-
 // The real PNG encoding, or a failure to create the encoder or to finalize it.
 class FaultyImageEncoding final : public platform::ImageEncoding {
  public:
@@ -161,8 +144,9 @@ class FaultyImageEncoding final : public platform::ImageEncoding {
   platform::PNGImageEncoding inner_;
 };
 
-// Every fake together. `root` is a directory of the test's: containers go
-// under root/containers, the temporary directory is root/tmp.
+// Every fake together, and the real icon renderer. `root` is a directory of
+// the test's: containers go under root/containers, the temporary directory is
+// root/tmp.
 struct FakePlatform {
   explicit FakePlatform(const std::string& root);
   QSMigratorServices services();
@@ -170,7 +154,7 @@ struct FakePlatform {
   FakeApplicationRegistry registry;
   FakeInstallationDaemon daemon;
   FaultyBundleReader bundleReader;
-  FakeIconRenderer iconRenderer;
+  platform::CairoIconRenderer iconRenderer;
   FaultyImageEncoding imageEncoding;
   FakeSystemVersionSource systemVersion;
   const std::string temporaryDirectory;
@@ -197,6 +181,9 @@ class MigratorTest : public testing::Test {
   std::string makeBundleContainer(const std::string& name, const std::string& identifier,
                                   const std::string& extension = "app");
   void writePlist(const std::string& path, const platform::Value& value);  // XML; fails the test when it cannot
+  static std::string versionRecordPath() { return dataDirectoryPath() + "/AppMigratorLastSystemVersion.plist"; }
+  static std::string harborMapPath() { return dataDirectoryPath() + "/SafeHarbor.plist"; }
+  void writeInstallMap(const platform::Dictionary& map = {}) { writePlist(oldInstallMapPath(), platform::Value(map)); }
   static std::optional<platform::Dictionary> readPlist(const std::string& path) {
     return platform::plist::readDictionary(platform::URL::fileURL(path));
   }

@@ -32,15 +32,12 @@ class GroupContainerMigration : public MigratorTest {
   }
   // Creates the migrator with groupMap_ and installs `identifier` with these groups.
   void createAndInstall(const std::string& identifier, const std::vector<std::string>& groups) {
-    writePlist(oldInstallMapPath(), Value(Dictionary{{"GroupContainers", Value(groupMap_)}}));
+    writeInstallMap(Dictionary{{"GroupContainers", Value(groupMap_)}});
     migrator_ = createMigrator();
     ASSERT_TRUE(migrator_);
-    install(identifier, groups);
-    log_->clear();
-  }
-  void install(const std::string& identifier, const std::vector<std::string>& groups) {
     platform_->registry.groupsOf[identifier] = groups;
     platform_->registry.addInstalledApplication(identifier);
+    log_->clear();
   }
   bool migrate(const std::string& identifier) { return migrator_->_migrateGroupContainersForIdentifier(identifier); }
   bool mapHas(const std::string& group) const { return migrator_->groupContainerMap()->count(group) != 0; }
@@ -78,19 +75,6 @@ TEST_F(GroupContainerMigration, ItemsReplaceNeverMergeLinksStayLinksAndOldContai
   EXPECT_EQ(std::filesystem::read_symlink(fresh + "/link").string(), "../elsewhere/target");
   EXPECT_FALSE(pathExists(old));
   EXPECT_FALSE(mapHas("group.a"));
-}
-
-TEST_F(GroupContainerMigration, GroupSharedByTwoApplicationsIsMovedOnce) {
-  const std::string old = addOldGroup("group.shared", {"data"});
-  // A group no application names keeps the map from running empty.
-  addOldGroup("group.unclaimed", {});
-  createAndInstall("com.example.a", {"group.shared"});
-  EXPECT_TRUE(migrate("com.example.a"));
-  ASSERT_TRUE(writeFile(newGroups_ + "/group.shared/written-after", "x"));
-  install("com.example.b", {"group.shared"});
-  EXPECT_TRUE(migrate("com.example.b"));
-  EXPECT_TRUE(loggedOnce("QSAppMigrator: No group container entry to migrate for com.example.b[group.shared]"));
-  EXPECT_EQ(directoryNames(newGroups_ + "/group.shared"), (std::vector<std::string>{"data", "written-after"}));
 }
 
 TEST_F(GroupContainerMigration, EntriesThatCannotBeMovedAreSkippedAndKept) {

@@ -5,6 +5,7 @@
 #include <filesystem>
 
 #include "FakePlatform.h"
+#include "support/ImageSupport.h"
 
 using platform::Dictionary;
 using platform::Value;
@@ -18,9 +19,6 @@ constexpr char kReturningFailed[] =
 
 class MigrationRun : public MigratorTest {
  protected:
-  std::string versionRecordPath() const { return dataDirectoryPath() + "/AppMigratorLastSystemVersion.plist"; }
-  std::string harborMapPath() const { return dataDirectoryPath() + "/SafeHarbor.plist"; }
-  void writeInstallMap(const Dictionary& map = {}) { writePlist(oldInstallMapPath(), Value(map)); }
   // Containers whose application is installed but whose record cannot be
   // found: each fails before anything of it is touched.
   void makeFailingContainers(const std::vector<std::string>& names) {
@@ -36,34 +34,25 @@ class MigrationRun : public MigratorTest {
   }
 };
 
-TEST_F(MigrationRun, RunWithoutOldLayoutSucceedsAndRecordsSystemVersion) {
-  auto migrator = createMigrator();
-  ASSERT_NE(migrator, nullptr);
-  EXPECT_EQ(migrator->estimatedDuration(), 20.0f);
-  EXPECT_EQ(migrator->migrationProgress(), 0.5f);
-  EXPECT_TRUE(migrator->performMigration());
-
-  ASSERT_EQ(platform_->daemon.dataProtectionCalls.size(), 1u);
-  EXPECT_EQ(platform_->daemon.dataProtectionCalls[0],
-            (Dictionary{{platform::kQSUpdateSystemAppDataContainerDataProtection, Value(true)}}));
-  EXPECT_EQ(readPlist(versionRecordPath()), platform_->systemVersion.dictionary);
-  EXPECT_TRUE(loggedOnce("QSAppMigrator: Recorded current system version as 21A100"));
-  // The next run reads back what this one recorded.
-  EXPECT_EQ(createMigrator()->lastSystemBuildVersion(), "21A100");
-}
-
-TEST_F(MigrationRun, EmptyOldApplicationsDirectoryGoesAtCreationButTheInstallMapStays) {
+TEST_F(MigrationRun, EmptyOldDirectoryGoesAtCreationAndTheRunRecordsTheSystemVersion) {
   ASSERT_TRUE(makeDirs(oldApplicationsPath()));
   writeInstallMap();
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
-  EXPECT_FALSE(migrator->itemsToMigrate().has_value());
   EXPECT_FALSE(pathExists(oldApplicationsPath()));
+  EXPECT_EQ(migrator->estimatedDuration(), 20.0f);
+  EXPECT_EQ(migrator->migrationProgress(), 0.5f);
 
-  // The re-listing meets ENOENT silently, so this run leaves the map too.
+  // The re-listing meets ENOENT silently, so this run leaves the install map.
   EXPECT_TRUE(migrator->performMigration());
   EXPECT_TRUE(pathExists(oldInstallMapPath()));
   EXPECT_TRUE(hostMessagesStartingWith("QSAppMigrator: Failed").empty());
+  EXPECT_EQ(platform_->daemon.dataProtectionCalls,
+            (std::vector<Dictionary>{{{platform::kQSUpdateSystemAppDataContainerDataProtection, Value(true)}}}));
+  EXPECT_EQ(readPlist(versionRecordPath()), platform_->systemVersion.dictionary);
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Recorded current system version as 21A100"));
+  // The next run reads back what this one recorded.
+  EXPECT_EQ(createMigrator()->lastSystemBuildVersion(), "21A100");
 }
 
 TEST_F(MigrationRun, CreationFailsWhenOldApplicationsDirectoryCannotBeListed) {
@@ -80,6 +69,7 @@ TEST_F(MigrationRun, CreationFailsWhenOldApplicationsDirectoryCannotBeListed) {
 TEST_F(MigrationRun, SuccessfulRunMovesEverythingAndRemovesTheOldLayout) {
   const std::string container = makeBundleContainer("A", "com.example.a");
   makeBundle(container + "/Tunnel.vpnplugin", "com.example.a.tunnel");
+  ASSERT_TRUE(writeSolidPNG(container + "/com.example.a.app/Icon.png", 8, 8, 0xff0000ff));
   ASSERT_TRUE(makeDirs(container + "/Documents") && writeFile(container + "/Documents/letter", "dear"));
   // A VPN plug-in gets no placeholder: it must be known to the registry already.
   makeBundleContainer("B", "com.example.b", "vpnplugin");
@@ -93,11 +83,9 @@ TEST_F(MigrationRun, SuccessfulRunMovesEverythingAndRemovesTheOldLayout) {
   EXPECT_TRUE(migrator->performMigration()) << testing::PrintToString(log_->hostMessages());
   EXPECT_EQ(migrator->countItemsMigrated(), 2u);
   EXPECT_EQ(readFile(platform_->registry.dataContainerPath("com.example.a") + "/Documents/letter"), "dear");
-  const std::string installedA = platform_->registry.bundleContainerPath("com.example.a");
-  EXPECT_EQ(directoryNames(installedA), (std::vector<std::string>{"Tunnel.vpnplugin", "com.example.a.app"}));
-  for (const char* identifier : {"com.example.a", "com.example.b"}) {
-    EXPECT_FALSE(platform_->registry.records.at(identifier).isPlaceholder) << identifier;
-  }
+  EXPECT_EQ(directoryNames(platform_->registry.bundleContainerPath("com.example.a")),
+            (std::vector<std::string>{"Tunnel.vpnplugin", "com.example.a.app"}));
+  EXPECT_FALSE(platform_->registry.records.at("com.example.a").isPlaceholder);
   EXPECT_FALSE(pathExists(oldApplicationsPath()));
   EXPECT_FALSE(pathExists(oldInstallMapPath()));
   EXPECT_TRUE(pathExists(versionRecordPath()));
@@ -105,10 +93,8 @@ TEST_F(MigrationRun, SuccessfulRunMovesEverythingAndRemovesTheOldLayout) {
 }
 
 TEST_F(MigrationRun, ApplicationContainersRunFirstInReverseListingOrderThenVPNContainers) {
-  for (const char* name : {"first", "third"}) makeBundleContainer(name, std::string("com.example.") + name);
-  for (const char* name : {"second", "fourth"}) {
-    makeBundleContainer(name, std::string("com.example.") + name, "vpnplugin");
-  }
+  for (const std::string name : {"first", "third"}) makeBundleContainer(name, "com.example." + name);
+  for (const std::string name : {"second", "fourth"}) makeBundleContainer(name, "com.example." + name, "vpnplugin");
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
 
@@ -154,9 +140,7 @@ TEST_F(MigrationRun, FailedContainerFailsTheRunButOthersAreStillAttempted) {
   writeInstallMap();
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
-
   EXPECT_FALSE(migrator->performMigration());
-  EXPECT_EQ(migrator->migrationProgress(), 1.0f);
   for (const std::string name : {"a", "b"}) {
     EXPECT_TRUE(loggedOnce("QSAppMigrator: Migration of com.example." + name + " at " + oldApplicationsPath() + "/" +
                            name + "/com.example." + name + ".app failed"));
@@ -196,7 +180,6 @@ TEST_F(MigrationRun, UnwritableVersionRecordDoesNotFailTheRun) {
   ASSERT_NE(migrator, nullptr);
   EXPECT_TRUE(migrator->performMigration());
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to write current build info to " + versionRecordPath()));
-  EXPECT_FALSE(pathExists(versionRecordPath()));
 }
 
 TEST_F(MigrationRun, UnlistableOldDirectoryAtReListingIsReportedAndNothingRemoved) {
@@ -211,8 +194,8 @@ TEST_F(MigrationRun, UnlistableOldDirectoryAtReListingIsReportedAndNothingRemove
   ASSERT_NE(migrator, nullptr);
   EXPECT_FALSE(migrator->performMigration());
   EXPECT_TRUE(
-      loggedOnce("QSAppMigrator: Failed to determine if any items were remaining to migrate: "
-                 "Error Domain=POSIXErrorDomain Code=20 ",
+      loggedOnce("QSAppMigrator: Failed to determine if any items were remaining to migrate: Error "
+                 "Domain=POSIXErrorDomain Code=20 ",
                  true));
   EXPECT_TRUE(pathExists(oldApplicationsPath()));
   EXPECT_TRUE(pathExists(oldInstallMapPath()));

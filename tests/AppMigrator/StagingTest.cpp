@@ -40,13 +40,6 @@ class BundleStaging : public MigratorTest {
            " failed because it's older than what's built into the system. Data migration already happened so we're "
            "done here.";
   }
-  // A staging that fails before the registry is asked, with one line starting with `line`.
-  void expectFailureBeforeInstall(bool withPlugin, const std::string& line) {
-    EXPECT_FALSE(stage(withPlugin));
-    EXPECT_TRUE(platform_->registry.installCalls.empty());
-    ASSERT_EQ(log_->hostMessages().size(), 1u);
-    EXPECT_EQ(log_->hostMessages()[0].rfind(line, 0), 0u) << log_->hostMessages()[0];
-  }
 
   std::string container_, bundle_, plugin_;
   std::unique_ptr<QSAppMigrator> migrator_;
@@ -84,23 +77,26 @@ TEST_F(BundleStaging, PackageHoldsBundlesAndStoreDataAndIsInstalledWithFiveOptio
   EXPECT_TRUE(log_->hostLines().empty());
 }
 
-TEST_F(BundleStaging, PayloadThatCannotBeCreatedStopsBeforeAnyMove) {
-  makeImmutable(container_);
-  expectFailureBeforeInstall(false, "QSAppMigrator: Failed to create file://" + packagePath() + "/Payload/ : ");
-  EXPECT_TRUE(pathExists(bundle_));
-}
-
-TEST_F(BundleStaging, BundleThatCannotBeMovedFailsWithoutInstall) {
-  makeImmutable(bundle_);
-  expectFailureBeforeInstall(false, "QSAppMigrator: Failed to move bundle from file://" + bundle_ + "/ to file://" +
-                                        packagePath() + "/Payload/Writer.app/: Error Domain=");
-}
-
-TEST_F(BundleStaging, VPNPluginThatCannotBeMovedFailsWithoutInstall) {
+TEST_F(BundleStaging, PayloadOrMoveFailureStopsBeforeTheRegistryIsAsked) {
   makeBundle(plugin_, "com.example.writer.tunnel");
-  makeImmutable(plugin_);
-  expectFailureBeforeInstall(true, "QSAppMigrator: Failed to move vpn bundle from file://" + plugin_ + "/ to file://" +
-                                       packagePath() + "/Payload/Tunnel.vpnplugin/: Error Domain=");
+  const std::pair<std::string, std::string> cases[] = {
+      {container_, "QSAppMigrator: Failed to create file://" + packagePath() + "/Payload/ : "},
+      {bundle_, "QSAppMigrator: Failed to move bundle from file://" + bundle_ + "/ to file://" + packagePath() +
+                    "/Payload/Writer.app/: Error Domain="},
+      {plugin_, "QSAppMigrator: Failed to move vpn bundle from file://" + plugin_ + "/ to file://" + packagePath() +
+                    "/Payload/Tunnel.vpnplugin/: Error Domain="},
+  };
+  for (const auto& [immutable, line] : cases) {
+    makeImmutable(immutable);
+    log_->clear();
+    EXPECT_FALSE(stage(true));
+    ASSERT_TRUE(setImmutable(immutable, false));
+    immutable_.pop_back();
+    EXPECT_EQ(log_->hostMessages().size(), 1u);
+    EXPECT_TRUE(loggedOnce(line, true));
+  }
+  EXPECT_TRUE(platform_->registry.installCalls.empty());
+  EXPECT_EQ(directoryNames(packagePath() + "/Payload"), std::vector<std::string>{"Writer.app"});
 }
 
 TEST_F(BundleStaging, AlreadyInstalledRefusalIsSuccessEvenAfterALaterErrorReport) {
