@@ -3,10 +3,6 @@
 #include "FakePlatform.h"
 #include "Shared/FileManager/QSFileManager.h"
 
-using platform::Dictionary;
-using platform::URL;
-using platform::Value;
-
 namespace qstest {
 namespace {
 

@@ -1,13 +1,8 @@
 // Moving the user's data into the new data container, and the check for items
 // left behind.
 #include <stdlib.h>
-#include <unistd.h>
-
-#include <filesystem>
 
 #include "FakePlatform.h"
-
-using platform::URL;
 
 namespace qstest {
 namespace {

@@ -1,14 +1,10 @@
 #include "FakePlatform.h"
 
 #include <algorithm>
-#include <filesystem>
 #include <thread>
 
 namespace fs = std::filesystem;
-using platform::Dictionary;
 using platform::Error;
-using platform::URL;
-using platform::Value;
 
 namespace qstest {
 
@@ -22,11 +18,6 @@ bool fail(Error* error, const std::string& message) {
 std::string identifierIn(const Dictionary& options) {
   const std::string* identifier = QSStringForKey(options, platform::kBundleIdentifierKey);
   return identifier ? *identifier : std::string();
-}
-
-Dictionary errorReport(const std::string& name, const std::string& description) {
-  return Dictionary{{platform::kRegistryProgressErrorKey, Value(name)},
-                    {platform::kRegistryProgressErrorDescriptionKey, Value(description)}};
 }
 
 }  // namespace
@@ -98,11 +89,9 @@ bool FakeApplicationRegistry::installPackage(const URL& package, const Dictionar
   std::vector<Dictionary> reports = reportsFirst;
   bool installed = false;
   if (refuseInstallOf.count(identifier)) {
-    reports.push_back(errorReport("InstallFailed", "refused by the test"));
+    reports.push_back(Dictionary{{platform::kRegistryProgressErrorKey, Value("InstallFailed")},
+                                 {platform::kRegistryProgressErrorDescriptionKey, Value("refused by the test")}});
     fail(error, "installation of " + identifier + " refused");
-  } else if (alreadyInstalledOf.count(identifier)) {
-    reports.push_back(errorReport(platform::kRegistryErrorApplicationAlreadyInstalled, identifier));
-    fail(error, identifier + " is already installed");
   } else {
     std::vector<std::string> items;
     for (const std::string& name : directoryNames(package.path() + "/Payload")) {
@@ -152,13 +141,8 @@ FakePlatform::FakePlatform(const std::string& root)
 }
 
 QSMigratorServices FakePlatform::services() {
-  return QSMigratorServices{&registry,
-                            &daemon,
-                            &bundleReader,
-                            &iconRenderer,
-                            &imageEncoding,
-                            &systemVersion,
-                            URL::fileURL(temporaryDirectory, true)};
+  const URL temporary = URL::fileURL(temporaryDirectory, true);
+  return {&registry, &daemon, &bundleReader, &iconRenderer, &imageEncoding, &systemVersion, temporary};
 }
 
 // --- MigratorTest ----------------------------------------------------------------------------

@@ -11,6 +11,8 @@
 // does, and joins it before returning; that thread touches none of its state.
 #pragma once
 
+#include <unistd.h>
+
 #include <filesystem>
 #include <functional>
 #include <map>
@@ -28,6 +30,10 @@
 #include "support/TestSupport.h"
 
 namespace qstest {
+
+using platform::Dictionary;
+using platform::URL;
+using platform::Value;
 
 // The domain of the errors the fakes make up.
 inline constexpr char kFakeErrorDomain[] = "FakePlatformErrorDomain";
@@ -48,9 +54,8 @@ class FakeApplicationRegistry final : public platform::ApplicationRegistry {
   std::map<std::string, platform::BundleRecord> records;
 
   // --- Knobs ---------------------------------------------------------------------
-  std::set<std::string> refuseInstallOf;     // installation fails (a package reports "InstallFailed" first)
-  std::set<std::string> alreadyInstalledOf;  // installPackage reports "ApplicationAlreadyInstalled" and fails
-  std::set<std::string> hideRecordOf;        // recordForIdentifier yields none
+  std::set<std::string> refuseInstallOf;  // installation fails (a package reports "InstallFailed" first)
+  std::set<std::string> hideRecordOf;     // recordForIdentifier yields none
   std::map<std::string, std::vector<std::string>> groupsOf;  // the groups an installed package gets
   std::vector<platform::Dictionary> reportsFirst;            // delivered before a package's own reports
   // Called first in every call with the call's name ("isInstalled",

@@ -1,9 +1,6 @@
 // Safe-harbor registration from the safe-harbor map.
 #include "FakePlatform.h"
 
-using platform::Dictionary;
-using platform::Value;
-
 namespace qstest {
 namespace {
 
