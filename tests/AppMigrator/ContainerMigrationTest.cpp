@@ -87,15 +87,6 @@ TEST_F(ContainerMigration, RecordWithoutDataContainerKeepsContainerWithMarker) {
   expectKeptWithMarker(appInfo());
 }
 
-TEST_F(ContainerMigration, FailedDataMoveKeepsContainerWithMarker) {
-  platform_->registry.addInstalledApplication(kIdentifier);
-  makeImmutable(container_ + "/Library");
-  EXPECT_FALSE(migrate());
-  expectKeptWithMarker(appInfo());
-  EXPECT_TRUE(pathExists(bundle_));
-  EXPECT_TRUE(platform_->registry.installCalls.empty());
-}
-
 TEST_F(ContainerMigration, PlaceholderBundleOnlyMovesDataAndRemovesContainer) {
   ASSERT_TRUE(QSFileManager::defaultManager().markBundleAsPlaceholder(URL::fileURL(bundle_, true)));
   platform_->registry.addInstalledApplication(kIdentifier);
@@ -142,18 +133,6 @@ TEST_F(ContainerMigration, MarkerThatCannotBeWrittenDoesNotStopTheMigration) {
   EXPECT_EQ(log_->hostMessages().at(0),
             "QSAppMigrator: Failed to write out container marker dictionary... hopefully we don't need it to recover.");
   EXPECT_FALSE(pathExists(container_));
-}
-
-TEST_F(ContainerMigration, ResumesWhenTheBundleAlreadyWaitsInStaging) {
-  // An attempt interrupted after staging: placeholder installed, data moved,
-  // bundle in the package directory.
-  platform_->registry.addInstalledApplication(kIdentifier);
-  ASSERT_TRUE(makeDirs(container_ + "/Staging/Payload"));
-  ASSERT_EQ(rename(bundle_.c_str(), (container_ + "/Staging/Payload/Notes.app").c_str()), 0);
-  writePlist(container_ + "/" + kMarker, Value(appInfo()));
-  EXPECT_TRUE(migrate());
-  EXPECT_FALSE(pathExists(container_));
-  EXPECT_TRUE(pathExists(platform_->registry.records.at(kIdentifier).bundleURL.path() + "/Info.plist"));
 }
 
 TEST_F(ContainerMigration, InfoWithoutRequiredStringsTouchesNothing) {

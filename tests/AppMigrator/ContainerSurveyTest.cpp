@@ -82,19 +82,15 @@ TEST_F(Introspection, ApplicationAndVPNPluginInEitherListingOrder) {
 }
 
 TEST_F(Introspection, ContainerWithoutUsableBundleIsRemoved) {
-  // An application without identifier, and an extension in capitals.
-  const std::string noIdentifier = makeContainer("noid");
-  makeBundle(noIdentifier + "/Main.app", "");
-  ASSERT_TRUE(makeDirs(noIdentifier + "/Documents"));
-  const std::string capitals = makeContainer("caps");
-  makeBundle(capitals + "/Main.APP", "com.example.main");
-  for (const std::string& container : {noIdentifier, capitals}) {
-    bool early = false;
-    EXPECT_FALSE(introspect(container, &early).has_value()) << container;
-    EXPECT_FALSE(early);
-    EXPECT_FALSE(pathExists(container)) << container;
-    EXPECT_TRUE(loggedOnce("QSAppMigrator: No app or vpn bundle found in container " + container + " ; removing it"));
-  }
+  // An application without identifier is no bundle.
+  const std::string container = makeContainer("noid");
+  makeBundle(container + "/Main.app", "");
+  ASSERT_TRUE(makeDirs(container + "/Documents"));
+  bool early = false;
+  EXPECT_FALSE(introspect(container, &early).has_value());
+  EXPECT_FALSE(early);
+  EXPECT_FALSE(pathExists(container));
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: No app or vpn bundle found in container " + container + " ; removing it"));
 }
 
 TEST_F(Introspection, SymbolicLinkedBundleOrMarkerLeavesContainerUntouched) {

@@ -120,17 +120,14 @@ bool FakeApplicationRegistry::installBundle(const URL& bundle, const Dictionary&
 std::unique_ptr<platform::ImageEncoder> FaultyImageEncoding::createEncoder(platform::Data& buffer,
                                                                            std::string_view typeIdentifier,
                                                                            size_t imageCount) {
-  if (failCreate) return nullptr;
-  std::unique_ptr<platform::ImageEncoder> inner = inner_.createEncoder(buffer, typeIdentifier, imageCount);
-  if (!inner || !failFinalize) return inner;
-  // Encodes as asked but reports that nothing was written.
+  // Takes the image but reports that nothing was written.
   struct FailingFinalize final : platform::ImageEncoder {
-    explicit FailingFinalize(std::unique_ptr<platform::ImageEncoder> wrapped) : wrapped_(std::move(wrapped)) {}
-    void addImage(const platform::Image& image) override { wrapped_->addImage(image); }
+    void addImage(const platform::Image&) override {}
     bool finalize() override { return false; }
-    std::unique_ptr<platform::ImageEncoder> wrapped_;
   };
-  return std::make_unique<FailingFinalize>(std::move(inner));
+  if (failCreate) return nullptr;
+  if (failFinalize) return std::make_unique<FailingFinalize>();
+  return inner_.createEncoder(buffer, typeIdentifier, imageCount);
 }
 
 FakePlatform::FakePlatform(const std::string& root)
@@ -168,48 +165,6 @@ void MigratorTest::TearDown() {
   platform_.reset();
   scratch_.reset();
   removeLayout();
-}
-
-std::string MigratorTest::makeContainer(const std::string& name) {
-  const std::string path = oldApplicationsPath() + "/" + name;
-  EXPECT_TRUE(makeDirs(path));
-  return path;
-}
-
-void MigratorTest::makeBundle(const std::string& path, const std::string& identifier) {
-  Dictionary info{{platform::kBundleExecutableKey, Value("main")}};
-  if (!identifier.empty()) info[platform::kBundleIdentifierKey] = Value(identifier);
-  writePlist(path + "/" + platform::kInfoPlistFileName, Value(info));
-}
-
-std::string MigratorTest::makeBundleContainer(const std::string& name, const std::string& identifier,
-                                              const std::string& extension) {
-  const std::string container = makeContainer(name);
-  makeBundle(container + "/" + identifier + "." + extension, identifier);
-  return container;
-}
-
-void MigratorTest::writePlist(const std::string& path, const Value& value) {
-  Error error;
-  ASSERT_TRUE(makeDirs(fs::path(path).parent_path().string()));
-  ASSERT_TRUE(platform::plist::writeFile(value, URL::fileURL(path), platform::plist::Format::XML, true, &error))
-      << error.description();
-}
-
-void MigratorTest::makeImmutable(const std::string& path) {
-  ASSERT_TRUE(setImmutable(path, true));
-  immutable_.push_back(path);
-}
-
-Dictionary MigratorTest::containerInfo(const std::string& containerPath, const std::string& bundlePath,
-                                       const std::string& identifier, const std::string& type,
-                                       const std::string& secondBundlePath) {
-  Dictionary info{{kQSContainerPathKey, Value(containerPath)},
-                  {kQSBundlePathKey, Value(bundlePath)},
-                  {kQSBundleIdentifierKey, Value(identifier)},
-                  {kQSContainerTypeKey, Value(type)}};
-  if (!secondBundlePath.empty()) info[kQSSecondBundlePathKey] = Value(secondBundlePath);
-  return info;
 }
 
 testing::AssertionResult MigratorTest::loggedOnce(const std::string& message, bool prefix) const {

@@ -176,27 +176,51 @@ class MigratorTest : public testing::Test {
   static std::string oldInstallMapPath() { return QSGlobalConfiguration::sharedInstance().oldInstallMapPath().path(); }
   // Made by the configuration on access.
   static std::string dataDirectoryPath() { return QSGlobalConfiguration::sharedInstance().dataDirectory().path(); }
-
-  // A container directory in the old applications directory.
-  std::string makeContainer(const std::string& name);
-  // A bundle directory at `path` whose Info.plist holds `identifier` (no
-  // identifier key when it is empty).
-  void makeBundle(const std::string& path, const std::string& identifier);
-  // A container `name` holding the bundle `identifier`.`extension`.
-  std::string makeBundleContainer(const std::string& name, const std::string& identifier,
-                                  const std::string& extension = "app");
-  void writePlist(const std::string& path, const platform::Value& value);  // XML; fails the test when it cannot
   static std::string versionRecordPath() { return dataDirectoryPath() + "/AppMigratorLastSystemVersion.plist"; }
   static std::string harborMapPath() { return dataDirectoryPath() + "/SafeHarbor.plist"; }
-  void writeInstallMap(const platform::Dictionary& map = {}) { writePlist(oldInstallMapPath(), platform::Value(map)); }
-  static std::optional<platform::Dictionary> readPlist(const std::string& path) {
-    return platform::plist::readDictionary(platform::URL::fileURL(path));
+
+  // A container directory in the old applications directory.
+  static std::string makeContainer(const std::string& name) {
+    EXPECT_TRUE(makeDirs(oldApplicationsPath() + "/" + name));
+    return oldApplicationsPath() + "/" + name;
+  }
+  // A bundle directory at `path` whose Info.plist holds `identifier` (no
+  // identifier key when it is empty).
+  static void makeBundle(const std::string& path, const std::string& identifier) {
+    Dictionary info{{platform::kBundleExecutableKey, Value("main")}};
+    if (!identifier.empty()) info[platform::kBundleIdentifierKey] = Value(identifier);
+    writePlist(path + "/" + platform::kInfoPlistFileName, Value(info));
+  }
+  // A container `name` holding the bundle `identifier`.`extension`.
+  static std::string makeBundleContainer(const std::string& name, const std::string& identifier,
+                                         const std::string& extension = "app") {
+    makeBundle(makeContainer(name) + "/" + identifier + "." + extension, identifier);
+    return oldApplicationsPath() + "/" + name;
+  }
+  // Writes XML, with the directories it needs; fails the test when it cannot.
+  static void writePlist(const std::string& path, const Value& value) {
+    ASSERT_TRUE(makeDirs(std::filesystem::path(path).parent_path().string()));
+    ASSERT_TRUE(platform::plist::writeFile(value, URL::fileURL(path), platform::plist::Format::XML, true));
+  }
+  static void writeInstallMap(const Dictionary& map = {}) { writePlist(oldInstallMapPath(), Value(map)); }
+  static std::optional<Dictionary> readPlist(const std::string& path) {
+    return platform::plist::readDictionary(URL::fileURL(path));
   }
   // Sets the immutable flag on `path`; TearDown clears it.
-  void makeImmutable(const std::string& path);
-  static platform::Dictionary containerInfo(const std::string& containerPath, const std::string& bundlePath,
-                                            const std::string& identifier, const std::string& type,
-                                            const std::string& secondBundlePath = "");
+  void makeImmutable(const std::string& path) {
+    ASSERT_TRUE(setImmutable(path, true));
+    immutable_.push_back(path);
+  }
+  static Dictionary containerInfo(const std::string& container, const std::string& bundle,
+                                  const std::string& identifier, const std::string& type,
+                                  const std::string& secondBundle = "") {
+    Dictionary info{{kQSContainerPathKey, Value(container)},
+                    {kQSBundlePathKey, Value(bundle)},
+                    {kQSBundleIdentifierKey, Value(identifier)},
+                    {kQSContainerTypeKey, Value(type)}};
+    if (!secondBundle.empty()) info[kQSSecondBundlePathKey] = Value(secondBundle);
+    return info;
+  }
   std::unique_ptr<QSAppMigrator> createMigrator() { return QSAppMigrator::create(platform_->services()); }
 
   // Exactly one host-log line is `message` (or, with `prefix`, starts with it).
