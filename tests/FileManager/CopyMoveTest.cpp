@@ -11,27 +11,17 @@ using platform::Error;
 using qstest::exists;
 using qstest::fileURL;
 
-constexpr char kCopyFn[] = "-[QSFileManager _copyItemAtURL:toURL:failIfSrcMissing:error:]";
-constexpr char kMoveFn[] = "-[QSFileManager _moveItemAtURL:toURL:failIfSrcMissing:error:]";
 constexpr uid_t kOwner = 1234;
 constexpr gid_t kGroup = 5678;
 constexpr time_t kMTime = 1000000000;  // 2001-09-09
 const char* const kSourceItems[] = {"", "/data", "/link", "/dangling", "/sub", "/sub/big", "/sub/fifo"};
 
-// A POSIX access ACL with an extra named-user entry, in the kernel's
-// extended-attribute layout (version 2; entries sorted by tag).
-std::string accessACL() {
-  struct Entry {
-    uint16_t tag, perm;
-    uint32_t id;
-  };
-  const uint32_t version = 2;
-  const Entry entries[] = {
-      {0x01, 6, UINT32_MAX}, {0x02, 4, 4321}, {0x04, 4, UINT32_MAX}, {0x10, 4, UINT32_MAX}, {0x20, 0, UINT32_MAX}};
-  std::string out(reinterpret_cast<const char*>(&version), sizeof version);
-  out.append(reinterpret_cast<const char*>(entries), sizeof entries);
-  return out;
-}
+// A POSIX access ACL with an extra named-user entry (uid 4321) in the kernel's
+// extended-attribute layout: version 2, then tag, permissions and id of every
+// entry, sorted by tag (little-endian).
+constexpr char kAccessACL[] =
+    "\x02\0\0\0" "\x01\0\x06\0\xff\xff\xff\xff" "\x02\0\x04\0\xe1\x10\0\0" "\x04\0\x04\0\xff\xff\xff\xff"
+    "\x10\0\x04\0\xff\xff\xff\xff" "\x20\0\0\0\xff\xff\xff\xff";
 
 class FileManagerCopy : public qstest::FileLayerTest {
  protected:
@@ -53,7 +43,7 @@ class FileManagerCopy : public qstest::FileLayerTest {
     qstest::makeSymlink("nowhere", src + "/dangling");
     qstest::setXattr(src + "/data", "user.note", "hello");
     qstest::setXattr(src + "/data", "trusted.secret", "s");
-    qstest::setXattr(src + "/data", "system.posix_acl_access", accessACL());
+    qstest::setXattr(src + "/data", "system.posix_acl_access", std::string(kAccessACL, sizeof kAccessACL - 1));
     qstest::setXattr(src, "user.dir", "d");
     for (const char* item : {"", "/data", "/link", "/sub/big"}) {
       ASSERT_EQ(lchown((src + item).c_str(), kOwner, kGroup), 0) << item;
@@ -123,9 +113,7 @@ TEST_F(FileManagerCopy, SourceStatusFailureIsReportedByTheIfExistsForms) {
     Error copyError, moveError;
     if (fm.copyItemIfExistsAtURL(fileURL(item), fileURL(dst), &copyError)) return 1;
     if (fm.moveItemIfExistsAtURL(fileURL(item), fileURL(dst), &moveError)) return 2;
-    const std::string expected = "stat of file://" + item + " failed: Permission denied";
-    if (!copyError.isPOSIX(EACCES) || copyError.localizedDescription() != expected) return 3;
-    return moveError.isPOSIX(EACCES) && qstest::functionNameOf(moveError) == kMoveFn ? 0 : 4;
+    return copyError.isPOSIX(EACCES) && moveError.isPOSIX(EACCES) ? 0 : 3;
   });
   EXPECT_EQ(status, 0);
 }
@@ -163,10 +151,7 @@ TEST_F(FileManagerMove, RenameWithinTheFileSystemKeepsTheItemAndReportsOtherFail
   EXPECT_FALSE(exists(dir / "src"));
   EXPECT_EQ(qstest::lstatOf(dir / "dst")->st_ino, inode);
   EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "dst", true), fileURL(dir / "occupied", true), &error));
-  qstest::expectPOSIXError(
-      error, ENOTEMPTY,
-      "rename of file://" + dir.path() + "/dst/ to file://" + dir.path() + "/occupied/ failed: Directory not empty",
-      kMoveFn);
+  EXPECT_TRUE(error.isPOSIX(ENOTEMPTY)) << error.description();
   EXPECT_TRUE(exists(dir / "dst/sub"));
 }
 
@@ -194,14 +179,10 @@ TEST_F(FileManagerMove, CrossDeviceKeepsDestinationWhenSourceRemovalFails) {
   // The line that tells both copies are left.
   auto lines = log.systemLines();
   ASSERT_FALSE(lines.empty());
-  const auto& line = lines.back();
-  EXPECT_EQ(line.function, kMoveFn);
-  EXPECT_EQ(line.level, kQSLogLevelError);
-  EXPECT_EQ(line.message.rfind("Failed to remove move source after copy at " + dir.path() + "/src : ", 0), 0u);
-  EXPECT_NE(line.message.find("Error Domain=POSIXErrorDomain Code=1 \"removefile of file://" + dir.path() +
-                              "/src/ failed: Operation not permitted\""),
-            std::string::npos)
-      << line.message;
+  EXPECT_EQ(lines.back().function, "-[QSFileManager _moveItemAtURL:toURL:failIfSrcMissing:error:]");
+  EXPECT_EQ(lines.back().message.rfind("Failed to remove move source after copy at " + dir.path() + "/src : ", 0), 0u);
+  EXPECT_NE(lines.back().message.find("Code=1 \"removefile of file://" + dir.path() + "/src/ failed"), std::string::npos)
+      << lines.back().message;
 }
 
 TEST_F(FileManagerMove, CrossDeviceCopyFailureIsTheMovesFailureAndKeepsTheSource) {
@@ -210,9 +191,7 @@ TEST_F(FileManagerMove, CrossDeviceCopyFailureIsTheMovesFailureAndKeepsTheSource
   ASSERT_TRUE(qstest::writeFile(shm / "dst", "there"));
   Error error;
   EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "src"), fileURL(shm / "dst"), &error));
-  qstest::expectPOSIXError(
-      error, EEXIST, "copyfile of file://" + dir.path() + "/src to file://" + shm.path() + "/dst failed: File exists",
-      kCopyFn);
+  EXPECT_TRUE(error.isPOSIX(EEXIST)) << error.description();
   EXPECT_EQ(qstest::readFile(dir / "src"), "x");
   EXPECT_EQ(qstest::readFile(shm / "dst"), "there");
 }
@@ -264,22 +243,16 @@ TEST_F(StoreData, NonFatalFailureIsLoggedAndTheRestIsCaptured) {
   EXPECT_TRUE(exists(to_ + "/VendraArtwork/occupied"));
   EXPECT_TRUE(exists(to_ + "/VendraMetadata.plist"));
   EXPECT_FALSE(exists(from_ + "/VendraMetadata.plist"));
-  auto lines = log.systemLines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].function,
-            "-[QSFileManager captureStoreDataFromDirectory:toDirectory:doCopy:failureIsFatal:withError:]");
-  EXPECT_EQ(lines[0].level, kQSLogLevelError);
-  const std::string message = "Failed to move file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork";
-  EXPECT_NE(lines[0].message.find(": " + message + " ("), std::string::npos) << lines[0].message;
+  // The one line that tells which item stayed behind.
+  ASSERT_EQ(log.systemLines().size(), 1u);
+  EXPECT_EQ(log.count("Failed to move file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork"), 1u);
 }
 
 TEST_F(StoreData, FatalFailureStopsAndReturnsTheKeyedError) {
   ASSERT_NO_FATAL_FAILURE(blockArtworkAtTarget());
   Error error;
   EXPECT_FALSE(capture(false, true, &error));
-  qstest::expectInstallerError(
-      error, kQSErrorCodeStoreDataCaptureFailed,
-      "Failed to move file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork", ENOTEMPTY);
+  qstest::expectInstallerError(error, kQSErrorCodeStoreDataCaptureFailed, ENOTEMPTY);
   EXPECT_EQ(error.userInfo().at(kQSLegacyErrorStringKey), platform::Value("VendraArtworkCaptureFailed"));
   // The first item went; the third was never touched.
   EXPECT_TRUE(exists(to_ + "/Manifest.plist"));

