@@ -10,7 +10,6 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <cstring>
 #include <functional>
 #include <string>
@@ -20,7 +19,6 @@
 #include "Shared/FileManager/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
-#include "Shared/Support/QSLog.h"
 #include "support/TestSupport.h"
 
 namespace qstest {
@@ -155,8 +153,6 @@ auto whileImmutable(const std::string& path, const Fn& fn) {
 }
 
 // An error record that a successful call must leave as it was.
-inline platform::Error untouchedSentinel() {
-  return platform::Error("Sentinel", 99);
-}
+inline const platform::Error kUntouched("Sentinel", 99);
 
 }  // namespace qstest
