@@ -156,7 +156,8 @@ TEST_F(Attributes, InstallTypeReadsBackAndFailuresOfEveryKindAreLoggedRecords) {
   EXPECT_EQ(fm.installTypeForBundle(bundleURL()), Value(UINT64_MAX));
   EXPECT_TRUE(log.systemLines().empty());
 
-  EXPECT_FALSE(qstest::whileImmutable(bundle_, [&] { return fm.setInstallType(Value(uint64_t{9}), bundleURL(), &error); }));
+  EXPECT_FALSE(
+      qstest::whileImmutable(bundle_, [&] { return fm.setInstallType(Value(uint64_t{9}), bundleURL(), &error); }));
   qstest::expectInstallerError(error, kQSErrorCodeFileOperationFailed, EPERM);
   EXPECT_EQ(fm.installTypeForBundle(bundleURL()), Value(UINT64_MAX));
   qstest::setXattr(bundle_, kQSInstallTypeAttributeName, std::string(12, '\xAB'));  // does not fit the value

@@ -15,7 +15,6 @@ constexpr uid_t kOwner = 1234;
 constexpr gid_t kGroup = 5678;
 constexpr time_t kMTime = 1000000000;  // 2001-09-09
 const char* const kSourceItems[] = {"", "/data", "/link", "/dangling", "/sub", "/sub/big", "/sub/fifo"};
-const char* const kDataAttributes[] = {"user.note", "trusted.secret", "system.posix_acl_access"};
 
 // A POSIX access ACL with an extra named-user entry (uid 4321) in the kernel's
 // extended-attribute layout: version 2, then tag, permissions and id of every
@@ -67,7 +66,7 @@ class FileManagerCopy : public qstest::FileLayerTest {
     EXPECT_EQ(qstest::readFile(dst + "/data"), "payload");
     EXPECT_EQ(qstest::readFile(dst + "/sub/big"), qstest::readFile(src + "/sub/big"));
     EXPECT_EQ(fm.destinationOfSymbolicLinkAtURL(fileURL(dst + "/link"))->path(), "data");
-    for (const char* name : kDataAttributes) {
+    for (const char* name : {"user.note", "trusted.secret", "system.posix_acl_access"}) {
       EXPECT_EQ(qstest::xattrOf(dst + "/data", name), qstest::xattrOf(src + "/data", name)) << name;
     }
     EXPECT_EQ(qstest::xattrOf(dst, "user.dir"), "d");
@@ -143,8 +142,9 @@ TEST_F(FileManagerMove, CrossDeviceKeepsDestinationWhenSourceRemovalFails) {
   qstest::ShmDir shm;
   ASSERT_NO_FATAL_FAILURE(qstest::makeTree(dir / "src", {"locked/file"}));
   Error error = qstest::kUntouched;
-  EXPECT_TRUE(qstest::whileImmutable(
-      dir / "src/locked", [&] { return fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error); }));
+  EXPECT_TRUE(qstest::whileImmutable(dir / "src/locked", [&] {
+    return fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error);
+  }));
   EXPECT_TRUE(error.is("Sentinel", 99));
   EXPECT_EQ(qstest::readFile(shm / "dst/locked/file"), "x");
   EXPECT_EQ(qstest::readFile(dir / "src/locked/file"), "x");
@@ -170,8 +170,8 @@ TEST_F(FileManagerMove, FailedRenameOrCrossDeviceCopyIsTheMovesFailureAndKeepsTh
 class StoreData : public qstest::FileLayerTest {
  protected:
   void SetUp() override {
-    ASSERT_NO_FATAL_FAILURE(
-        qstest::makeTree(from_, {"VendraArtwork/icon.png", "Manifest.plist", "VendraMetadata.plist", "Unrelated.plist"}));
+    ASSERT_NO_FATAL_FAILURE(qstest::makeTree(
+        from_, {"VendraArtwork/icon.png", "Manifest.plist", "VendraMetadata.plist", "Unrelated.plist"}));
     ASSERT_TRUE(qstest::makeDirs(to_));
   }
   // A non-empty directory where the artwork would go: a rename cannot replace it.

@@ -12,7 +12,6 @@
 
 #include <cstring>
 #include <functional>
-#include <string>
 
 #include <gtest/gtest.h>
 
