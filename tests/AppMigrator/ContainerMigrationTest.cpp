@@ -39,39 +39,30 @@ class ContainerMigration : public MigratorTest {
   std::unique_ptr<QSAppMigrator> migrator_;
 };
 
-TEST_F(ContainerMigration, NewApplicationGetsPlaceholderThenDataThenBundleThenGroups) {
-  const std::string oldGroup = scratch_->path() + "/OldGroups/group.notes";
-  ASSERT_TRUE(makeDirs(oldGroup) && writeFile(oldGroup + "/shared", "s"));
-  writeInstallMap(Dictionary{
-      {"GroupContainers", Value(Dictionary{{"group.notes", Value(Dictionary{{"Container", Value(oldGroup)}})}})}});
-  platform_->registry.groupsOf[kIdentifier] = {"group.notes"};
-
-  ASSERT_TRUE(migrate());
-  EXPECT_EQ(platform_->registry.calls,
-            (std::vector<std::string>{"isInstalled com.example.notes", "installBundle com.example.notes",
-                                      "recordForIdentifier com.example.notes", "installPackage com.example.notes",
-                                      "recordForIdentifier com.example.notes"}));
-  EXPECT_FALSE(pathExists(container_));
-  EXPECT_EQ(readFile(dataPath() + "/Documents/note.txt"), "remember");
-  EXPECT_TRUE(pathExists(dataPath() + "/Library/Preferences"));
-  const auto& record = platform_->registry.records.at(kIdentifier);
-  EXPECT_FALSE(record.isPlaceholder);
-  EXPECT_TRUE(pathExists(record.bundleURL.path() + "/Info.plist"));
-  EXPECT_EQ(readFile(record.groupContainerURLs->at("group.notes").path() + "/shared"), "s");
-}
-
-TEST_F(ContainerMigration, FailedPlaceholderKeepsContainerWithMarker) {
+TEST_F(ContainerMigration, FailedPlaceholderOrRecordWithoutDataContainerKeepsContainerWithMarker) {
   platform_->registry.refuseInstallOf.insert(kIdentifier);
   EXPECT_FALSE(migrate());
   expectKeptWithMarker(appInfo());
   EXPECT_TRUE(pathExists(container_ + "/Documents/note.txt"));
   EXPECT_TRUE(pathExists(bundle_));
+
+  platform_->registry.addInstalledApplication(kIdentifier, false);
+  EXPECT_FALSE(migrate());
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get data container URL for com.example.notes"));
+  EXPECT_EQ(log_->hostMessages().back(), "QSAppMigrator: Proxy did have backing bundle");
+  expectKeptWithMarker(appInfo());
+  EXPECT_TRUE(pathExists(container_ + "/Documents/note.txt"));
 }
 
 TEST_F(ContainerMigration, VPNContainerWithoutRecordIsKeptAndNotQueried) {
   const std::string plugin = container_ + "/Tunnel.vpnplugin";
   makeBundle(plugin, "com.example.tunnel");
-  const Dictionary info = containerInfo(container_, plugin, "com.example.tunnel", "VPNBundle");
+  Dictionary info = containerInfo(container_, plugin, "com.example.tunnel", "VPNBundle");
+  // Without the strings it needs, nothing is touched.
+  info[kQSContainerPathKey] = Value(7);
+  EXPECT_FALSE(migrate(info));
+  EXPECT_FALSE(pathExists(container_ + "/" + kMarker));
+  info[kQSContainerPathKey] = Value(container_);
   EXPECT_FALSE(migrate(info));
   EXPECT_EQ(platform_->registry.calls, std::vector<std::string>{"recordForIdentifier com.example.tunnel"});
   EXPECT_EQ(log_->hostMessages(),
@@ -79,18 +70,13 @@ TEST_F(ContainerMigration, VPNContainerWithoutRecordIsKeptAndNotQueried) {
   expectKeptWithMarker(info);
 }
 
-TEST_F(ContainerMigration, RecordWithoutDataContainerKeepsContainerWithMarker) {
-  platform_->registry.addInstalledApplication(kIdentifier, false);
-  EXPECT_FALSE(migrate());
-  EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get data container URL for com.example.notes"));
-  EXPECT_EQ(log_->hostMessages().back(), "QSAppMigrator: Proxy did have backing bundle");
-  expectKeptWithMarker(appInfo());
-}
-
-TEST_F(ContainerMigration, PlaceholderBundleOnlyMovesDataAndRemovesContainer) {
+TEST_F(ContainerMigration, PlaceholderBundleOnlyMovesDataAndAnUnwritableMarkerDoesNotStopIt) {
   ASSERT_TRUE(QSFileManager::defaultManager().markBundleAsPlaceholder(URL::fileURL(bundle_, true)));
+  ASSERT_TRUE(makeDirs(container_ + "/" + kMarker + "/occupied"));
   platform_->registry.addInstalledApplication(kIdentifier);
   EXPECT_TRUE(migrate());
+  EXPECT_EQ(log_->hostMessages().at(0),
+            "QSAppMigrator: Failed to write out container marker dictionary... hopefully we don't need it to recover.");
   EXPECT_FALSE(pathExists(container_));
   EXPECT_EQ(readFile(dataPath() + "/Documents/note.txt"), "remember");
   EXPECT_TRUE(platform_->registry.installCalls.empty());
@@ -124,24 +110,6 @@ TEST_F(ContainerMigration, MissedItemsKeepContainerWithMarker) {
   EXPECT_FALSE(migrate());
   expectKeptWithMarker(appInfo());
   EXPECT_TRUE(pathExists(container_ + "/Unexpected.bin"));
-}
-
-TEST_F(ContainerMigration, MarkerThatCannotBeWrittenDoesNotStopTheMigration) {
-  ASSERT_TRUE(makeDirs(container_ + "/" + kMarker + "/occupied"));
-  platform_->registry.addInstalledApplication(kIdentifier);
-  EXPECT_TRUE(migrate());
-  EXPECT_EQ(log_->hostMessages().at(0),
-            "QSAppMigrator: Failed to write out container marker dictionary... hopefully we don't need it to recover.");
-  EXPECT_FALSE(pathExists(container_));
-}
-
-TEST_F(ContainerMigration, InfoWithoutRequiredStringsTouchesNothing) {
-  Dictionary info = appInfo();
-  info[kQSContainerPathKey] = Value(7);
-  EXPECT_FALSE(migrate(info));
-  EXPECT_TRUE(platform_->registry.calls.empty());
-  EXPECT_FALSE(pathExists(container_ + "/" + kMarker));
-  EXPECT_TRUE(pathExists(container_ + "/Documents/note.txt"));
 }
 
 }  // namespace

@@ -1,5 +1,6 @@
-// The migration run: creation, the host's queries and performMigration.
-#include <algorithm>
+// The migration run: creation, the host's queries, performMigration and the
+// safe harbors it registers.
+#include <deque>
 
 #include "FakePlatform.h"
 #include "support/ImageSupport.h"
@@ -63,21 +64,38 @@ TEST_F(MigrationRun, SuccessfulRunMovesEverythingAndRemovesTheOldLayout) {
   makeBundle(container + "/Tunnel.vpnplugin", "com.example.a.tunnel");
   ASSERT_TRUE(writeSolidPNG(container + "/com.example.a.app/Icon.png", 8, 8, 0xff0000ff));
   ASSERT_TRUE(makeDirs(container + "/Documents") && writeFile(container + "/Documents/letter", "dear"));
+  ASSERT_TRUE(makeDirs(container + "/Library/Preferences"));
+  const std::string oldGroup = scratch_->path() + "/group.a";
+  ASSERT_TRUE(makeDirs(oldGroup) && writeFile(oldGroup + "/shared", "s"));
+  writeInstallMap(Dictionary{
+      {"GroupContainers", Value(Dictionary{{"group.a", Value(Dictionary{{"Container", Value(oldGroup)}})}})}});
+  platform_->registry.groupsOf["com.example.a"] = {"group.a"};
   // A VPN plug-in gets no placeholder: it must be known to the registry already.
   makeBundleContainer("B", "com.example.b", "vpnplugin");
   platform_->registry.addInstalledApplication("com.example.b");
-  // A group-container entry of the wrong type is no map at all.
-  writeInstallMap(Dictionary{{"GroupContainers", Value(platform::makeStringArray({"group.example"}))}});
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
-  EXPECT_FALSE(migrator->groupContainerMap().has_value());
 
   EXPECT_TRUE(migrator->performMigration()) << testing::PrintToString(log_->hostMessages());
   EXPECT_EQ(migrator->countItemsMigrated(), 2u);
-  EXPECT_EQ(readFile(platform_->registry.dataContainerPath("com.example.a") + "/Documents/letter"), "dear");
+  // Placeholder, data, bundle, then groups.
+  std::vector<std::string> callsForA;
+  for (const std::string& call : platform_->registry.calls) {
+    if (call.ends_with(" com.example.a")) callsForA.push_back(call);
+  }
+  EXPECT_EQ(callsForA, (std::vector<std::string>{"isInstalled com.example.a", "installBundle com.example.a",
+                                                 "recordForIdentifier com.example.a", "installPackage com.example.a",
+                                                 "recordForIdentifier com.example.a"}));
+  const std::string data = platform_->registry.dataContainerPath("com.example.a");
+  EXPECT_EQ(readFile(data + "/Documents/letter"), "dear");
+  EXPECT_TRUE(pathExists(data + "/Library/Preferences"));
   EXPECT_EQ(directoryNames(platform_->registry.bundleContainerPath("com.example.a")),
             (std::vector<std::string>{"Tunnel.vpnplugin", "com.example.a.app"}));
   EXPECT_FALSE(platform_->registry.records.at("com.example.a").isPlaceholder);
+  EXPECT_EQ(
+      readFile(platform_->registry.records.at("com.example.a").groupContainerURLs->at("group.a").path() + "/shared"),
+      "s");
+  EXPECT_FALSE(pathExists(oldGroup));
   EXPECT_FALSE(pathExists(oldApplicationsPath()));
   EXPECT_FALSE(pathExists(oldInstallMapPath()));
   EXPECT_TRUE(pathExists(versionRecordPath()));
@@ -91,29 +109,28 @@ TEST_F(MigrationRun, ApplicationContainersRunFirstInReverseListingOrderThenVPNCo
   ASSERT_NE(migrator, nullptr);
 
   // Expected order from the listing order the migrator saw.
-  std::vector<std::string> applications, vpnPlugins;
+  std::deque<std::string> expected;
   for (const auto& entry : *migrator->itemsToMigrate()) {
     const std::string name = entry.lastPathComponent();
     const bool isApp = name == "first" || name == "third";
-    (isApp ? applications : vpnPlugins)
-        .push_back("QSAppMigrator: Migrating com.example." + name + " at " + oldApplicationsPath() + "/" + name +
-                   "/com.example." + name + (isApp ? ".app" : ".vpnplugin"));
+    const std::string line = "QSAppMigrator: Migrating com.example." + name + " at " + oldApplicationsPath() + "/" +
+                             name + "/com.example." + name + (isApp ? ".app" : ".vpnplugin");
+    isApp ? expected.push_front(line) : expected.push_back(line);
   }
-  std::reverse(applications.begin(), applications.end());
-  applications.insert(applications.end(), vpnPlugins.begin(), vpnPlugins.end());
-
   migrator->performMigration();
-  EXPECT_EQ(hostMessagesStartingWith("QSAppMigrator: Migrating "), applications);
+  EXPECT_EQ(hostMessagesStartingWith("QSAppMigrator: Migrating "), std::vector(expected.begin(), expected.end()));
 }
 
 TEST_F(MigrationRun, SymbolicLinkInOldDirectoryIsNeverAnEntryButKeepsTheOldLayout) {
   ASSERT_TRUE(makeDirs(oldApplicationsPath()));
   ASSERT_TRUE(writeFile(oldApplicationsPath() + "/WhereDidMyApplicationsGo.txt", "elsewhere"));
   ASSERT_EQ(symlink("/nowhere", (oldApplicationsPath() + "/Link").c_str()), 0);
-  writeInstallMap();
+  // A group-container entry of the wrong type is no map at all.
+  writeInstallMap(Dictionary{{"GroupContainers", Value(platform::makeStringArray({"group.example"}))}});
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
   ASSERT_EQ(migrator->itemsToMigrate()->size(), 1u);
+  EXPECT_FALSE(migrator->groupContainerMap().has_value());
 
   EXPECT_FALSE(migrator->performMigration());
   // The note is removed and counted without being introspected.
@@ -127,12 +144,23 @@ TEST_F(MigrationRun, SymbolicLinkInOldDirectoryIsNeverAnEntryButKeepsTheOldLayou
   EXPECT_FALSE(pathExists(versionRecordPath()));
 }
 
-TEST_F(MigrationRun, FailedContainerFailsTheRunButOthersAreStillAttempted) {
+TEST_F(MigrationRun, FailedContainerFailsTheRunButOthersAreStillAttemptedAndCounted) {
+  // Bundles without identifiers: those containers are removed and counted by
+  // introspection, before any container is migrated.
+  for (const char* name : {"x", "y"}) makeBundle(makeContainer(name) + "/x.app", "");
   makeFailingContainers({"a", "b"});
   writeInstallMap();
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
+  EXPECT_EQ(migrator->estimatedDuration(), 29.0f);
+  EXPECT_EQ(migrator->migrationProgress(), 0.0f);
+  std::vector<float> seen;
+  platform_->registry.observer = [&](const std::string& call, const std::string&) {
+    if (call == "isInstalled") seen.push_back(migrator->migrationProgress());
+  };
   EXPECT_FALSE(migrator->performMigration());
+  EXPECT_EQ(seen, (std::vector<float>{0.5f, 0.75f}));
+  EXPECT_EQ(migrator->migrationProgress(), 1.0f);
   for (const std::string name : {"a", "b"}) {
     EXPECT_TRUE(loggedOnce("QSAppMigrator: Migration of com.example." + name + " at " + oldApplicationsPath() + "/" +
                            name + "/com.example." + name + ".app failed"));
@@ -192,22 +220,57 @@ TEST_F(MigrationRun, UnlistableOldDirectoryAtReListingIsReportedAndNothingRemove
   EXPECT_TRUE(pathExists(oldInstallMapPath()));
 }
 
-TEST_F(MigrationRun, ProgressCountsEntriesRemovedByIntrospectionAndFinishedContainers) {
-  // Bundles without identifiers: those containers are removed and counted by
-  // introspection, before any container is migrated.
-  for (const char* name : {"x", "y"}) makeBundle(makeContainer(name) + "/x.app", "");
-  makeFailingContainers({"a", "b"});
+// --- Safe harbors, registered from the safe-harbor map ---------------------------
+
+class SafeHarbors : public MigratorTest {
+ protected:
+  static Value entry(const Value& path) { return Value(Dictionary{{"HarborPathKey", path}}); }
+  bool migrate(const Dictionary& map) {
+    writePlist(harborMapPath(), Value(map));
+    auto migrator = createMigrator();
+    return migrator && migrator->_migrateSafeHarbors();
+  }
+};
+
+TEST_F(SafeHarbors, UnreadableMapIsNothingToDoAndStays) {
+  ASSERT_TRUE(makeDirs(dataDirectoryPath()));
+  ASSERT_TRUE(writeFile(harborMapPath(), "<plist><array>"));
   auto migrator = createMigrator();
   ASSERT_NE(migrator, nullptr);
-  EXPECT_EQ(migrator->estimatedDuration(), 29.0f);
-  EXPECT_EQ(migrator->migrationProgress(), 0.0f);
-  std::vector<float> seen;
-  platform_->registry.observer = [&](const std::string& call, const std::string&) {
-    if (call == "isInstalled") seen.push_back(migrator->migrationProgress());
-  };
-  EXPECT_FALSE(migrator->performMigration());
-  EXPECT_EQ(seen, (std::vector<float>{0.5f, 0.75f}));
-  EXPECT_EQ(migrator->migrationProgress(), 1.0f);
+  EXPECT_TRUE(migrator->performMigration());
+  EXPECT_TRUE(platform_->daemon.safeHarborCalls.empty());
+  EXPECT_TRUE(pathExists(harborMapPath()));
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to load existing harbor map from " + harborMapPath()));
+}
+
+TEST_F(SafeHarbors, EveryEntryIsRegisteredWithTypeTwoAndNoOptionsAndTheMapGoes) {
+  EXPECT_TRUE(
+      migrate(Dictionary{{"com.example.a", entry(Value("/harbor/a"))}, {"com.example.b", entry(Value("/harbor/b"))}}));
+  EXPECT_EQ(platform_->daemon.safeHarborCalls,
+            (std::vector<std::string>{"com.example.a /harbor/a 2", "com.example.b /harbor/b 2"}));
+  EXPECT_FALSE(pathExists(harborMapPath()));
+}
+
+TEST_F(SafeHarbors, RefusedRegistrationKeepsTheMapAndTheOthersAreStillTried) {
+  platform_->daemon.refuseSafeHarborOf = {"com.example.b"};
+  EXPECT_FALSE(migrate(Dictionary{{"com.example.a", entry(Value("/harbor/a"))},
+                                  {"com.example.b", entry(Value("/harbor/b"))},
+                                  {"com.example.c", entry(Value("/harbor/c"))}}));
+  EXPECT_EQ(platform_->daemon.safeHarborCalls.size(), 3u);
+  EXPECT_TRUE(
+      loggedOnce("QSAppMigrator: Failed to migrate safe harbor for identifier com.example.b at /harbor/b : (null)"));
+  EXPECT_TRUE(pathExists(harborMapPath()));
+}
+
+TEST_F(SafeHarbors, MalformedEntriesAreSkippedAndTheMapStillGoes) {
+  EXPECT_TRUE(migrate(Dictionary{{"com.example.array", Value(platform::makeStringArray({"/harbor"}))},
+                                 {"com.example.number", entry(Value(3))},
+                                 {"com.example.good", entry(Value("/harbor/good"))}}));
+  EXPECT_EQ(platform_->daemon.safeHarborCalls, std::vector<std::string>{"com.example.good /harbor/good 2"});
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get harbor info for identifier com.example.array"));
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get harbor path from harbor entry for com.example.number : " +
+                         entry(Value(3)).description()));
+  EXPECT_FALSE(pathExists(harborMapPath()));
 }
 
 }  // namespace
