@@ -120,13 +120,6 @@ TEST_F(Introspection, ValidMarkerWinsOverTheChildrenAndIsReturnedAsRecorded) {
   bool early = true;
   EXPECT_EQ(introspect(vpn, &early, true), marker);
   EXPECT_FALSE(early);
-
-  // The bundle already left this one; its marker still says it is an application's.
-  const std::string app = makeContainer("app");
-  const Dictionary appMarker = containerInfo(app, app + "/Main.app", "com.example.main", "App");
-  writePlist(app + "/" + kMarkerName, Value(appMarker));
-  EXPECT_EQ(introspect(app, &early), appMarker);
-  EXPECT_TRUE(early);
 }
 
 TEST_F(Introspection, InvalidMarkerLeavesTheDecisionToTheChildren) {

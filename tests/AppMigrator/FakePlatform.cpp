@@ -85,7 +85,7 @@ bool FakeApplicationRegistry::installPackage(const URL& package, const Dictionar
                                              const platform::InstallProgressCallback& progress, Error* error) {
   const std::string identifier = identifierIn(options);
   note("installPackage", identifier);
-  installCalls.push_back({"installPackage", package, options});
+  installCalls.push_back({package, options});
   std::vector<Dictionary> reports = reportsFirst;
   bool installed = false;
   if (refuseInstallOf.count(identifier)) {
@@ -110,7 +110,7 @@ bool FakeApplicationRegistry::installPackage(const URL& package, const Dictionar
 bool FakeApplicationRegistry::installBundle(const URL& bundle, const Dictionary& options, Error* error) {
   const std::string identifier = identifierIn(options);
   note("installBundle", identifier);
-  installCalls.push_back({"installBundle", bundle, options});
+  installCalls.push_back({bundle, options});
   if (refuseInstallOf.count(identifier)) return fail(error, "installation of " + identifier + " refused");
   return place({bundle.path()}, identifier, true, error);
 }

@@ -65,7 +65,6 @@ class FakeApplicationRegistry final : public platform::ApplicationRegistry {
 
   // --- What was seen -------------------------------------------------------------
   struct InstallCall {
-    std::string call;  // "installPackage" or "installBundle"
     platform::URL location;
     platform::Dictionary options;
   };

@@ -86,18 +86,7 @@ TEST_F(BundleStaging, PayloadOrMoveFailureStopsBeforeTheRegistryIsAsked) {
   EXPECT_EQ(directoryNames(packagePath() + "/Payload"), std::vector<std::string>{"Writer.app"});
 }
 
-TEST_F(BundleStaging, AlreadyInstalledReportMakesARefusalSuccessWhateverFollows) {
-  platform_->registry.reportsFirst = {errorReport("ApplicationAlreadyInstalled", "older", "built in")};
-  platform_->registry.refuseInstallOf.insert(kIdentifier);
-  EXPECT_TRUE(stage());
-  EXPECT_EQ(log_->hostMessages(),
-            (std::vector<std::string>{
-                reportLine(" failed because it's older than what's built into the system. Data migration already "
-                           "happened so we're done here."),
-                reportLine(" failed with Quillset error refused by the test (InstallFailed : (null))")}));
-}
-
-TEST_F(BundleStaging, ErrorReportsAreLoggedButOnlyTheInstallResultDecides) {
+TEST_F(BundleStaging, ErrorReportsAreLoggedButOnlyTheInstallResultAndAlreadyInstalledDecide) {
   platform_->registry.reportsFirst = {errorReport("Warning", "transient", "retried"),
                                       Dictionary{{platform::kRegistryProgressPercentKey, Value(10)}}};
   EXPECT_TRUE(stage());
@@ -105,10 +94,20 @@ TEST_F(BundleStaging, ErrorReportsAreLoggedButOnlyTheInstallResultDecides) {
             std::vector<std::string>{reportLine(" failed with Quillset error transient (Warning : retried)")});
 
   makeBundle(bundle_, kIdentifier);
+  platform_->registry.reportsFirst.clear();
   platform_->registry.refuseInstallOf.insert(kIdentifier);
   EXPECT_FALSE(stage());
   EXPECT_TRUE(loggedOnce(
       "QSAppMigrator: Failed to install file://" + packagePath() + "/ : Error Domain=" + kFakeErrorDomain, true));
+
+  // Once the registry says the system has it already, a refusal that follows is success.
+  platform_->registry.reportsFirst = {errorReport("ApplicationAlreadyInstalled", "older", "built in")};
+  EXPECT_TRUE(stage());
+  EXPECT_EQ(log_->hostMessages(),
+            (std::vector<std::string>{
+                reportLine(" failed because it's older than what's built into the system. Data migration already "
+                           "happened so we're done here."),
+                reportLine(" failed with Quillset error refused by the test (InstallFailed : (null))")}));
 }
 
 }  // namespace
