@@ -168,11 +168,12 @@ void MigratorTest::TearDown() {
 }
 
 testing::AssertionResult MigratorTest::loggedOnce(const std::string& message, bool prefix) const {
-  size_t count = 0;
-  for (const std::string& line : log_->hostMessages()) count += prefix ? line.rfind(message, 0) == 0 : line == message;
+  const auto lines = log_->hostMessages();
+  const size_t count =
+      prefix ? hostMessagesStartingWith(message).size() : std::count(lines.begin(), lines.end(), message);
   if (count == 1) return testing::AssertionSuccess();
   return testing::AssertionFailure() << count << " lines " << (prefix ? "start with" : "are") << " \"" << message
-                                     << "\" among " << testing::PrintToString(log_->hostMessages());
+                                     << "\" among " << testing::PrintToString(lines);
 }
 
 std::vector<std::string> MigratorTest::hostMessagesStartingWith(const std::string& prefix) const {

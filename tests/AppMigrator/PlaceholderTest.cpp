@@ -33,6 +33,7 @@ class PlaceholderInstallation : public MigratorTest {
       stagedAtInstall_ = directoryNames(stagedPath());
       infoTextAtInstall_ = readFile(stagedPath() + "/Info.plist");
       infoAtInstall_ = readPlist(stagedPath() + "/Info.plist");
+      iconAtInstall_ = decodePNGFile(stagedPath() + "/Icon.png");
     };
   }
   bool install(const std::string& identifier = kIdentifier) {
@@ -58,14 +59,13 @@ class PlaceholderInstallation : public MigratorTest {
   std::vector<std::string> stagedAtInstall_;
   std::string infoTextAtInstall_;
   std::optional<Dictionary> infoAtInstall_;
+  std::optional<platform::Image> iconAtInstall_;
 };
 
-TEST_F(PlaceholderInstallation, StagesPresentKeysInOrderAndTheRenderedIconAndInstallsWithFourOptions) {
-  std::optional<platform::Image> icon;
-  platform_->registry.observer = [&, staged = platform_->registry.observer](auto& call, auto& id) {
-    staged(call, id);
-    icon = decodePNGFile(stagedPath() + "/Icon.png");
-  };
+TEST_F(PlaceholderInstallation, StagesPresentKeysInOrderAndTheRenderedIconWithTheStoreMetadataAsIs) {
+  static const char kRaw[] = "\x00\x01not a property list\xff";
+  const std::string bytes(kRaw, sizeof kRaw - 1);
+  ASSERT_TRUE(writeFile(container_ + "/VendraMetadata.plist", bytes));
   ASSERT_TRUE(install());
   EXPECT_EQ(stagedAtInstall_, (std::vector<std::string>{"Icon.png", "Info.plist"}));
   // Only the keys present are carried over, in the order they were copied, the icon entry last.
@@ -78,10 +78,10 @@ TEST_F(PlaceholderInstallation, StagesPresentKeysInOrderAndTheRenderedIconAndIns
                                                "RkBundleExecutable=atlas", "RkBundleShortVersionString=4.2",
                                                "RkBundleIconFile=Icon.png"}));
   EXPECT_EQ(infoAtInstall_->size(), entries.size());
-  ASSERT_TRUE(icon);
-  EXPECT_EQ(icon->width, platform::kHomeScreenIconSize);
-  EXPECT_EQ(icon->height, platform::kHomeScreenIconSize);
-  EXPECT_EQ(pixelAt(*icon, icon->width / 2, icon->height / 2), kOpaqueBlue);
+  ASSERT_TRUE(iconAtInstall_);
+  EXPECT_EQ(iconAtInstall_->width, platform::kHomeScreenIconSize);
+  EXPECT_EQ(iconAtInstall_->height, platform::kHomeScreenIconSize);
+  EXPECT_EQ(pixelAt(*iconAtInstall_, iconAtInstall_->width / 2, iconAtInstall_->height / 2), kOpaqueBlue);
 
   ASSERT_EQ(platform_->registry.installCalls.size(), 1u);
   EXPECT_EQ(platform_->registry.installCalls[0].location.path(), stagedPath());
@@ -89,22 +89,14 @@ TEST_F(PlaceholderInstallation, StagesPresentKeysInOrderAndTheRenderedIconAndIns
             Value(Dictionary{{platform::kRegistryInstallTypeKey, Value(uint64_t{6})},
                              {platform::kRegistryPackageTypeKey, Value(platform::kRegistryPackageTypePlaceholder)},
                              {platform::kBundleIdentifierKey, Value(kIdentifier)},
-                             {"SkipBlacklist", Value(true)}}));
-  // The real bundle stays where it was; nothing staged outlives the call.
+                             {"SkipBlacklist", Value(true)},
+                             {platform::kRegistryStoreMetadataKey, Value(Data(bytes.begin(), bytes.end()))}}));
+  // The real bundle and the metadata stay where they were; nothing staged outlives the call.
   EXPECT_TRUE(pathExists(bundle_ + "/Info.plist"));
-  EXPECT_TRUE(directoryNames(stagingParent()).empty());
-}
-
-TEST_F(PlaceholderInstallation, StoreMetadataBytesArePassedUnchangedAndAnUnreadableFileIsSkipped) {
-  static const char kRaw[] = "\x00\x01not a property list\xff";
-  const std::string bytes(kRaw, sizeof kRaw - 1);
-  ASSERT_TRUE(writeFile(container_ + "/VendraMetadata.plist", bytes));
-  ASSERT_TRUE(install());
-  const Dictionary& options = platform_->registry.installCalls.at(0).options;
-  EXPECT_EQ(options.size(), 5u);
-  EXPECT_EQ(options.at(platform::kRegistryStoreMetadataKey), Value(Data(bytes.begin(), bytes.end())));
   EXPECT_EQ(readFile(container_ + "/VendraMetadata.plist"), bytes);
+  EXPECT_TRUE(directoryNames(stagingParent()).empty());
 
+  // Store metadata that cannot be read is reported and left out.
   std::filesystem::remove(container_ + "/VendraMetadata.plist");
   ASSERT_TRUE(makeDirs(container_ + "/VendraMetadata.plist"));
   ASSERT_TRUE(install());
