@@ -52,7 +52,7 @@ std::optional<platform::BundleRecord> FakeApplicationRegistry::recordForIdentifi
 bool FakeApplicationRegistry::place(const std::vector<std::string>& items, const std::string& identifier,
                                     bool placeholder, Error* error) {
   if (items.empty()) return fail(error, "nothing to install for " + identifier);
-  const fs::path container = bundleContainerPath(identifier);
+  const fs::path container = root_ + "/Bundle/" + identifier;
   std::error_code ec;
   fs::remove_all(container, ec);
   fs::create_directories(container, ec);
@@ -169,8 +169,7 @@ void MigratorTest::TearDown() {
 
 testing::AssertionResult MigratorTest::loggedOnce(const std::string& message, bool prefix) const {
   const auto lines = log_->hostMessages();
-  const size_t count =
-      prefix ? hostMessagesStartingWith(message).size() : std::count(lines.begin(), lines.end(), message);
+  const auto count = prefix ? hostMessagesStartingWith(message).size() : std::ranges::count(lines, message);
   if (count == 1) return testing::AssertionSuccess();
   return testing::AssertionFailure() << count << " lines " << (prefix ? "start with" : "are") << " \"" << message
                                      << "\" among " << testing::PrintToString(lines);

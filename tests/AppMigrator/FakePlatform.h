@@ -47,8 +47,6 @@ class FakeApplicationRegistry final : public platform::ApplicationRegistry {
   // disk, unless `withDataContainer` is false. Returns the record.
   platform::BundleRecord addInstalledApplication(const std::string& identifier, bool withDataContainer = true);
   std::string dataContainerPath(const std::string& identifier) const { return root_ + "/Data/" + identifier; }
-  // Where an installation puts the bundles of `identifier`.
-  std::string bundleContainerPath(const std::string& identifier) const { return root_ + "/Bundle/" + identifier; }
 
   // The records, as stored whatever the knobs say.
   std::map<std::string, platform::BundleRecord> records;

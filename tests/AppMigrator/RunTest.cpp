@@ -1,5 +1,6 @@
 // The migration run: creation, the host's queries, performMigration and the
 // safe harbors it registers.
+#include <algorithm>
 #include <deque>
 
 #include "FakePlatform.h"
@@ -7,10 +8,6 @@
 
 namespace qstest {
 namespace {
-
-constexpr char kReturningFailed[] =
-    "QSAppMigrator: Returning migration failed. Please include the contents of /var/mobile/Library/Logs/Quillset "
-    "and /var/Mobile/Library/Logs/Transvale in a bug report.";
 
 class MigrationRun : public MigratorTest {
  protected:
@@ -44,7 +41,6 @@ TEST_F(MigrationRun, EmptyOldDirectoryGoesAtCreationAndTheRunRecordsTheSystemVer
   EXPECT_EQ(hostMessagesStartingWith("QSAppMigrator: Failed"),
             std::vector<std::string>{"QSAppMigrator: Failed to load existing harbor map from " + harborMapPath()});
   EXPECT_TRUE(pathExists(harborMapPath()));
-  EXPECT_TRUE(platform_->daemon.safeHarborCalls.empty());
   EXPECT_EQ(platform_->daemon.dataProtectionCalls,
             (std::vector<Dictionary>{{{platform::kQSUpdateSystemAppDataContainerDataProtection, Value(true)}}}));
   EXPECT_EQ(readPlist(versionRecordPath()), platform_->systemVersion.dictionary);
@@ -83,15 +79,14 @@ TEST_F(MigrationRun, SuccessfulRunMovesEverythingAndRemovesTheOldLayout) {
   EXPECT_EQ(migrator->countItemsMigrated(), 2u);
   // Placeholder, data, bundle, then groups.
   std::vector<std::string> callsForA;
-  for (const std::string& call : platform_->registry.calls) {
-    if (call.ends_with(" com.example.a")) callsForA.push_back(call);
-  }
+  std::ranges::copy_if(platform_->registry.calls, std::back_inserter(callsForA),
+                       [](const std::string& call) { return call.ends_with(" com.example.a"); });
   EXPECT_EQ(callsForA, (std::vector<std::string>{"isInstalled com.example.a", "installBundle com.example.a",
                                                  "recordForIdentifier com.example.a", "installPackage com.example.a",
                                                  "recordForIdentifier com.example.a"}));
   const std::string data = platform_->registry.dataContainerPath("com.example.a");
   EXPECT_EQ(readFile(data + "/Documents/letter"), "dear");
-  EXPECT_EQ(directoryNames(platform_->registry.bundleContainerPath("com.example.a")),
+  EXPECT_EQ(directoryNames(platform_->registry.records.at("com.example.a").bundleContainerURL.path()),
             (std::vector<std::string>{"Tunnel.vpnplugin", "com.example.a.app"}));
   EXPECT_EQ(
       readFile(platform_->registry.records.at("com.example.a").groupContainerURLs->at("group.a").path() + "/shared"),
@@ -139,7 +134,9 @@ TEST_F(MigrationRun, SymbolicLinkInOldDirectoryIsNeverAnEntryButKeepsTheOldLayou
   EXPECT_FALSE(pathExists(oldApplicationsPath() + "/WhereDidMyApplicationsGo.txt"));
   EXPECT_TRUE(hostMessagesStartingWith("QSAppMigrator: Found regular file").empty());
   EXPECT_TRUE(loggedOnce(remainLine(1)));
-  EXPECT_TRUE(loggedOnce(kReturningFailed));
+  EXPECT_TRUE(
+      loggedOnce("QSAppMigrator: Returning migration failed. Please include the contents of "
+                 "/var/mobile/Library/Logs/Quillset and /var/Mobile/Library/Logs/Transvale in a bug report."));
   EXPECT_TRUE(pathExists(oldApplicationsPath() + "/Link"));
   EXPECT_TRUE(pathExists(oldInstallMapPath()));
   EXPECT_FALSE(pathExists(versionRecordPath()));
