@@ -8,69 +8,58 @@
 namespace qstest {
 namespace {
 
-using platform::Data;
-using platform::Dictionary;
-using platform::Image;
-using platform::URL;
-using platform::Value;
-
-class BundleReading : public testing::Test {
- protected:
-  // A bundle whose Info.plist holds `text` (none when empty).
-  std::shared_ptr<platform::Bundle> open(const std::string& name, const std::string& text) {
-    EXPECT_TRUE(makeDirs(dir_ / name) && (text.empty() || writeFile(dir_ / name + "/Info.plist", text)));
-    return reader_.openBundle(URL::fileURL(dir_ / name, true));
-  }
-  TempDir dir_{"bundles"};
-  platform::FileBundleReader reader_;
-};
+using namespace platform;
 
 // The info dictionary gains the Info.plist's URL (the bundle's own does
-// not); the filtered one is read afresh and keeps only the keys asked for.
-TEST_F(BundleReading, ReadsTheInfoDictionaryAndAFreshFilteredInfoPlist) {
-  makeBundle(dir_ / "Notes.app", {.identifier = "com.example.notes", .version = "4.1"});
-  auto bundle = reader_.openBundle(URL::fileURL(dir_ / "Notes.app", true));
+// not); the filtered one is read afresh and keeps only the keys asked for,
+// whatever the root's type. Only a directory is a bundle; a missing or bad
+// Info.plist gives no info dictionary.
+TEST(BundleReading, InfoDictionaryAndFreshFilteredInfoPlistOfDirectoriesOnly) {
+  TempDir dir("bundles");
+  FileBundleReader reader;
+  auto open = [&](const std::string& name, const std::string& text) {
+    EXPECT_TRUE(makeDirs(dir / name) && (text.empty() || writeFile(dir / name + "/Info.plist", text)));
+    return reader.openBundle(URL::fileURL(dir / name, true));
+  };
+  makeBundle(dir / "Notes.app", {.identifier = "com.example.notes", .version = "4.1"});
+  auto bundle = reader.openBundle(URL::fileURL(dir / "Notes.app", true));
   ASSERT_TRUE(bundle);
   EXPECT_EQ(bundle->identifier(), "com.example.notes");
-  std::optional<Dictionary> info = reader_.infoDictionary(*bundle);
-  ASSERT_TRUE(info && info->at(platform::kBundleInfoPlistURLKey).asURL());
-  EXPECT_EQ(info->at(platform::kBundleVersionKey).description(), "4.1");
-  EXPECT_EQ(info->at(platform::kBundleInfoPlistURLKey).asURL()->path(), dir_ / "Notes.app/Info.plist");
-  EXPECT_FALSE(bundle->info()->count(platform::kBundleInfoPlistURLKey));
-  makeBundle(dir_ / "Notes.app", {.identifier = "com.example.changed"});
-  std::optional<Value> filtered = reader_.filteredInfoPlist(*bundle, {"RkBundleIdentifier", "RkMissing"});
-  ASSERT_TRUE(filtered && filtered->isDictionary());
-  EXPECT_EQ(*filtered->asDictionary(), (Dictionary{{"RkBundleIdentifier", "com.example.changed"}}));
-}
+  std::optional<Dictionary> info = reader.infoDictionary(*bundle);
+  ASSERT_TRUE(info && info->at(kBundleInfoPlistURLKey).asURL());
+  EXPECT_EQ(info->at(kBundleVersionKey).description(), "4.1");
+  EXPECT_EQ(info->at(kBundleInfoPlistURLKey).asURL()->path(), dir / "Notes.app/Info.plist");
+  EXPECT_FALSE(bundle->info()->count(kBundleInfoPlistURLKey));
+  makeBundle(dir / "Notes.app", {.identifier = "com.example.changed"});
+  std::optional<Value> filtered = reader.filteredInfoPlist(*bundle, {"RkBundleIdentifier", "RkMissing"});
+  EXPECT_EQ(filtered, Value(Dictionary{{"RkBundleIdentifier", "com.example.changed"}}));
 
-TEST_F(BundleReading, OpensOnlyDirectoriesAndGivesNoInfoDictionaryForAMissingOrBadInfoPlist) {
-  ASSERT_TRUE(writeFile(dir_ / "file.app", "x"));
-  EXPECT_FALSE(reader_.openBundle(URL::fileURL(dir_ / "file.app", true)));
-  EXPECT_FALSE(reader_.openBundle(URL::fileURL(dir_ / "missing.app", true)) || reader_.openBundle(URL()));
+  ASSERT_TRUE(writeFile(dir / "file.app", "x"));
+  EXPECT_FALSE(reader.openBundle(URL::fileURL(dir / "file.app", true)) || reader.openBundle(URL()) ||
+               reader.openBundle(URL::fileURL(dir / "missing.app", true)));
   auto empty = open("Empty.app", "");
   ASSERT_TRUE(empty);
-  EXPECT_FALSE(empty->info() || reader_.infoDictionary(*empty) || empty->identifier());
+  EXPECT_FALSE(empty->info() || reader.infoDictionary(*empty) || empty->identifier());
   auto array =
       open("Array.app", "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>x</string></array></plist>");
   ASSERT_TRUE(array);
-  EXPECT_FALSE(reader_.infoDictionary(*array));
-  std::optional<Value> root = reader_.filteredInfoPlist(*array, {"x"});
-  EXPECT_TRUE(root && root->isArray()) << "the root is returned as read, whatever its type";
+  EXPECT_FALSE(reader.infoDictionary(*array));
+  EXPECT_EQ(reader.filteredInfoPlist(*array, {"x"}), Value(makeStringArray({"x"})));
   auto broken = open("Broken.app", "<plist><dict><key>");
   ASSERT_TRUE(broken);
-  EXPECT_FALSE(reader_.infoDictionary(*broken) || reader_.filteredInfoPlist(*broken, {"RkBundleIdentifier"}));
+  EXPECT_FALSE(reader.infoDictionary(*broken) || reader.filteredInfoPlist(*broken, {"RkBundleIdentifier"}));
 }
 
 constexpr uint32_t kRed = 0xff0000ff, kBlue = 0x0000ffff, kGreen = 0x00ff00ff;
-constexpr int kSize = platform::kHomeScreenIconSize;
+constexpr int kSize = kHomeScreenIconSize;
 
 class IconRendering : public testing::Test {
  protected:
-  std::optional<Image> render(std::optional<Dictionary> info = Dictionary{}) {
-    return renderer_.homeScreenIconForBundle(platform::Bundle(URL::fileURL(dir_.path(), true), std::move(info)));
+  std::optional<Image> render(Dictionary info = {}) {
+    return renderer_.homeScreenIconForBundle(Bundle(URL::fileURL(dir_.path(), true), std::move(info)));
   }
   TempDir dir_{"icon"};
-  platform::CairoIconRenderer renderer_;
+  CairoIconRenderer renderer_;
 };
 
 // A 57x40 icon, blue on the left and green on the right, comes out at the
@@ -108,56 +97,42 @@ TEST_F(IconRendering, IconFileKeyChoosesAReadablePNGInsideTheBundle) {
   ASSERT_TRUE(writeSolidPNG(outside / "Evil.png", 8, 8, kRed));
   const std::string whole = readFile(dir_ / "Icon.png");
   ASSERT_TRUE(writeFile(dir_ / "Half.png", whole.substr(0, whole.size() / 2)) && writeFile(dir_ / "Junk.png", "junk"));
-  const struct {
-    Value iconFile;
-    std::optional<uint32_t> centre;
-  } cases[] = {{Value("AppIcon.png"), kBlue},
-               {Value(7), kRed},
-               {"../" + URL::fileURL(outside.path()).lastPathComponent() + "/Evil.png", {}},
-               {Value("Absent.png"), {}},
-               {Value("Junk.png"), {}},
-               {Value("Half.png"), {}}};
-  for (const auto& c : cases) {
-    const std::optional<Image> icon = render(Dictionary{{platform::kBundleIconFileKey, c.iconFile}});
-    ASSERT_EQ(icon.has_value(), c.centre.has_value()) << c.iconFile.description();
-    EXPECT_TRUE(!icon || pixelAt(*icon, kSize / 2, kSize / 2) == *c.centre) << c.iconFile.description();
+  const std::string escape = "../" + URL::fileURL(outside.path()).lastPathComponent() + "/Evil.png";
+  const std::pair<Value, std::optional<uint32_t>> cases[] = {
+      {"AppIcon.png", kBlue}, {7, kRed}, {escape, {}}, {"Absent.png", {}}, {"Junk.png", {}}, {"Half.png", {}}};
+  for (const auto& [iconFile, centre] : cases) {
+    const std::optional<Image> icon = render({{kBundleIconFileKey, iconFile}});
+    ASSERT_EQ(icon.has_value(), centre.has_value()) << iconFile.description();
+    EXPECT_TRUE(!icon || pixelAt(*icon, kSize / 2, kSize / 2) == *centre) << iconFile.description();
   }
 }
 
 Image gradient(int width, int height) {
   Image image{width, height, {}};
-  for (int y = 0; y < height; ++y) {
-    for (int x = 0; x < width; ++x)
-      image.rgba.insert(image.rgba.end(), {uint8_t(x * 7), uint8_t(y * 5), uint8_t(x + y), uint8_t(255 - x)});
+  for (int at = 0; at < width * height; ++at) {
+    image.rgba.insert(image.rgba.end(), {uint8_t(at * 7), uint8_t(at / width * 5), uint8_t(at), uint8_t(255 - at)});
   }
   return image;
 }
 
 TEST(PNGEncoding, RoundTripsPixelsExactlyAndRefusesAnythingButOneWellFormedImage) {
-  platform::PNGImageEncoding encoding;
+  PNGImageEncoding encoding;
   Data buffer;
-  auto encoder = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
-  ASSERT_TRUE(encoder);
-  encoder->addImage(gradient(33, 17));
-  ASSERT_TRUE(encoder->finalize());
+  EXPECT_FALSE(encoding.createEncoder(buffer, "public.jpeg", 1) || encoding.createEncoder(buffer, kImageTypePNG, 0) ||
+               encoding.createEncoder(buffer, kImageTypePNG, 2));
+  Image truncated = gradient(4, 4);
+  truncated.rgba.pop_back();
+  for (const std::vector<Image>& images : std::vector<std::vector<Image>>{
+           {}, {gradient(2, 2), gradient(2, 2)}, {truncated}, {Image{}}, {gradient(33, 17)}}) {
+    auto encoder = encoding.createEncoder(buffer, kImageTypePNG, 1);
+    ASSERT_TRUE(encoder);
+    for (const Image& added : images) encoder->addImage(added);
+    EXPECT_EQ(encoder->finalize(), images.size() == 1 && images[0].width == 33) << images.size();
+    EXPECT_EQ(buffer.empty(), images.size() != 1 || images[0].width != 33);
+  }
   const std::optional<Image> decoded = decodePNG(buffer);
   ASSERT_TRUE(decoded);
   EXPECT_EQ(std::tie(decoded->width, decoded->height, decoded->rgba), std::make_tuple(33, 17, gradient(33, 17).rgba));
-
-  buffer.clear();
-  EXPECT_FALSE(encoding.createEncoder(buffer, "public.jpeg", 1));
-  EXPECT_FALSE(encoding.createEncoder(buffer, platform::kImageTypePNG, 0));
-  EXPECT_FALSE(encoding.createEncoder(buffer, platform::kImageTypePNG, 2));
-  Image truncated = gradient(4, 4);
-  truncated.rgba.pop_back();
-  for (const std::vector<Image>& images :
-       std::vector<std::vector<Image>>{{}, {gradient(2, 2), gradient(2, 2)}, {truncated}, {Image{}}}) {
-    encoder = encoding.createEncoder(buffer, platform::kImageTypePNG, 1);
-    ASSERT_TRUE(encoder);
-    for (const Image& added : images) encoder->addImage(added);
-    EXPECT_FALSE(encoder->finalize()) << images.size();
-    EXPECT_TRUE(buffer.empty());
-  }
 }
 
 }  // namespace

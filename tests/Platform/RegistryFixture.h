@@ -36,6 +36,11 @@ inline platform::Dictionary customerOptions(const std::string& identifier) {
           {platform::kBundleIdentifierKey, identifier}};
 }
 
+// The error's code when it is in the registry's domain, else -1.
+inline int64_t registryCode(const platform::Error& e) {
+  return e.is(platform::kRegistryErrorDomain, e.code()) ? e.code() : -1;
+}
+
 // A bundle directory at `path` with an Info.plist and an executable "main".
 inline void makeBundle(const std::string& path, const BundleSpec& b) {
   platform::Dictionary info{{platform::kBundleVersionKey, b.version}, {platform::kBundleExecutableKey, "main"}};

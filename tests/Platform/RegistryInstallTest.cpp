@@ -12,10 +12,7 @@
 namespace qstest {
 namespace {
 
-using platform::BundleRecord;
-using platform::Dictionary;
-using platform::Error;
-using platform::Value;
+using namespace platform;
 
 using RegistryInstall = RegistryTest;
 
@@ -29,23 +26,20 @@ TEST_F(RegistryInstall, MovesBundleAndPluginIntoNewContainersAndRemovesPackage) 
                                                  "CleaningUp", "Complete"}));
   for (std::thread::id id : reporterThreads_) EXPECT_NE(id, std::this_thread::get_id()) << "from the worker thread";
   EXPECT_FALSE(exists(package));
-  for (const char* id : {"com.example.vpn", "com.example.vpn.tunnel"}) {
+  for (auto [id, type, bundle, data] :
+       {std::tuple{"com.example.vpn", kBundleTypeUser, "App.app", "Application"},
+        {"com.example.vpn.tunnel", kBundleTypeVPNPlugin, "Tunnel.vpnplugin", "PluginKitPlugin"}}) {
     std::optional<BundleRecord> r = registry->recordForIdentifier(id);
     ASSERT_TRUE(r && r->dataContainerURL && r->groupContainerURLs) << "an installed bundle has a group dictionary";
+    EXPECT_EQ(r->bundleType, type);
     EXPECT_EQ(r->bundleContainerURL.deletingLastPathComponent().path(), bundleContainers());
-    EXPECT_EQ(readFile(r->bundleURL.path() + "/main"), std::string("executable of ") + id);
-    EXPECT_TRUE(isDirectory(r->dataContainerURL->path()));
-    EXPECT_TRUE(r->groupContainerURLs->empty());
+    EXPECT_EQ(readFile(r->bundleContainerURL.path() + "/" + bundle + "/main"), std::string("executable of ") + id);
+    EXPECT_EQ(r->bundleURL.lastPathComponent(), bundle);
+    EXPECT_EQ(r->dataContainerURL->deletingLastPathComponent().lastPathComponent(), data);
+    EXPECT_TRUE(isDirectory(r->dataContainerURL->path()) && r->groupContainerURLs->empty());
   }
-  BundleRecord app = *registry->recordForIdentifier("com.example.vpn");
-  BundleRecord plugin = *registry->recordForIdentifier("com.example.vpn.tunnel");
-  EXPECT_EQ(app.bundleType, platform::kBundleTypeUser);
-  EXPECT_EQ(app.bundleURL.path(), app.bundleContainerURL.path() + "/App.app");
-  EXPECT_EQ(readFile(app.bundleContainerURL.path() + "/VendraMetadata.plist"), "metadata VendraMetadata.plist");
-  EXPECT_EQ(app.dataContainerURL->deletingLastPathComponent().path(), appDataContainers());
-  EXPECT_EQ(plugin.bundleType, platform::kBundleTypeVPNPlugin);
-  EXPECT_EQ(plugin.bundleURL.lastPathComponent(), "Tunnel.vpnplugin");
-  EXPECT_EQ(plugin.dataContainerURL->deletingLastPathComponent().lastPathComponent(), "PluginKitPlugin");
+  const std::string container = registry->recordForIdentifier("com.example.vpn")->bundleContainerURL.path();
+  EXPECT_EQ(readFile(container + "/VendraMetadata.plist"), "metadata VendraMetadata.plist");
 }
 
 TEST_F(RegistryInstall, ThrowingProgressCallbackDoesNotStopTheInstallation) {
@@ -53,7 +47,7 @@ TEST_F(RegistryInstall, ThrowingProgressCallbackDoesNotStopTheInstallation) {
   std::string package = makePackage("notes", {.identifier = "com.example.notes"});
   LogCapture log;
   EXPECT_TRUE(registry->installPackage(
-      platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
+      URL::fileURL(package, true), customerOptions("com.example.notes"),
       [](const Dictionary&) { throw std::runtime_error("callback failure"); }, nullptr));
   EXPECT_EQ(log.count("Progress callback threw on report"), 5u);
   EXPECT_TRUE(registry->isInstalled("com.example.notes"));
@@ -62,46 +56,48 @@ TEST_F(RegistryInstall, ThrowingProgressCallbackDoesNotStopTheInstallation) {
 TEST_F(RegistryInstall, OlderOrEqualToBuiltInIsRefusedAndPackageRemovedNewerIsInstalled) {
   makeBuiltIn("Clock.app", {.identifier = "com.example.clock", .version = "2.10"});
   auto registry = openRegistry();
-  for (const char* version : {"2.9", "2.10.0"}) {
+  for (const char* version : {"2.9", "2.10.0", "2.10.1"}) {
     std::string package = makePackage(version, {.identifier = "com.example.clock", .version = version});
     Error error;
-    EXPECT_FALSE(install(*registry, package, "com.example.clock", &error));
-    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorAlreadyInstalled)) << version;
-    EXPECT_EQ(errors_, std::vector<std::string>{"ApplicationAlreadyInstalled"});
+    const bool newer = version == std::string("2.10.1");
+    EXPECT_EQ(install(*registry, package, "com.example.clock", &error), newer) << version;
+    EXPECT_EQ(errors_, newer ? std::vector<std::string>{} : std::vector<std::string>{"ApplicationAlreadyInstalled"});
+    EXPECT_TRUE(newer || registryCode(error) == kRegistryErrorAlreadyInstalled) << version;
     EXPECT_FALSE(exists(package));
-    EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeSystem);
-    EXPECT_TRUE(entries(bundleContainers()).empty());
+    EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType,
+              newer ? kBundleTypeUser : kBundleTypeSystem);
+    EXPECT_EQ(entries(bundleContainers()).size(), newer ? 1u : 0u);
   }
-  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.clock", .version = "2.10.1"}));
-  EXPECT_EQ(registry->recordForIdentifier("com.example.clock")->bundleType, platform::kBundleTypeUser);
 }
 
 // Any other refusal leaves the package as it was and makes no container.
 TEST_F(RegistryInstall, BadPackagesAreRefusedAndLeftAsTheyWere) {
-  const std::string plist = "/Payload/App.app/Info.plist", invalid = "InvalidPackage";
-  const std::string arrayPlist =
-      "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>";
+  const std::string plist = "/Payload/App.app/Info.plist";
   const struct {
     const char* name;
     std::function<void(const std::string& package)> damage;  // none: the options claim another identifier
     int64_t code;
     std::string error;
   } cases[] = {
-      {"claimed", {}, platform::kRegistryErrorIdentifierMismatch, "BundleIdentifierMismatch"},
+      {"claimed", {}, kRegistryErrorIdentifierMismatch, "BundleIdentifierMismatch"},
       {"no-payload", [](auto p) { ASSERT_EQ(rename((p + "/Payload").c_str(), (p + "/P").c_str()), 0); },
-       platform::kRegistryErrorInvalidPackage, invalid},
+       kRegistryErrorInvalidPackage, "InvalidPackage"},
       {"broken-plist", [&](auto p) { ASSERT_TRUE(writeFile(p + plist, "<plist><dict><key>RkBundle")); },
-       platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist"},
-      {"array-plist", [&](auto p) { ASSERT_TRUE(writeFile(p + plist, arrayPlist)); },
-       platform::kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist"},
+       kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist"},
+      {"array-plist",
+       [&](auto p) {
+         ASSERT_TRUE(writeFile(
+             p + plist, "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>"));
+       },
+       kRegistryErrorInvalidInfoPlist, "InvalidInfoPlist"},
       {"two-apps", [&](auto p) { makeBundle(p + "/Payload/Second.app", {.identifier = "com.example.y"}); },
-       platform::kRegistryErrorInvalidPackage, invalid},
+       kRegistryErrorInvalidPackage, "InvalidPackage"},
       {"link",
        [&](auto p) {
          ASSERT_EQ(rename((p + "/Payload/App.app").c_str(), at("Real.app").c_str()), 0);
          ASSERT_EQ(symlink(at("Real.app").c_str(), (p + "/Payload/App.app").c_str()), 0);
        },
-       platform::kRegistryErrorInvalidPackage, invalid},
+       kRegistryErrorInvalidPackage, "InvalidPackage"},
   };
   auto registry = openRegistry();
   for (const auto& c : cases) {
@@ -112,7 +108,7 @@ TEST_F(RegistryInstall, BadPackagesAreRefusedAndLeftAsTheyWere) {
     std::vector<std::string> before = entries(package + "/Payload");
     Error error;
     EXPECT_FALSE(install(*registry, package, identifier, &error));
-    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, c.code)) << error.description();
+    EXPECT_EQ(registryCode(error), c.code) << error.description();
     EXPECT_FALSE(error.localizedDescription().empty());
     EXPECT_EQ(errors_, std::vector<std::string>{c.error});
     EXPECT_EQ(statuses_.back(), "Failed");
@@ -121,18 +117,15 @@ TEST_F(RegistryInstall, BadPackagesAreRefusedAndLeftAsTheyWere) {
     EXPECT_FALSE(registry->isInstalled(identifier));
   }
   EXPECT_TRUE(exists(at("Real.app/Info.plist")));
-
   // A relative location, and a placeholder type for a package.
   Error error;
-  const std::string package = at("packages/claimed");
-  EXPECT_FALSE(registry->installPackage(platform::URL::fileURL("packages/claimed", true),
-                                        customerOptions("com.example.x"), {}, &error));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage)) << error.description();
   Dictionary options = customerOptions("com.example.x");
-  options[platform::kRegistryPackageTypeKey] = Value(platform::kRegistryPackageTypePlaceholder);
-  EXPECT_FALSE(registry->installPackage(platform::URL::fileURL(package, true), options, {}, &error));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidOptions)) << error.description();
-  EXPECT_TRUE(exists(package + "/Payload/App.app"));
+  EXPECT_FALSE(registry->installPackage(URL::fileURL("packages/claimed", true), options, {}, &error));
+  EXPECT_EQ(registryCode(error), kRegistryErrorInvalidPackage);
+  options[kRegistryPackageTypeKey] = Value(kRegistryPackageTypePlaceholder);
+  EXPECT_FALSE(registry->installPackage(URL::fileURL(at("packages/claimed"), true), options, {}, &error));
+  EXPECT_EQ(registryCode(error), kRegistryErrorInvalidOptions);
+  EXPECT_TRUE(exists(at("packages/claimed/Payload/App.app")));
 }
 
 // A placeholder is a copy of a staged bundle, installed for the options'
@@ -145,17 +138,15 @@ TEST_F(RegistryInstall, PlaceholderIsACopyWhoseDataContainerOutlivesItsReplaceme
   const std::string staged = staging / "Staged.app";
   makeBundle(staged, {.identifier = "com.example.inner", .groups = {"group.game"}});
   auto placeholder = [&](const std::string& identifier, std::optional<Value> metadata, const std::string& bundle) {
-    Dictionary options{{platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypePlaceholder},
-                       {platform::kBundleIdentifierKey, identifier}};
-    if (metadata) options[platform::kRegistryStoreMetadataKey] = *metadata;
-    Error error;  // the code in the registry's domain, 0 on success
-    if (registry->installBundle(platform::URL::fileURL(bundle, true), options, &error)) return int64_t{0};
-    return error.is(platform::kRegistryErrorDomain, error.code()) ? error.code() : -1;
+    Dictionary options{{kRegistryPackageTypeKey, kRegistryPackageTypePlaceholder}, {kBundleIdentifierKey, identifier}};
+    if (metadata) options[kRegistryStoreMetadataKey] = *metadata;
+    Error error;
+    return registry->installBundle(URL::fileURL(bundle, true), options, &error) ? 0 : registryCode(error);
   };
-  ASSERT_EQ(placeholder("com.example.game", Value(platform::Data{'<', 0, 0xFF}), staged), 0);
+  ASSERT_EQ(placeholder("com.example.game", Value(Data{'<', 0, 0xFF}), staged), 0);
   EXPECT_FALSE(registry->isInstalled("com.example.inner"));
   const BundleRecord first = *registry->recordForIdentifier("com.example.game");
-  EXPECT_EQ(first.bundleType, platform::kBundleTypePlaceholder);
+  EXPECT_EQ(first.bundleType, kBundleTypePlaceholder);
   EXPECT_TRUE(first.isPlaceholder);
   EXPECT_FALSE(first.groupContainerURLs) << "a placeholder's record has no group dictionary";
   EXPECT_TRUE(entries(groupContainers()).empty());
@@ -175,101 +166,82 @@ TEST_F(RegistryInstall, PlaceholderIsACopyWhoseDataContainerOutlivesItsReplaceme
   EXPECT_FALSE(exists(second.bundleContainerURL.path()));
   EXPECT_EQ(real.groupContainerURLs->size(), 1u);
 
-  EXPECT_EQ(placeholder("com.example.game", std::nullopt, staged), platform::kRegistryErrorNotReplaceable);
-  EXPECT_EQ(placeholder("com.example.x", std::nullopt, staging / "missing.app"),
-            platform::kRegistryErrorInvalidPackage);
-  EXPECT_EQ(placeholder("com.example.x", Value("not data"), staged), platform::kRegistryErrorInvalidOptions);
+  EXPECT_EQ(placeholder("com.example.game", std::nullopt, staged), kRegistryErrorNotReplaceable);
+  EXPECT_EQ(placeholder("com.example.x", std::nullopt, staged + "x"), kRegistryErrorInvalidPackage);
+  EXPECT_EQ(placeholder("com.example.x", Value("not data"), staged), kRegistryErrorInvalidOptions);
   EXPECT_EQ(entries(bundleContainers()).size(), 1u);
+}
+
+// The protection class of a directory; -1 when the attribute is missing.
+int32_t protectionClass(const std::string& path) {
+  int32_t value = -1;
+  getxattr(path.c_str(), kProtectionClassAttributeName, &value, sizeof value);
+  return value;
 }
 
 // A built-in application's data container is made on its first lookup
 // (unless it has none) and kept; its group container is the one installed
-// applications of the group share. One added later is seen.
-TEST_F(RegistryInstall, BuiltInGetsItsContainersOnFirstLookupAndIsSeenWhenAddedLater) {
+// applications of the group share. The daemon's update puts class three on
+// every one, making those not looked up yet; a container that refuses it
+// fails the update but not the others'.
+TEST_F(RegistryInstall, BuiltInGetsItsContainersOnFirstLookupAndTheDataProtectionUpdate) {
   makeBuiltIn("Weather.app", {.identifier = "com.example.weather", .version = "3", .groups = {"group.shared"}});
   makeBuiltIn("Settings.app", {.identifier = "com.example.settings", .noDataContainer = true});
+  makeBuiltIn("Maps.app", {.identifier = "com.example.maps"});
   auto registry = openRegistry();
   EXPECT_TRUE(registry->isInstalled("com.example.weather"));
   EXPECT_TRUE(entries(appDataContainers()).empty()) << "nothing is made before the first lookup";
   EXPECT_FALSE(registry->recordForIdentifier("com.example.settings")->dataContainerURL) << "RkNoDataContainer";
   std::optional<BundleRecord> record = registry->recordForIdentifier("com.example.weather");
   ASSERT_TRUE(record && record->dataContainerURL && record->groupContainerURLs);
-  EXPECT_EQ(record->bundleType, platform::kBundleTypeSystem);
+  EXPECT_EQ(record->bundleType, kBundleTypeSystem);
   EXPECT_EQ(record->bundleURL.path(), at("Applications/Weather.app"));
   EXPECT_EQ(record->version, "3");
-  EXPECT_TRUE(isDirectory(record->dataContainerURL->path()));
   EXPECT_EQ(openRegistry()->recordForIdentifier("com.example.weather")->dataContainerURL, record->dataContainerURL);
-  EXPECT_EQ(entries(appDataContainers()).size(), 1u);
+  const std::string weather = record->dataContainerURL->path();
+  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.a", .groups = {"group.shared"}}));
+  EXPECT_EQ(registry->recordForIdentifier("com.example.a")->groupContainerURLs->at("group.shared"),
+            record->groupContainerURLs->at("group.shared"));
+  EXPECT_EQ(entries(groupContainers()).size(), 1u);
 
-  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.a", .groups = {"group.shared", "group.a"}}));
-  ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.b", .groups = {"group.shared"}}));
-  auto a = *registry->recordForIdentifier("com.example.a")->groupContainerURLs;
-  EXPECT_EQ(record->groupContainerURLs->at("group.shared"), a.at("group.shared"));
-  EXPECT_EQ(registry->recordForIdentifier("com.example.b")->groupContainerURLs->at("group.shared"),
-            a.at("group.shared"));
-  EXPECT_EQ(a.at("group.a").deletingLastPathComponent().path(), groupContainers());
-  EXPECT_EQ(entries(groupContainers()).size(), 2u);
+  const std::string update = kQSUpdateSystemAppDataContainerDataProtection;
+  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({}));
+  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{update, false}}));
+  EXPECT_EQ(protectionClass(weather), -1) << "without the option nothing changes";
+  EXPECT_EQ(entries(appDataContainers()).size(), 2u);
+  ASSERT_TRUE(setImmutable(weather, true));
+  LogCapture log;
+  EXPECT_FALSE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{update, true}}));
+  EXPECT_TRUE(log.contains("Could not update the data protection of com.example.weather"));
+  ASSERT_TRUE(setImmutable(weather, false));
+  EXPECT_EQ(protectionClass(weather), -1);
+  EXPECT_EQ(protectionClass(registry->recordForIdentifier("com.example.maps")->dataContainerURL->path()), 3);
+  ASSERT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{update, true}}));
+  EXPECT_EQ(protectionClass(weather), 3);
+  EXPECT_EQ(entries(appDataContainers()).size(), 3u) << "built-ins, but not the one without a data container";
 
   makeBuiltIn("Late.app", {.identifier = "com.example.late"});
   std::vector<std::string> all;
   for (const BundleRecord& r : registry->allRecords()) all.push_back(r.identifier);
-  EXPECT_EQ(all, (std::vector<std::string>{"com.example.a", "com.example.b", "com.example.late", "com.example.settings",
-                                           "com.example.weather"}));
+  EXPECT_EQ(all, (std::vector<std::string>{"com.example.a", "com.example.late", "com.example.maps",
+                                           "com.example.settings", "com.example.weather"}));
 }
 
-using RegistryDaemon = RegistryTest;
-
-TEST_F(RegistryDaemon, SafeHarborIsRegisteredOnlyForAnExistingDirectoryAndReplacedByTheNextOne) {
+TEST_F(RegistryInstall, SafeHarborIsRegisteredOnlyForAnExistingDirectoryAndReplacedByTheNextOne) {
   auto registry = openRegistry();
   ASSERT_TRUE(makeDirs(at("harbors/game")) && makeDirs(at("harbors/two")) && writeFile(at("harbors/file"), "x"));
   LogCapture log;
-  EXPECT_FALSE(
-      registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/missing"), "com.example.a", 2, nullptr));
+  EXPECT_FALSE(registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/none"), "com.example.a", 2, nullptr));
   EXPECT_FALSE(registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/file"), "com.example.b", 2, nullptr));
-  EXPECT_TRUE(log.contains("Safe harbor " + at("harbors/missing") + " of com.example.a is not an existing directory"));
+  EXPECT_TRUE(log.contains("Safe harbor " + at("harbors/none") + " of com.example.a is not an existing directory"));
   EXPECT_TRUE(registry->safeHarbors().empty());
   for (const char* path : {"harbors/game", "harbors/two"}) {
     EXPECT_TRUE(registry->QuillsetRegisterSafeHarborForContainerType(at(path), "com.example.game", 2, nullptr));
-    std::vector<platform::SafeHarborRecord> harbors = openRegistry()->safeHarbors();
+    std::vector<SafeHarborRecord> harbors = openRegistry()->safeHarbors();
     ASSERT_EQ(harbors.size(), 1u);
     EXPECT_EQ(std::tie(harbors[0].identifier, harbors[0].path, harbors[0].containerType),
               std::make_tuple(std::string("com.example.game"), at(path), 2));
   }
-}
-
-// The protection class of a directory; -1 when the attribute is missing.
-int32_t protectionClass(const std::string& path) {
-  int32_t value = 0;
-  return getxattr(path.c_str(), platform::kProtectionClassAttributeName, &value, sizeof value) == sizeof value ? value
-                                                                                                               : -1;
-}
-
-// Class three goes on every built-in data container, made when missing; a
-// container that refuses it fails the update but not the others'.
-TEST_F(RegistryDaemon, DataProtectionUpdateSetsClassThreeOnEverySystemDataContainer) {
-  makeBuiltIn("Mail.app", {.identifier = "com.example.mail"});
-  makeBuiltIn("Maps.app", {.identifier = "com.example.maps"});
-  makeBuiltIn("Settings.app", {.identifier = "com.example.settings", .noDataContainer = true});
-  auto registry = openRegistry();
-  std::string mail = registry->recordForIdentifier("com.example.mail")->dataContainerURL->path();
-  const std::string key = platform::kQSUpdateSystemAppDataContainerDataProtection;
-  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({}));
-  EXPECT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{key, false}}));
-  EXPECT_EQ(protectionClass(mail), -1) << "without the option nothing changes";
-  EXPECT_EQ(entries(appDataContainers()).size(), 1u);
-
-  ASSERT_TRUE(setImmutable(mail, true));
-  LogCapture log;
-  EXPECT_FALSE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{key, true}}));
-  EXPECT_TRUE(log.contains("Could not update the data protection of com.example.mail"));
-  ASSERT_TRUE(setImmutable(mail, false));
-  EXPECT_EQ(protectionClass(mail), -1);
-  std::optional<platform::URL> maps = registry->recordForIdentifier("com.example.maps")->dataContainerURL;
-  ASSERT_TRUE(maps) << "the update makes the containers not looked up yet";
-  EXPECT_EQ(protectionClass(maps->path()), 3) << "the other containers are still updated";
-  ASSERT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{key, true}}));
-  EXPECT_EQ(protectionClass(mail), 3);
-  EXPECT_EQ(entries(appDataContainers()).size(), 2u);
 }
 
 }  // namespace

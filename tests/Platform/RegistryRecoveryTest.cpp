@@ -10,8 +10,7 @@
 namespace qstest {
 namespace {
 
-using platform::BundleRecord;
-using platform::Error;
+using namespace platform;
 
 using RegistryRecovery = RegistryTest;
 
@@ -20,11 +19,11 @@ using RegistryRecovery = RegistryTest;
 bool installKilledAt(const std::string& root, const std::string& package, const std::string& id, const char* status) {
   pid_t child = fork();
   if (child == 0) {
-    auto registry = platform::SQLiteApplicationRegistry::open(root);
-    auto kill = [&](const platform::Dictionary& report) {
-      if (report.at(platform::kRegistryProgressStatusKey).description() == status) raise(SIGKILL);
+    auto registry = SQLiteApplicationRegistry::open(root);
+    auto kill = [&](const Dictionary& report) {
+      if (report.at(kRegistryProgressStatusKey).description() == status) raise(SIGKILL);
     };
-    if (registry) registry->installPackage(platform::URL::fileURL(package, true), customerOptions(id), kill, nullptr);
+    if (registry) registry->installPackage(URL::fileURL(package, true), customerOptions(id), kill, nullptr);
     _exit(3);  // the kill never came
   }
   int result = 0;
@@ -81,9 +80,9 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
     EXPECT_TRUE(install(*registry, package, id, &error)) << error.description();
     ASSERT_TRUE(makeDirs(package + "/Payload") && makeDirs(at("elsewhere/Payload")));
     EXPECT_FALSE(install(*registry, at("elsewhere"), id, &error));
-    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage));
+    EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorInvalidPackage));
     EXPECT_FALSE(install(*registry, package, "com.example.other", &error));
-    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorInvalidPackage));
+    EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorInvalidPackage));
     EXPECT_TRUE(install(*registry, package, id, &error)) << error.description();
     EXPECT_EQ(statuses_.back(), "AlreadyInstalledFromPackage");
     EXPECT_FALSE(exists(package));
@@ -123,9 +122,9 @@ TEST_F(RegistryRecovery, OpenFailsWhenTheDatabaseDirectoryCannotBeWrittenOrMade)
   for (const std::string& locked : {at("private/var/db"), database}) {
     ASSERT_TRUE(makeDirs(locked) && setImmutable(locked, true));
     Error error;
-    EXPECT_FALSE(platform::SQLiteApplicationRegistry::open(base_, &error));
+    EXPECT_FALSE(SQLiteApplicationRegistry::open(base_, &error));
     ASSERT_TRUE(setImmutable(locked, false));
-    EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorDatabase)) << error.description();
+    EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorDatabase)) << error.description();
     if (locked == database) {
       EXPECT_NE(error.localizedDescription().find(database), std::string::npos) << error.description();
     } else {
@@ -142,20 +141,20 @@ TEST_F(RegistryRecovery, CommitOrContainerThatCannotBeWrittenLeavesThePackageWho
   const std::string wal = at("private/var/db/appregistry/registry.sqlite-wal");
   std::string package = makePackage("notes", {.identifier = "com.example.notes"}, {}, {"Manifest.plist"});
   Error error;
-  auto lockTheLog = [&](const platform::Dictionary& report) {
-    if (report.at(platform::kRegistryProgressStatusKey).description() == "RegisteringApplication") {
+  auto lockTheLog = [&](const Dictionary& report) {
+    if (report.at(kRegistryProgressStatusKey).description() == "RegisteringApplication") {
       EXPECT_TRUE(setImmutable(wal, true));
     }
   };
-  EXPECT_FALSE(registry->installPackage(platform::URL::fileURL(package, true), customerOptions("com.example.notes"),
-                                        lockTheLog, &error));
+  EXPECT_FALSE(
+      registry->installPackage(URL::fileURL(package, true), customerOptions("com.example.notes"), lockTheLog, &error));
   ASSERT_TRUE(setImmutable(wal, false));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorDatabase)) << error.description();
+  EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorDatabase)) << error.description();
 
   ASSERT_TRUE(makeDirs(bundleContainers()) && setImmutable(bundleContainers(), true));
   EXPECT_FALSE(install(*registry, package, "com.example.notes", &error));
   ASSERT_TRUE(setImmutable(bundleContainers(), false));
-  EXPECT_TRUE(error.is(platform::kRegistryErrorDomain, platform::kRegistryErrorFileOperation)) << error.description();
+  EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorFileOperation)) << error.description();
   EXPECT_TRUE(error.underlyingError() && error.underlyingError()->isPOSIX(EPERM)) << error.description();
   EXPECT_EQ(errors_, std::vector<std::string>{"FileOperationFailed"});
 
