@@ -3,9 +3,8 @@
 // and the places of an image's layout as the tests expect them.
 #pragma once
 
-#include <fcntl.h>
-#include <spawn.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <openssl/evp.h>
 
@@ -18,10 +17,8 @@
 #include <gtest/gtest.h>
 
 #include "Platform/Foundation/PropertyList.h"
-#include "Platform/Foundation/Value.h"
+#include "Platform/Registry/SQLiteRegistry.h"
 #include "support/TestSupport.h"
-
-extern char** environ;
 
 namespace tooltest {
 
@@ -37,6 +34,7 @@ inline constexpr char kLastSystemVersion[] = "/private/var/quilld/Library/Quills
 inline constexpr char kSystemVersion[] = "/System/Library/CoreServices/SystemVersion.plist";
 inline constexpr char kManifest[] = "/devicegen-manifest.plist";
 inline constexpr int kUsageStatus = 64;
+inline constexpr int kNotRun = 127;  // the program could not be started
 
 struct RunResult {
   int status = -1;  // exit status; -1 when the program did not exit normally
@@ -45,36 +43,26 @@ struct RunResult {
 
 // Runs $QS_BUILD_DIR/bin/<program> with `args` and waits for it. The output
 // goes to files, which cannot fill up and stall the program.
-inline RunResult runTool(const std::string& program, const std::vector<std::string>& args) {
-  RunResult result;
-  const char* buildDir = std::getenv("QS_BUILD_DIR");
-  if (!buildDir) {
-    ADD_FAILURE() << "QS_BUILD_DIR is not set (run the tests through ctest)";
-    return result;
-  }
-  const std::string path = std::string(buildDir) + "/bin/" + program;
-  std::vector<char*> argv{const_cast<char*>(path.c_str())};
-  for (const auto& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
-  argv.push_back(nullptr);
+inline RunResult runTool(const std::string& program, std::vector<std::string> args) {
+  const char* build = std::getenv("QS_BUILD_DIR");
+  EXPECT_TRUE(build) << "QS_BUILD_DIR is not set (run the tests through ctest)";
+  args.insert(args.begin(), std::string(build ? build : "") + "/bin/" + program);
   qstest::TempDir output("output");
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, (output / "out").c_str(), O_WRONLY | O_CREAT, 0600);
-  posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, (output / "err").c_str(), O_WRONLY | O_CREAT, 0600);
-  pid_t pid = -1;
-  int status = 0;
-  const int spawned = posix_spawn(&pid, path.c_str(), &actions, nullptr, argv.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  if (spawned != 0) {
-    ADD_FAILURE() << "cannot run " << path;
-    return result;
+  const pid_t pid = fork();
+  if (pid == 0) {
+    if (!freopen((output / "out").c_str(), "w", stdout) || !freopen((output / "err").c_str(), "w", stderr))
+      _exit(kNotRun);
+    std::vector<char*> argv;
+    for (std::string& arg : args) argv.push_back(arg.data());
+    argv.push_back(nullptr);
+    execv(argv[0], argv.data());
+    _exit(kNotRun);
   }
+  int status = 0;
   while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
   }
-  result.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-  result.out = qstest::readFile(output / "out");
-  result.err = qstest::readFile(output / "err");
-  return result;
+  return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, qstest::readFile(output / "out"),
+          qstest::readFile(output / "err")};
 }
 
 // Every item below `root` (not following links) by path relative to it:
