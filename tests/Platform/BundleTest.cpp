@@ -17,37 +17,35 @@ using namespace platform;
 TEST(BundleReading, InfoDictionaryAndFreshFilteredInfoPlistOfDirectoriesOnly) {
   TempDir dir("bundles");
   FileBundleReader reader;
-  auto open = [&](const std::string& name, const std::string& text) {
+  auto open = [&](const std::string& name, const std::string& text) {  // text: the Info.plist's, if any
     EXPECT_TRUE(makeDirs(dir / name) && (text.empty() || writeFile(dir / name + "/Info.plist", text)));
     return reader.openBundle(URL::fileURL(dir / name, true));
   };
   makeBundle(dir / "Notes.app", {.identifier = "com.example.notes", .version = "4.1"});
-  auto bundle = reader.openBundle(URL::fileURL(dir / "Notes.app", true));
+  auto bundle = open("Notes.app", "");
   ASSERT_TRUE(bundle);
   EXPECT_EQ(bundle->identifier(), "com.example.notes");
+  EXPECT_EQ(bundle->description(), "RkBundle " + dir / "Notes.app" + " (not loaded)");
   std::optional<Dictionary> info = reader.infoDictionary(*bundle);
   ASSERT_TRUE(info && info->at(kBundleInfoPlistURLKey).asURL());
   EXPECT_EQ(info->at(kBundleVersionKey).description(), "4.1");
   EXPECT_EQ(info->at(kBundleInfoPlistURLKey).asURL()->path(), dir / "Notes.app/Info.plist");
   EXPECT_FALSE(bundle->info()->count(kBundleInfoPlistURLKey));
   makeBundle(dir / "Notes.app", {.identifier = "com.example.changed"});
-  std::optional<Value> filtered = reader.filteredInfoPlist(*bundle, {"RkBundleIdentifier", "RkMissing"});
-  EXPECT_EQ(filtered, Value(Dictionary{{"RkBundleIdentifier", "com.example.changed"}}));
+  EXPECT_EQ(reader.filteredInfoPlist(*bundle, {"RkBundleIdentifier", "RkMissing"}),
+            Value(Dictionary{{"RkBundleIdentifier", "com.example.changed"}}));
 
   ASSERT_TRUE(writeFile(dir / "file.app", "x"));
   EXPECT_FALSE(reader.openBundle(URL::fileURL(dir / "file.app", true)) || reader.openBundle(URL()) ||
                reader.openBundle(URL::fileURL(dir / "missing.app", true)));
-  auto empty = open("Empty.app", "");
-  ASSERT_TRUE(empty);
-  EXPECT_FALSE(empty->info() || reader.infoDictionary(*empty) || empty->identifier());
+  auto empty = open("Empty.app", ""), broken = open("Broken.app", "<plist><dict><key>");
   auto array =
       open("Array.app", "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>x</string></array></plist>");
-  ASSERT_TRUE(array);
-  EXPECT_FALSE(reader.infoDictionary(*array));
+  ASSERT_TRUE(empty && array && broken);
+  EXPECT_FALSE(empty->info() || reader.infoDictionary(*empty) || empty->identifier());
+  EXPECT_FALSE(reader.infoDictionary(*array) || reader.infoDictionary(*broken) ||
+               reader.filteredInfoPlist(*broken, {"RkBundleIdentifier"}));
   EXPECT_EQ(reader.filteredInfoPlist(*array, {"x"}), Value(makeStringArray({"x"})));
-  auto broken = open("Broken.app", "<plist><dict><key>");
-  ASSERT_TRUE(broken);
-  EXPECT_FALSE(reader.infoDictionary(*broken) || reader.filteredInfoPlist(*broken, {"RkBundleIdentifier"}));
 }
 
 constexpr uint32_t kRed = 0xff0000ff, kBlue = 0x0000ffff, kGreen = 0x00ff00ff;

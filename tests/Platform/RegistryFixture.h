@@ -6,13 +6,8 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <memory>
-#include <string>
-#include <thread>
-#include <vector>
 
 #include "Platform/BundleReader.h"
-#include "Platform/Foundation/Error.h"
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Registry/SQLiteRegistry.h"
 #include "support/TestSupport.h"
@@ -46,8 +41,7 @@ inline void makeBundle(const std::string& path, const BundleSpec& b) {
   platform::Dictionary info{{platform::kBundleVersionKey, b.version}, {platform::kBundleExecutableKey, "main"}};
   if (!b.identifier.empty()) info[platform::kBundleIdentifierKey] = b.identifier;
   if (b.noDataContainer) info[platform::kNoDataContainerKey] = true;
-  platform::Array groups(b.groups.begin(), b.groups.end());
-  if (!groups.empty()) info[platform::kApplicationGroupsKey] = groups;
+  if (!b.groups.empty()) info[platform::kApplicationGroupsKey] = platform::Array(b.groups.begin(), b.groups.end());
   ASSERT_TRUE(makeDirs(path) && platform::plist::writeFile(info, platform::URL::fileURL(path + "/Info.plist")));
   ASSERT_TRUE(writeFile(path + "/main", "executable of " + b.identifier));
 }
@@ -73,22 +67,20 @@ class RegistryTest : public testing::Test {
     for (const std::string& file : metadataFiles) EXPECT_TRUE(writeFile(package + "/" + file, "metadata " + file));
     return package;
   }
-  std::string makeBuiltIn(const std::string& name, const BundleSpec& bundle) {
+  void makeBuiltIn(const std::string& name, const BundleSpec& bundle) {
     makeBundle(at("Applications/" + name), bundle);
-    return at("Applications/" + name);
   }
   // Installs a package for `identifier`, collecting the progress reports'
-  // statuses and errors and the threads they came from.
+  // statuses and errors.
   bool install(Registry& registry, const std::string& package, const std::string& identifier,
                platform::Error* error = nullptr) {
-    statuses_.clear(), errors_.clear(), reporterThreads_.clear();
+    statuses_.clear(), errors_.clear();
     return registry.installPackage(
         platform::URL::fileURL(package, true), customerOptions(identifier),
         [this](const platform::Dictionary& report) {
           auto error = report.find(platform::kRegistryProgressErrorKey);
           if (error != report.end()) errors_.push_back(error->second.description());
           statuses_.push_back(report.at(platform::kRegistryProgressStatusKey).description());
-          reporterThreads_.push_back(std::this_thread::get_id());
         },
         error);
   }
@@ -104,7 +96,6 @@ class RegistryTest : public testing::Test {
   }
 
   std::vector<std::string> statuses_, errors_;
-  std::vector<std::thread::id> reporterThreads_;
 
   std::string bundleContainers() const { return at("private/var/containers/Bundle/Application"); }
   std::string appDataContainers() const { return at("private/var/mobile/Containers/Data/Application"); }
