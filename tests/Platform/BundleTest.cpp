@@ -21,19 +21,19 @@ TEST(BundleReading, InfoDictionaryAndFreshFilteredInfoPlistOfDirectoriesOnly) {
     EXPECT_TRUE(makeDirs(dir / name) && (text.empty() || writeFile(dir / name + "/Info.plist", text)));
     return reader.openBundle(URL::fileURL(dir / name, true));
   };
-  makeBundle(dir / "Notes.app", {.identifier = "com.example.notes", .version = "4.1"});
+  makeBundle(dir / "Notes.app", {.identifier = "ex.notes", .version = "4.1"});
   auto bundle = open("Notes.app", "");
   ASSERT_TRUE(bundle);
-  EXPECT_EQ(bundle->identifier(), "com.example.notes");
+  EXPECT_EQ(bundle->identifier(), "ex.notes");
   EXPECT_EQ(bundle->description(), "RkBundle " + dir / "Notes.app" + " (not loaded)");
   std::optional<Dictionary> info = reader.infoDictionary(*bundle);
   ASSERT_TRUE(info && info->at(kBundleInfoPlistURLKey).asURL());
   EXPECT_EQ(info->at(kBundleVersionKey).description(), "4.1");
   EXPECT_EQ(info->at(kBundleInfoPlistURLKey).asURL()->path(), dir / "Notes.app/Info.plist");
   EXPECT_FALSE(bundle->info()->count(kBundleInfoPlistURLKey));
-  makeBundle(dir / "Notes.app", {.identifier = "com.example.changed"});
+  makeBundle(dir / "Notes.app", {.identifier = "ex.changed"});
   EXPECT_EQ(reader.filteredInfoPlist(*bundle, {"RkBundleIdentifier", "RkMissing"}),
-            Value(Dictionary{{"RkBundleIdentifier", "com.example.changed"}}));
+            Value(Dictionary{{"RkBundleIdentifier", "ex.changed"}}));
 
   ASSERT_TRUE(writeFile(dir / "file.app", "x"));
   EXPECT_FALSE(reader.openBundle(URL::fileURL(dir / "file.app", true)) || reader.openBundle(URL()) ||
@@ -51,21 +51,18 @@ TEST(BundleReading, InfoDictionaryAndFreshFilteredInfoPlistOfDirectoriesOnly) {
 constexpr uint32_t kRed = 0xff0000ff, kBlue = 0x0000ffff, kGreen = 0x00ff00ff;
 constexpr int kSize = kHomeScreenIconSize;
 
-class IconRendering : public testing::Test {
- protected:
-  std::optional<Image> render(Dictionary info = {}) {
-    return renderer_.homeScreenIconForBundle(Bundle(URL::fileURL(dir_.path(), true), std::move(info)));
-  }
-  TempDir dir_{"icon"};
-  CairoIconRenderer renderer_;
-};
+// The home-screen icon of the bundle at `dir`.
+std::optional<Image> render(const TempDir& dir, Dictionary info = {}) {
+  return CairoIconRenderer().homeScreenIconForBundle(Bundle(URL::fileURL(dir.path(), true), std::move(info)));
+}
 
 // A 57x40 icon, blue on the left and green on the right, comes out at the
 // home-screen size with its layout kept, masked to a rounded square whose
 // edge is straight (not premultiplied) alpha.
-TEST_F(IconRendering, DefaultIconIsScaledAndMaskedWithStraightAlpha) {
-  ASSERT_TRUE(writeSplitPNG(dir_ / "Icon.png", 57, 40, kBlue, kGreen));
-  const std::optional<Image> icon = render();
+TEST(IconRendering, DefaultIconIsScaledAndMaskedWithStraightAlpha) {
+  TempDir dir("icon");
+  ASSERT_TRUE(writeSplitPNG(dir / "Icon.png", 57, 40, kBlue, kGreen));
+  const std::optional<Image> icon = render(dir);
   ASSERT_TRUE(icon);
   ASSERT_EQ(std::tie(icon->width, icon->height), std::make_tuple(kSize, kSize));
   ASSERT_EQ(icon->rgba.size(), static_cast<size_t>(kSize * kSize * 4));
@@ -89,17 +86,18 @@ TEST_F(IconRendering, DefaultIconIsScaledAndMaskedWithStraightAlpha) {
 // The icon-file key names a file inside the bundle; a value that is not a
 // string falls back to Icon.png; a name leading outside, a missing, garbage
 // or truncated file gives none.
-TEST_F(IconRendering, IconFileKeyChoosesAReadablePNGInsideTheBundle) {
-  ASSERT_TRUE(writeSolidPNG(dir_ / "Icon.png", 8, 8, kRed) && writeSolidPNG(dir_ / "AppIcon.png", 8, 8, kBlue));
+TEST(IconRendering, IconFileKeyChoosesAReadablePNGInsideTheBundle) {
+  TempDir dir("icon");
+  ASSERT_TRUE(writeSolidPNG(dir / "Icon.png", 8, 8, kRed) && writeSolidPNG(dir / "AppIcon.png", 8, 8, kBlue));
   TempDir outside("outside");
   ASSERT_TRUE(writeSolidPNG(outside / "Evil.png", 8, 8, kRed));
-  const std::string whole = readFile(dir_ / "Icon.png");
-  ASSERT_TRUE(writeFile(dir_ / "Half.png", whole.substr(0, whole.size() / 2)) && writeFile(dir_ / "Junk.png", "junk"));
+  const std::string whole = readFile(dir / "Icon.png");
+  ASSERT_TRUE(writeFile(dir / "Half.png", whole.substr(0, whole.size() / 2)) && writeFile(dir / "Junk.png", "junk"));
   const std::string escape = "../" + URL::fileURL(outside.path()).lastPathComponent() + "/Evil.png";
   const std::pair<Value, std::optional<uint32_t>> cases[] = {
       {"AppIcon.png", kBlue}, {7, kRed}, {escape, {}}, {"Absent.png", {}}, {"Junk.png", {}}, {"Half.png", {}}};
   for (const auto& [iconFile, centre] : cases) {
-    const std::optional<Image> icon = render({{kBundleIconFileKey, iconFile}});
+    const std::optional<Image> icon = render(dir, {{kBundleIconFileKey, iconFile}});
     ASSERT_EQ(icon.has_value(), centre.has_value()) << iconFile.description();
     EXPECT_TRUE(!icon || pixelAt(*icon, kSize / 2, kSize / 2) == *centre) << iconFile.description();
   }

@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <filesystem>
+#include <functional>
 
 #include "Platform/BundleReader.h"
 #include "Platform/Foundation/PropertyList.h"
@@ -71,16 +72,17 @@ class RegistryTest : public testing::Test {
     makeBundle(at("Applications/" + name), bundle);
   }
   // Installs a package for `identifier`, collecting the progress reports'
-  // statuses and errors.
+  // statuses and errors, and doing `action` when the status is `at`.
   bool install(Registry& registry, const std::string& package, const std::string& identifier,
-               platform::Error* error = nullptr) {
+               platform::Error* error = nullptr, const std::string& at = "", std::function<void()> action = {}) {
     statuses_.clear(), errors_.clear();
     return registry.installPackage(
         platform::URL::fileURL(package, true), customerOptions(identifier),
-        [this](const platform::Dictionary& report) {
+        [&, this](const platform::Dictionary& report) {
           auto error = report.find(platform::kRegistryProgressErrorKey);
           if (error != report.end()) errors_.push_back(error->second.description());
           statuses_.push_back(report.at(platform::kRegistryProgressStatusKey).description());
+          if (statuses_.back() == at) action();
         },
         error);
   }
