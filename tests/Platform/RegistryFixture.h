@@ -26,9 +26,9 @@ struct BundleSpec {
 // The install options the migrator passes for a staged application.
 inline platform::Dictionary customerOptions(const std::string& identifier) {
   return {{platform::kRegistryInstallTypeKey, platform::Value(6u)},
-          {platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypeCustomer},
           {"VerifyForMigrator", true},
           {"SkipBlacklist", true},
+          {platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypeCustomer},
           {platform::kBundleIdentifierKey, identifier}};
 }
 
