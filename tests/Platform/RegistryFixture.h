@@ -23,12 +23,9 @@ struct BundleSpec {
   bool noDataContainer = false;
 };
 
-// The install options the migrator passes for a staged application.
+// The install options of a staged application.
 inline platform::Dictionary customerOptions(const std::string& identifier) {
-  return {{platform::kRegistryInstallTypeKey, platform::Value(6u)},
-          {"VerifyForMigrator", true},
-          {"SkipBlacklist", true},
-          {platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypeCustomer},
+  return {{platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypeCustomer},
           {platform::kBundleIdentifierKey, identifier}};
 }
 
@@ -68,9 +65,7 @@ class RegistryTest : public testing::Test {
     for (const std::string& file : metadataFiles) EXPECT_TRUE(writeFile(package + "/" + file, "metadata " + file));
     return package;
   }
-  void makeBuiltIn(const std::string& name, const BundleSpec& bundle) {
-    makeBundle(at("Applications/" + name), bundle);
-  }
+  void makeBuiltIn(const std::string& name, const BundleSpec& b) { makeBundle(at("Applications/" + name), b); }
   // Installs a package for `identifier`, collecting the progress reports'
   // statuses and errors, and doing `action` when the status is `at`.
   bool install(Registry& registry, const std::string& package, const std::string& identifier,
@@ -86,13 +81,11 @@ class RegistryTest : public testing::Test {
         },
         error);
   }
-  // Packs `bundle` (and `plugin`) into a fresh package and installs it,
-  // failing the test when the registry refuses it.
-  bool installApp(Registry& registry, const BundleSpec& bundle, const BundleSpec& plugin = {}) {
+  // Packs `b` into a fresh package and installs it, failing the test when
+  // the registry refuses it.
+  bool installApp(Registry& r, const BundleSpec& b) {
     platform::Error error;
-    const bool installed =
-        install(registry, makePackage(bundle.identifier + std::to_string(++packages_), bundle, plugin),
-                bundle.identifier, &error);
+    const bool installed = install(r, makePackage(b.identifier + std::to_string(++made_), b), b.identifier, &error);
     EXPECT_TRUE(installed) << error.description();
     return installed;
   }
@@ -116,12 +109,11 @@ class RegistryTest : public testing::Test {
     std::sort(names.begin(), names.end());
     return names;
   }
-  static bool isDirectory(const std::string& path) { return std::filesystem::is_directory(path); }
   static bool exists(const std::string& path) { return std::filesystem::exists(std::filesystem::symlink_status(path)); }
 
   TempDir root_{"registry"};
   std::string base_ = root_.path();  // the system root: the temporary directory unless a test names another
-  int packages_ = 0;
+  int made_ = 0;                     // packages made by installApp
 };
 
 }  // namespace qstest
