@@ -11,15 +11,14 @@ using namespace platform;
 
 // The info dictionary gains the Info.plist's URL (the bundle's own does
 // not); the filtered one is read afresh and keeps only the keys asked for,
-// whatever the root's type. Only a directory is a bundle; an Info.plist that
-// is no dictionary gives no info dictionary.
+// whatever the root's type. Only a directory is a bundle; a missing Info.plist
+// or one that is no dictionary gives no info dictionary.
 TEST(BundleReading, InfoDictionaryAndFreshFilteredInfoPlistOfDirectoriesOnly) {
   TempDir dir("bundles");
   FileBundleReader reader;
   makeBundle(dir / "Notes.app", {.identifier = "ex.notes"});
   auto bundle = reader.openBundle(URL::fileURL(dir / "Notes.app", true));
-  ASSERT_TRUE(bundle);
-  EXPECT_EQ(bundle->identifier(), "ex.notes");
+  ASSERT_TRUE(bundle && bundle->identifier() == "ex.notes");
   EXPECT_EQ(bundle->description(), "RkBundle " + dir / "Notes.app" + " (not loaded)");
   std::optional<Dictionary> info = reader.infoDictionary(*bundle);
   ASSERT_TRUE(info && info->at(kBundleInfoPlistURLKey).asURL());
@@ -34,9 +33,10 @@ TEST(BundleReading, InfoDictionaryAndFreshFilteredInfoPlistOfDirectoriesOnly) {
                reader.openBundle(URL::fileURL(dir / "missing.app", true)));
   ASSERT_TRUE(writeFile(dir / "Notes.app/Info.plist",
                         "<?xml version=\"1.0\"?><plist><array><string>x</string></array></plist>"));
-  auto array = reader.openBundle(URL::fileURL(dir / "Notes.app", true));
-  ASSERT_TRUE(array);
-  EXPECT_FALSE(array->info() || reader.infoDictionary(*array) || array->identifier());
+  for (const std::string& bad : {dir / "Notes.app", dir.path()}) {  // an array, and no Info.plist at all
+    auto opened = reader.openBundle(URL::fileURL(bad, true));
+    EXPECT_TRUE(opened && !opened->info() && !reader.infoDictionary(*opened) && !opened->identifier()) << bad;
+  }
   EXPECT_EQ(reader.filteredInfoPlist(*bundle, {"x"}), Value(makeStringArray({"x"})));
 }
 
