@@ -16,7 +16,7 @@
 namespace qstest {
 
 // What goes into a test bundle's Info.plist (no identifier key when empty).
-struct BundleSpec {
+struct TestBundle {
   std::string identifier;
   std::string version = "1.0";
   std::vector<std::string> groups = {};
@@ -35,7 +35,7 @@ inline int64_t registryCode(const platform::Error& e) {
 }
 
 // A bundle directory at `path` with an Info.plist and an executable "main".
-inline void makeBundle(const std::string& path, const BundleSpec& b) {
+inline void makeBundle(const std::string& path, const TestBundle& b) {
   platform::Dictionary info{{platform::kBundleVersionKey, b.version}, {platform::kBundleExecutableKey, "main"}};
   if (!b.identifier.empty()) info[platform::kBundleIdentifierKey] = b.identifier;
   if (b.noDataContainer) info[platform::kNoDataContainerKey] = true;
@@ -57,7 +57,7 @@ class RegistryTest : public testing::Test {
   }
   // packages/<name>: Payload/App.app for `app`, Payload/Tunnel.vpnplugin for
   // `plugin` (when it has an identifier), store-metadata files beside Payload.
-  std::string makePackage(const std::string& name, const BundleSpec& app, const BundleSpec& plugin = {},
+  std::string makePackage(const std::string& name, const TestBundle& app, const TestBundle& plugin = {},
                           const std::vector<std::string>& metadataFiles = {}) {
     std::string package = at("packages/" + name);
     makeBundle(package + "/Payload/App.app", app);
@@ -65,7 +65,7 @@ class RegistryTest : public testing::Test {
     for (const std::string& file : metadataFiles) EXPECT_TRUE(writeFile(package + "/" + file, "metadata " + file));
     return package;
   }
-  void makeBuiltIn(const std::string& name, const BundleSpec& b) { makeBundle(at("Applications/" + name), b); }
+  void makeBuiltIn(const std::string& name, const TestBundle& b) { makeBundle(at("Applications/" + name), b); }
   // Installs a package for `identifier`, collecting the progress reports'
   // statuses and errors, and doing `action` when the status is `at`.
   bool install(Registry& registry, const std::string& package, const std::string& identifier,
@@ -83,7 +83,7 @@ class RegistryTest : public testing::Test {
   }
   // Packs `b` into a fresh package and installs it, failing the test when
   // the registry refuses it.
-  bool installApp(Registry& r, const BundleSpec& b) {
+  bool installApp(Registry& r, const TestBundle& b) {
     platform::Error error;
     const bool installed = install(r, makePackage(b.identifier + std::to_string(++made_), b), b.identifier, &error);
     EXPECT_TRUE(installed) << error.description();

@@ -82,7 +82,7 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
 
 TEST_F(RegistryRecovery, ReadersSeeWholeRecordsWhileAnotherThreadInstalls) {
   auto registry = openRegistry();
-  const BundleSpec app{.identifier = "ex.app", .version = "0", .groups = {"group.g"}};
+  const TestBundle app{.identifier = "ex.app", .version = "0", .groups = {"group.g"}};
   ASSERT_TRUE(installApp(*registry, app));
   const auto data = registry->recordForIdentifier(app.identifier)->dataContainerURL;
   std::atomic<int> inconsistent{0}, lookups{0}, installing{1};
