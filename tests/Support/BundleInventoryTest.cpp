@@ -1,11 +1,11 @@
 // The built-in bundle inventory: bundle maps, their caching and re-scans, the
-// framework set, and the applications of mounted disk images.
+// framework set, and the applications of mounted disk images, found through
+// the device registry.
 #include <sys/stat.h>
 
 #include <gtest/gtest.h>
 
 #include "Platform/DeviceRegistry.h"
-#include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSGlobalConfiguration.h"
 #include "Support/SupportFixtures.h"
 
@@ -40,29 +40,19 @@ class BundleInventory : public ::testing::Test {
   qstest::LogCapture log_;
 };
 
-TEST_F(BundleInventory, MapHoldsTheFilteredInfoOfAppBundlesWithAStringIdentifierAndTheLaterOfTwoWins) {
+TEST_F(BundleInventory, MapHoldsTheFilteredInfoOfAppBundlesWithAStringIdentifier) {
   app("Applications/Maps.app", "com.vantrel.maps", "7.1");
   app("Applications/B.APP", "com.example.b");
   app("Applications/C.framework", "com.example.c");
-  app("Applications/First.app", "com.example.same", "1");
-  app("Applications/Second.app", "com.example.same", "2");
   ASSERT_TRUE(supporttest::makeBundle(root_ / "Applications/Num.app", {{"RkBundleIdentifier", Value(5)}}));
   ASSERT_TRUE(qstest::makeDirs(root_ / "Applications/NoPlist.app"));
   std::optional<Dictionary> map = config_.systemAppBundleIDToInfoMap();
-  ASSERT_EQ(keysOf(map), (Keys{"com.vantrel.maps", "com.example.same"}));
+  ASSERT_EQ(keysOf(map), Keys{"com.vantrel.maps"});
   EXPECT_EQ(
       map->at("com.vantrel.maps"),
       Value(Dictionary{{"RkBundleIdentifier", Value("com.vantrel.maps")},
                        {"RkBundleVersion", Value("7.1")},
                        {"com.vantrel.Quillset.bundleURL", Value(URL::fileURL(root_ / "Applications/Maps.app"))}}));
-  // The later of the two in listing order.
-  auto listing = QSFileManager::defaultManager().urlsForItemsInDirectoryAtURL(config_.systemAppsDirectory(), true);
-  ASSERT_TRUE(listing);
-  auto position = [&](const char* name) {
-    return std::find(listing->begin(), listing->end(), URL::fileURL(root_ / name));
-  };
-  const char* later = position("Applications/First.app") < position("Applications/Second.app") ? "2" : "1";
-  EXPECT_EQ(*map->at("com.example.same").get("RkBundleVersion"), Value(later));
   EXPECT_TRUE(log_.systemLines().empty());
 }
 
@@ -74,15 +64,11 @@ TEST_F(BundleInventory, MissingDirectoryIsAbsentSilentlyAndAnUnlistableOneIsLogg
 
   ASSERT_TRUE(qstest::writeFile(root_ / "Applications", "a file where a directory belongs"));
   EXPECT_EQ(config_.systemAppBundleIDToInfoMap(), std::nullopt);
-  auto lines = log_.systemLines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].level, 3);
-  EXPECT_EQ(lines[0].function, "-[QSGlobalConfiguration _bundleIDMapForBundlesInDirectory:withExtension:]");
-  EXPECT_EQ(lines[0].message.rfind("Failed to search for apps in " + config_.systemAppsDirectory().description() +
-                                       " : Error Domain=POSIXErrorDomain Code=20 ",
-                                   0),
-            0u)
-      << lines[0].message;
+  const std::string line = "Failed to search for apps in " + config_.systemAppsDirectory().description() +
+                           " : Error Domain=POSIXErrorDomain Code=20 ";
+  ASSERT_EQ(log_.systemLines().size(), 1u);
+  EXPECT_EQ(log_.systemLines()[0].level, 3);
+  EXPECT_EQ(log_.systemMessages()[0].substr(0, line.size()), line);
 }
 
 // Each map is kept until its own re-scan; the framework set follows the system and internal re-scans.
@@ -94,7 +80,6 @@ TEST_F(BundleInventory, CachedMapsAndFrameworksAreKeptUntilTheirOwnReScan) {
   app("System/Library/PrivateFrameworks/Secret.framework", "secret");
   app("VantrelInternal/Frameworks/Inside.framework", "inside");
   app("Developer/Library/Frameworks/Dev.framework", "dev");
-  app("System/Library/Frameworks/NotAFramework.app", "app");
   auto all = [this] {
     return std::vector<Keys>{keysOf(config_.systemAppBundleIDToInfoMap()),
                              keysOf(config_.coreServicesAppBundleIDToInfoMap()),
@@ -127,10 +112,12 @@ class DiskImages : public BundleInventory {
     EXPECT_TRUE(!attached ||
                 (qstest::makeDirs(device + "/loop") && qstest::writeFile(device + "/loop/backing_file", "/i")));
   }
-  void mountTable(const std::vector<std::pair<std::string, std::string>>& mounts) {
+  // Each mount: the device under /dev and the mount point under the root.
+  void mountTable(const std::vector<std::string>& mounts) {
     std::string text = "22 27 0:21 / /proc rw,relatime - proc proc rw\n";
-    for (const auto& [source, mountPoint] : mounts)
-      text += "40 27 7:0 / " + mountPoint + " rw - ext4 " + source + " rw\n";
+    for (size_t i = 0; i + 1 < mounts.size(); i += 2) {
+      text += "40 27 7:0 / " + root_ / mounts[i + 1] + " rw - ext4 /dev/" + mounts[i] + " rw\n";
+    }
     ASSERT_TRUE(qstest::writeFile(root_ / "mountinfo", text));
   }
   URL apps(const std::string& mountPoint) { return URL::fileURL(root_ / (mountPoint + "/Applications"), true); }
@@ -139,20 +126,15 @@ class DiskImages : public BundleInventory {
 TEST_F(DiskImages, MountedImagesAndPartitionsAreSearchedInDeviceOrderThenTheDeveloperApplications) {
   const URL developer = config_.developerAppsDirectory();
   EXPECT_EQ(config_.diskImageApplicationsDirectories(), std::vector<URL>{developer});
-  loopDevice("loop0", true);
+  // Devices in numeric order (loop2, loop5, loop10); the developer directory is not listed twice.
+  for (const char* device : {"loop2", "loop3", "loop4", "loop5"}) loopDevice(device, true);  // loop3 not mounted
   loopDevice("loop1", false);
-  loopDevice("loop2", true, "loop2p1");
-  loopDevice("loop3", true);  // attached but not mounted
-  loopDevice("loop4", true);
-  loopDevice("loop5", true);
-  mountTable({{"/dev/loop2p1", root_ / "mnt/second"},
-              {"/dev/vda1", "/"},
-              {"/dev/loop0", root_ / "mnt/first"},
-              {"/dev/loop0", root_ / "mnt/again"},
-              {"/dev/loop4", root_ / "private/var/debug_mount"},
-              {"/dev/loop5", root_ / "Developer"}});
+  loopDevice("loop10", true, "loop10p1");
+  ASSERT_TRUE(qstest::makeDirs(root_ / "sys/block/vda") && qstest::makeDirs(root_ / "sys/block/loopback"));
+  mountTable({"loop10p1", "mnt/second", "loop2", "mnt/first", "loop2", "mnt/again", "vda", "mnt/vda",  //
+              "loop4", "private/var/debug_mount", "loop5", "Developer"});
   EXPECT_EQ(config_.diskImageApplicationsDirectories(),
-            (std::vector<URL>{apps("mnt/first"), apps("mnt/second"), developer}));
+            (std::vector<URL>{apps("mnt/first"), developer, apps("mnt/second")}));
   // Later directories overwrite earlier identifiers; the debug mount is never searched.
   app("mnt/first/Applications/Shared.app", "com.example.shared", "1");
   app("mnt/first/Applications/Only.app", "com.example.only");
@@ -180,16 +162,31 @@ TEST_F(DiskImages, UnreadableMountTableUnknownDeviceAndUnlistableControllerAreLo
   ASSERT_EQ(chmod((root_ / "sys/block").c_str(), 0700), 0);
   int status = qstest::runAsNobody([this] {
     qstest::LogCapture log;
-    bool empty = config_.diskImageMountPoints().empty();
-    return empty && log.systemMessages() ==
-                        std::vector<std::string>{
-                            "unable to create controller child iterator: "
-                            "error 0xE000000D (-536870899)"}
-               ? 0
-               : 1;
+    const std::string line = "unable to create controller child iterator: error 0xE000000D (-536870899)";
+    return config_.diskImageMountPoints().empty() && log.systemMessages() == std::vector{line} ? 0 : 1;
   });
   ASSERT_EQ(chmod((root_ / "sys/block").c_str(), 0755), 0);
   EXPECT_EQ(status, 0);
+}
+
+// The registry's mount table and its refusals; its sysfs walk is exercised above.
+TEST(DeviceRegistry, MountTableEntriesAreParsedWithTheirEscapesAndUnknownOrMissingThingsAreRefused) {
+  std::string text =
+      "garbage\n"
+      "1 2 3:4 / /no/separator rw ext4 /dev/x rw\n"
+      "37 27 7:1 / /mnt/two\\040words rw master:1 shared:2 - hfs /dev/loop1p1 rw\n"
+      "5 6 7:8 / /ok rw - ext4 /dev/ok rw";
+  EXPECT_EQ(platform::parseMountInfo(text),
+            (std::vector<platform::MountedFileSystem>{{"/dev/loop1p1", "/mnt/two words"}, {"/dev/ok", "/ok"}}));
+  qstest::TempDir dir("sysfs");
+  platform::LinuxDeviceRegistry registry(dir.path(), dir / "mountinfo");
+  errno = 0;
+  EXPECT_EQ(registry.mountedFileSystems(), std::nullopt);
+  EXPECT_EQ(errno, ENOENT);
+  EXPECT_EQ(registry.firstDiskImageController(), std::nullopt);
+  platform::DeviceRegistryResult result = platform::kDeviceRegistrySuccess;
+  EXPECT_EQ(registry.descendantsOf(999, &result), std::nullopt);
+  EXPECT_EQ(result, platform::deviceRegistryErrorFromErrno(EINVAL));
 }
 
 }  // namespace

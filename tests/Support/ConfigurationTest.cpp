@@ -16,8 +16,8 @@ using supporttest::MemoryPreferenceStore;
 
 namespace {
 
-// Each case: the stored preferences; the settings read (lower priority, skip family, skip thinning,
-// simultaneous installations); the notices written.
+// Each case: the stored preferences (wrong kinds leave the defaults); the settings read (lower priority, skip family,
+// skip thinning, simultaneous installations); the notices written.
 TEST(ConfigurationPreferences, SettingsAndNoticesFollowOnlyValuesOfTheRightKind) {
   const std::string n = "Setting simultaneous installations allowed to ";
   const struct {
@@ -25,7 +25,6 @@ TEST(ConfigurationPreferences, SettingsAndNoticesFollowOnlyValuesOfTheRightKind)
     std::string settings;
     std::vector<std::string> notices;
   } cases[] = {
-      {{}, "100 4", {}},
       {{{"LowerInstallPriority", Value(0)},
         {"SkipDeviceFamilyCheck", Value(1)},
         {"SkipThinningCheck", Value("YES")},
@@ -58,23 +57,12 @@ TEST(ConfigurationPreferences, SettingsAndNoticesFollowOnlyValuesOfTheRightKind)
 TEST(ConfigurationLayout, PathsLieUnderTheNormalisedRootAndAccessingThemCreatesNothing) {
   MemoryPreferenceStore store;
   qstest::TempDir temp("layout");
-  EXPECT_EQ(QSGlobalConfiguration::sharedInstance().oldContainerPath().path(),
-            qstest::systemRoot() + "/private/var/mobile/Applications");
-  for (const std::string& root : {std::string("/"), temp.path() + "//"}) {
-    QSGlobalConfiguration config(root, store);
-    const std::string prefix = root == "/" ? "" : temp.path();
-    EXPECT_EQ(config.systemRoot(), prefix);
-    const std::pair<URL, std::string> cases[] = {
-        {config.oldInstallMapPath(), "/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist"},
-        {config.roleUserMigrationMarkerFilePath(), "/private/var/quilld/Library/Quillset/RoleUserMigration.plist"},
-        {config.systemAppsDirectory(), "/Applications"},
-        {config.factoryMountDirectory(), "/private/var/factory_mount"},
-    };
-    for (const auto& [url, path] : cases) {
-      EXPECT_EQ(url.path(), prefix + path);
-      EXPECT_EQ(url.isDirectory(), path.find(".plist") == std::string::npos) << path;
-    }
-  }
+  QSGlobalConfiguration atRoot("/", store), below(temp.path() + "//", store);
+  EXPECT_EQ(atRoot.oldInstallMapPath().path(), "/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist");
+  EXPECT_FALSE(atRoot.oldInstallMapPath().isDirectory());
+  EXPECT_EQ(below.roleUserMigrationMarkerFilePath().path(),
+            temp.path() + "/private/var/quilld/Library/Quillset/RoleUserMigration.plist");
+  EXPECT_TRUE(below.systemAppsDirectory().isDirectory() && below.factoryMountDirectory().isDirectory());
   EXPECT_TRUE(std::filesystem::is_empty(temp.path()));
 }
 
@@ -95,54 +83,48 @@ std::optional<int32_t> protectionClassOf(const std::string& path) {
   return n == sizeof value ? std::optional<int32_t>(value) : std::nullopt;
 }
 
-// Each case: the accessor, the directory, its class; the second access finds it removed and makes it again.
-TEST_F(ConfigurationDirectories, AreMadeWithTheirClassOnEveryAccess) {
+// Each case: the accessor, the directory, its class, the words of its failure line. Every access makes
+// the directory again; when it cannot (its parent immutable), the line says why and the URL still comes back.
+TEST_F(ConfigurationDirectories, AreMadeWithTheirClassOnEveryAccessAndAFailureIsLoggedUnderTheAccessorsName) {
   const mode_t previousMask = umask(022);
-  const std::tuple<URL (QSGlobalConfiguration::*)(), std::string, std::optional<int32_t>> cases[] = {
-      {&QSGlobalConfiguration::dataDirectory, "/private/var/quilld/Library/Quillset", 4},
-      {&QSGlobalConfiguration::logDirectory, "/private/var/quilld/Library/Logs/Quillset", 4},
-      {&QSGlobalConfiguration::carrierBundlesDirectory, "/private/var/mobile/Library/Carrier Bundles", std::nullopt},
-      {&QSGlobalConfiguration::stagingRoot, "/private/var/quilld/Library/Caches/com.vantrel.mobile.quilld.staging", 4},
+  const struct {
+    URL (QSGlobalConfiguration::*access)();
+    std::string function, path;
+    std::optional<int32_t> protectionClass;
+    std::string words;
+  } cases[] = {
+      {&QSGlobalConfiguration::dataDirectory, "dataDirectory", "/private/var/quilld/Library/Quillset", 4,
+       "Failed to create data dir at"},
+      {&QSGlobalConfiguration::logDirectory, "logDirectory", "/private/var/quilld/Library/Logs/Quillset", 4,
+       "Failed to create log directory at"},
+      {&QSGlobalConfiguration::carrierBundlesDirectory, "carrierBundlesDirectory",
+       "/private/var/mobile/Library/Carrier Bundles", std::nullopt, "Failed to create carrier bundles directory at"},
+      {&QSGlobalConfiguration::stagingRoot, "stagingRoot",
+       "/private/var/quilld/Library/Caches/com.vantrel.mobile.quilld.staging", 4, "Failed to create staging root at"},
   };
-  for (const auto& [access, path, protectionClass] : cases) {
+  for (const auto& [access, function, path, protectionClass, words] : cases) {
     for (int round = 0; round < 2; ++round) {
       URL url = (config_.*access)();
       EXPECT_EQ(url.path(), root_.path() + path);
       EXPECT_EQ(protectionClassOf(url.path()), protectionClass) << path;
       EXPECT_EQ(std::filesystem::status(url.path()).permissions(), std::filesystem::perms(0755)) << path << round;
-      EXPECT_TRUE(round == 1 || rmdir(url.path().c_str()) == 0);
+      ASSERT_EQ(rmdir(url.path().c_str()), 0);
     }
-  }
-  // The caches directory made on the way to the staging root has no class of its own.
-  EXPECT_EQ(protectionClassOf(root_.path() + "/private/var/quilld/Library/Caches"), std::nullopt);
-  EXPECT_TRUE(log_.systemLines().empty());
-  umask(previousMask);
-}
-
-// The URL still comes back when the directory cannot be made; the line says why.
-TEST_F(ConfigurationDirectories, FailedCreationIsLoggedUnderTheAccessorsName) {
-  const std::string quilld = "/private/var/quilld/Library";
-  const std::tuple<std::string, URL (QSGlobalConfiguration::*)(), std::string, std::string> cases[] = {
-      {quilld, &QSGlobalConfiguration::dataDirectory, "dataDirectory", "Failed to create data dir at"},
-      {quilld, &QSGlobalConfiguration::cachesDirectory, "cachesDirectory", "Failed to create data dir at"},
-      {quilld, &QSGlobalConfiguration::logDirectory, "logDirectory", "Failed to create log directory at"},
-      {quilld + "/Caches", &QSGlobalConfiguration::stagingRoot, "stagingRoot", "Failed to create staging root at"},
-      {"/private/var/mobile/Library", &QSGlobalConfiguration::carrierBundlesDirectory, "carrierBundlesDirectory",
-       "Failed to create carrier bundles directory at"},
-  };
-  for (const auto& [locked, access, function, words] : cases) {
-    log_.clear();
-    ASSERT_TRUE(qstest::makeDirs(root_.path() + locked));
-    ASSERT_TRUE(qstest::setImmutable(root_.path() + locked, true));
+    const std::string parent = std::filesystem::path(root_.path() + path).parent_path();
+    ASSERT_TRUE(qstest::setImmutable(parent, true));
     URL url = (config_.*access)();
-    ASSERT_TRUE(qstest::setImmutable(root_.path() + locked, false));
+    ASSERT_TRUE(qstest::setImmutable(parent, false));
     auto lines = log_.systemLines();
-    ASSERT_EQ(lines.size(), 1u) << function;
+    ASSERT_EQ(lines.size(), 1u) << path;
     EXPECT_EQ(lines[0].level, 3);
     EXPECT_EQ(lines[0].function, "-[QSGlobalConfiguration " + function + "]");
     EXPECT_EQ(lines[0].message.rfind(words + " \"" + url.description() + "\": Error Domain=", 0), 0u)
         << lines[0].message;
+    log_.clear();
   }
+  // The caches directory made on the way to the staging root has no class of its own.
+  EXPECT_EQ(protectionClassOf(root_.path() + "/private/var/quilld/Library/Caches"), std::nullopt);
+  umask(previousMask);
 }
 
 }  // namespace

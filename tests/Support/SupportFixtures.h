@@ -14,16 +14,14 @@ namespace supporttest {
 // Preferences held in memory; remembers which domains were asked. Not thread-safe.
 class MemoryPreferenceStore final : public platform::PreferenceStore {
  public:
-  explicit MemoryPreferenceStore(std::map<std::string, platform::Value> values = {}) : values_(std::move(values)) {}
+  explicit MemoryPreferenceStore(std::map<std::string, platform::Value> values = {}) : values(std::move(values)) {}
   std::optional<platform::Value> copyValue(std::string_view key, std::string_view domain) override {
     domains.emplace_back(domain);
-    auto it = values_.find(std::string(key));
-    return it == values_.end() ? std::nullopt : std::optional<platform::Value>(it->second);
+    auto it = values.find(std::string(key));
+    return it == values.end() ? std::nullopt : std::optional<platform::Value>(it->second);
   }
+  std::map<std::string, platform::Value> values;
   std::vector<std::string> domains;
-
- private:
-  std::map<std::string, platform::Value> values_;
 };
 
 // Sets gLogHandle to a handle of `level` (or to none) for its lifetime.
