@@ -13,10 +13,11 @@ using namespace platform;
 // (the test main lets only this suite raise the count).
 TEST(FormatMismatch, IsCountedWhileConversionsFollowPrintfAndObjectsPrintTheirDescriptions) {
   const std::tuple<std::function<std::string()>, std::string, int> cases[] = {
-      {[] { return Format("%d %ld %hhd %lu", INT64_MAX, INT64_MAX, 300, -1); },
-       "-1 9223372036854775807 44 18446744073709551615", 0},
-      {[] { return Format("%lld %#x %c %.2f%%", UINT64_MAX, 255, 'k', 3.14159); }, "-1 0xff k 3.14%", 0},
-      {[] { return Format("[%-5d][%05d][%*d][%.2s] %s", 42, 42, 4, 7, "abc", (const char*)nullptr); },
+      {[] { return Format("%d %ld %hhd %hd %lu %d", INT64_MAX, INT64_MAX, 300, 70000, -1, true); },
+       "-1 9223372036854775807 44 4464 18446744073709551615 1", 0},
+      {[] { return Format("%lld %#x %c %.2f%% %p", UINT64_MAX, 255, 'k', 3.14159f, (const void*)0x10); },
+       "-1 0xff k 3.14% 0x10", 0},
+      {[] { return Format("[%-5d][%05d][%*d][%.2s] %s", 42, 42, 4, 7, std::string_view("abc"), (const char*)nullptr); },
        "[42   ][00042][   7][ab] (null)", 0},
       {[] { return Format("%@ %@ %@ %@", nullptr, Value(), URL(), std::optional<URL>()); },
        "(null) (null) (null) (null)", 0},
@@ -26,10 +27,10 @@ TEST(FormatMismatch, IsCountedWhileConversionsFollowPrintfAndObjectsPrintTheirDe
          return Format("%@ %@", Array{Value("a"), Value(1)}, Dictionary{{"k", Value(true)}});
        },
        "(a, 1) {k = 1; }", 0},
-      {[] { return Format("%d %@ %.1f", "text", 42, 3); }, "text 42 3.0", 3},
+      {[] { return Format("%d %@ %.1f %d", "text", 42, 3, 2.5); }, "text 42 3.0 2.5", 4},
       {[] { return Format("a %@ b %d", Value("x")); }, "a x b <missing>", 1},
       {[] { return Format("only %d", 1, 2); }, "only 1", 1},
-      {[] { return Format("50% %n", 1); }, "50% %n", 2},
+      {[] { return Format("%n 50%", 1); }, "%n 50%", 3},
   };
   for (const auto& [format, expected, mismatches] : cases) {
     const uint64_t before = formatMismatchCount();

@@ -45,8 +45,7 @@ TEST_F(FilePreferences, DomainNamesThatLeaveTheDirectoryAreRefused) {
 // Read once: changing the variable later has no effect.
 TEST(SystemRoot, IsNormalisedAndReadOnce) {
   const std::string before = systemRootFromEnvironment();
-  EXPECT_EQ(before, normalizedSystemRoot(qstest::systemRoot() + "//"));
-  EXPECT_EQ(normalizedSystemRoot("///"), "");
+  EXPECT_TRUE(before == normalizedSystemRoot(qstest::systemRoot() + "//") && normalizedSystemRoot("///").empty());
   setenv("QS_SYSTEM_ROOT", "/elsewhere", 1);
   EXPECT_EQ(systemRootFromEnvironment(), before);
   setenv("QS_SYSTEM_ROOT", qstest::systemRoot().c_str(), 1);
@@ -56,14 +55,13 @@ TEST(SystemVersionFile, IsReadWholeAndRefusedWhenMissingOrNotADictionary) {
   qstest::TempDir root;
   FileSystemVersionSource source(root.path() + "/");
   Error error;
-  EXPECT_FALSE(source.readSystemVersionDictionary(&error));
-  EXPECT_TRUE(error.is(kFileErrorDomain, kFileReadNoSuchFileError)) << error.description();
+  EXPECT_TRUE(!source.readSystemVersionDictionary(&error) && error.is(kFileErrorDomain, kFileReadNoSuchFileError));
   ASSERT_TRUE(qstest::makeDirs(root / "System/Library/CoreServices"));
-  ASSERT_TRUE(
-      plist::writeFile(Value("21A100"), URL::fileURL(root / "System/Library/CoreServices/SystemVersion.plist")));
+  const URL file = URL::fileURL(root / "System/Library/CoreServices/SystemVersion.plist");
+  ASSERT_TRUE(plist::writeFile(Value("21A100"), file));
   EXPECT_FALSE(source.systemVersionDictionary());
   Dictionary version{{kSystemVersionBuildVersionKey, Value("21A100")}, {"Extra", Value(Array{Value(1)})}};
-  ASSERT_TRUE(plist::writeFile(Value(version), URL::fileURL(source.path()), plist::Format::Binary));
+  ASSERT_TRUE(plist::writeFile(Value(version), file, plist::Format::Binary));
   EXPECT_EQ(source.systemVersionDictionary(), version);
 }
 

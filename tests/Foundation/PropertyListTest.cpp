@@ -80,9 +80,13 @@ TEST(PropertyListFormats, UnwritableValuesAreRefusedWithTheReason) {
   Value deep(Array{});
   for (int i = 0; i < 600; ++i) deep = Value(Array{deep});
   const std::pair<Value, std::string> cases[] = {
-      {Value(Array{Value(1), Value()}), "null value"},  {Value(URL::fileURL("/a")), "URL is not a property-list value"},
-      {Value(std::string("a\0b", 3)), "NUL"},           {Value(Date{1e12}), "outside the range"},
-      {Value(Date{std::nan("")}), "outside the range"}, {deep, "nesting deeper"},
+      {Value(Array{Value(1), Value()}), "null value"},
+      {Value(URL::fileURL("/a")), "URL is not a property-list value"},
+      {Value(std::string("a\0b", 3)), "NUL"},
+      {Value(Date{1e12}), "outside the range"},
+      {Value(Date{std::nan("")}), "outside the range"},
+      {deep, "nesting deeper"},
+      {Value(Dictionary{{"e", Value(Error("D", 1))}}), "error record"},
   };
   for (const auto& [value, reason] : cases) {
     for (plist::Format format : {kXML, kBinary}) {

@@ -64,6 +64,7 @@ TEST(ConfigurationLayout, PathsLieUnderTheNormalisedRootAndAccessingThemCreatesN
             temp.path() + "/private/var/quilld/Library/Quillset/RoleUserMigration.plist");
   EXPECT_TRUE(below.systemAppsDirectory().isDirectory() && below.factoryMountDirectory().isDirectory());
   EXPECT_TRUE(std::filesystem::is_empty(temp.path()));
+  EXPECT_EQ(QSGlobalConfiguration::sharedInstance().systemRoot(), qstest::systemRoot());
 }
 
 // --- Directory creation -----------------------------------------------------------------
@@ -116,8 +117,7 @@ TEST_F(ConfigurationDirectories, AreMadeWithTheirClassOnEveryAccessAndAFailureIs
     ASSERT_TRUE(qstest::setImmutable(parent, false));
     auto lines = log_.systemLines();
     ASSERT_EQ(lines.size(), 1u) << path;
-    EXPECT_EQ(lines[0].level, 3);
-    EXPECT_EQ(lines[0].function, "-[QSGlobalConfiguration " + function + "]");
+    EXPECT_TRUE(lines[0].level == 3 && lines[0].function == "-[QSGlobalConfiguration " + function + "]") << function;
     EXPECT_EQ(lines[0].message.rfind(words + " \"" + url.description() + "\": Error Domain=", 0), 0u)
         << lines[0].message;
     log_.clear();

@@ -35,8 +35,7 @@ TEST(ErrorConstructors, RecordsHoldTheirKeysAndOnlyALoggedRecordWithAFormatWrite
   (void)_CreateAndLogError(kFunction, 281, QSInstallerErrorDomain, 4, &underlying, &additions, "At %s", "/p");
   EXPECT_EQ(log.systemMessages(),
             (std::vector<std::string>{"281: Bad link L", "281: At /p (" + underlying.description() + ")"}));
-  EXPECT_EQ(log.systemLines()[0].level, 3);
-  EXPECT_EQ(log.systemLines()[0].function, kFunction);
+  EXPECT_TRUE(log.systemLines()[0].level == 3 && log.systemLines()[0].function == kFunction);
 }
 
 // Each case: the handle's level (none: no handle); whether error, notice, debug and constructor lines pass.

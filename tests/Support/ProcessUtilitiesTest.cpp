@@ -59,6 +59,9 @@ TEST(TransactionalTask, ReturnsAtOnceAndHoldsTheProcessUntilTheTaskEnds) {
   EXPECT_EQ(platform::ProcessKeepAliveTransactionCount(), before);
   EXPECT_TRUE(order.size() == 201u && std::is_sorted(order.begin(), order.end()));
   EXPECT_NE(taskThread, std::this_thread::get_id());
+  std::promise<void> ran;
+  QSRunTransactionalTask(platform::WorkQueue::shared(), [&ran] { ran.set_value(); });
+  ran.get_future().wait();
 }
 
 // The report as built on a fresh thread, named by `name` when given. The thread name is per thread:

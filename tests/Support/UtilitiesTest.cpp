@@ -149,6 +149,7 @@ TEST_F(Digest, ReaderStopsWhenTheConsumerRefusesAndAtTheSizeTakenAtOpening) {
 TEST(TypeHelpers, OnlyNumbersAreBooleansIntegerKindsAreOneClassAndNothingElseIsArrayified) {
   EXPECT_EQ(QSStringifyObject(Value()), std::nullopt);
   EXPECT_EQ(QSStringifyObject(Value("a \"q\"")), std::optional<std::string>("a \"q\""));
+  EXPECT_EQ(QSStringifyObject(Value(Array{Value("x"), Value(1)})), std::optional<std::string>("(x, 1)"));
   EXPECT_FALSE(QSBooleanValue(Value(0), true));
   EXPECT_TRUE(QSBooleanValue(Value("NO"), true));
   EXPECT_FALSE(QSBooleanValue(Value("YES"), false));
@@ -158,6 +159,7 @@ TEST(TypeHelpers, OnlyNumbersAreBooleansIntegerKindsAreOneClassAndNothingElseIsA
   EXPECT_TRUE(QSArrayContainsOnlyClass(Value(Dictionary{{"a", Value(1)}}), Type::String));
   EXPECT_FALSE(QSArrayContainsOnlyClass(Value("text"), Type::String));
   EXPECT_EQ(QSArrayifyThing(Value("only"), Type::String), Array{Value("only")});
+  EXPECT_EQ(QSArrayifyThing(Value(Array{Value(1u)}), Type::Integer), Array{Value(1u)});
   EXPECT_EQ(QSArrayifyThing(Value(Array{Value("a"), Value(2)}), Type::String), std::nullopt);
   EXPECT_EQ(QSArrayifyThing(Value(3), Type::String), std::nullopt);
   EXPECT_EQ(QSArrayifyThing(std::set<std::string>{"zeta", "alpha"}, Type::String),
