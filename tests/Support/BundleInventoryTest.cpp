@@ -131,7 +131,7 @@ TEST_F(DiskImages, MountedImagesAndPartitionsAreSearchedInDeviceOrderThenTheDeve
   loopDevice("loop1", false);
   loopDevice("loop10", true, "loop10p1");
   ASSERT_TRUE(qstest::makeDirs(root_ / "sys/block/vda") && qstest::makeDirs(root_ / "sys/block/loopback"));
-  mountTable({"loop10p1", "mnt/second", "loop2", "mnt/first", "loop2", "mnt/again", "vda", "mnt/vda",  //
+  mountTable({"loop10p1", "mnt/second", "loop2", "mnt/first", "loop2", "mnt/again", "vda", "mnt/vda",  // first wins
               "loop4", "private/var/debug_mount", "loop5", "Developer"});
   EXPECT_EQ(config_.diskImageApplicationsDirectories(),
             (std::vector<URL>{apps("mnt/first"), developer, apps("mnt/second")}));
