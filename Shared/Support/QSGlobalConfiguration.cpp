@@ -101,12 +101,6 @@ URL cached(std::optional<URL>& field, Build build) {
   return *field;
 }
 
-// The system root as kept: no trailing separator, "" for the volume root.
-std::string normalizedRoot(std::string root) {
-  while (!root.empty() && root.back() == '/') root.pop_back();
-  return root;
-}
-
 }  // namespace
 
 QSGlobalConfiguration& QSGlobalConfiguration::sharedInstance() {
@@ -116,7 +110,7 @@ QSGlobalConfiguration& QSGlobalConfiguration::sharedInstance() {
 }
 
 QSGlobalConfiguration::QSGlobalConfiguration(std::string systemRoot, platform::PreferenceStore& preferences)
-    : systemRoot_(normalizedRoot(std::move(systemRoot))) {
+    : systemRoot_(platform::normalizedSystemRoot(systemRoot)) {
   std::optional<Value> lowerPriority = preferences.copyValue(kLowerInstallPriorityKey, kPreferencesDomain);
   if (lowerPriority && *lowerPriority == Value(false)) {
     QS_SYSLOG(kQSLogLevelNotice, kInitFunction, "Not running installation at background priority because of a set default");
