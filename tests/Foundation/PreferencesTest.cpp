@@ -2,7 +2,6 @@
 
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Preferences.h"
-#include "Platform/SystemVersion.h"
 #include "support/TestSupport.h"
 
 namespace {
@@ -40,29 +39,6 @@ TEST_F(FilePreferences, DomainNamesThatLeaveTheDirectoryAreRefused) {
     EXPECT_FALSE(store_.copyDomain(domain, &error)) << domain;
     EXPECT_TRUE(error.is(kFileErrorDomain, kFileReadUnknownError)) << domain;
   }
-}
-
-// Read once: changing the variable later has no effect.
-TEST(SystemRoot, IsNormalisedAndReadOnce) {
-  const std::string before = systemRootFromEnvironment();
-  EXPECT_TRUE(before == normalizedSystemRoot(qstest::systemRoot() + "//") && normalizedSystemRoot("///").empty());
-  setenv("QS_SYSTEM_ROOT", "/elsewhere", 1);
-  EXPECT_EQ(systemRootFromEnvironment(), before);
-  setenv("QS_SYSTEM_ROOT", qstest::systemRoot().c_str(), 1);
-}
-
-TEST(SystemVersionFile, IsReadWholeAndRefusedWhenMissingOrNotADictionary) {
-  qstest::TempDir root;
-  FileSystemVersionSource source(root.path() + "/");
-  Error error;
-  EXPECT_TRUE(!source.readSystemVersionDictionary(&error) && error.is(kFileErrorDomain, kFileReadNoSuchFileError));
-  ASSERT_TRUE(qstest::makeDirs(root / "System/Library/CoreServices"));
-  const URL file = URL::fileURL(root / "System/Library/CoreServices/SystemVersion.plist");
-  ASSERT_TRUE(plist::writeFile(Value("21A100"), file));
-  EXPECT_FALSE(source.systemVersionDictionary());
-  Dictionary version{{kSystemVersionBuildVersionKey, Value("21A100")}, {"Extra", Value(Array{Value(1)})}};
-  ASSERT_TRUE(plist::writeFile(Value(version), file, plist::Format::Binary));
-  EXPECT_EQ(source.systemVersionDictionary(), version);
 }
 
 }  // namespace
