@@ -20,11 +20,7 @@ namespace {
 // skip thinning, simultaneous installations); the notices written.
 TEST(ConfigurationPreferences, SettingsAndNoticesFollowOnlyValuesOfTheRightKind) {
   const std::string n = "Setting simultaneous installations allowed to ";
-  const struct {
-    std::map<std::string, Value> stored;
-    std::string settings;
-    std::vector<std::string> notices;
-  } cases[] = {
+  const std::tuple<std::map<std::string, Value>, std::string, std::vector<std::string>> cases[] = {
       {{{"LowerInstallPriority", Value(0)},
         {"SkipDeviceFamilyCheck", Value(1)},
         {"SkipThinningCheck", Value("YES")},

@@ -147,6 +147,7 @@ TEST(TypeHelpers, OnlyNumbersAreBooleansIntegerKindsAreOneClassAndNothingElseIsA
   EXPECT_TRUE(QSArrayContainsOnlyClass(Value(Dictionary{{"a", Value(1)}}), Type::String));
   EXPECT_FALSE(QSArrayContainsOnlyClass(Value("text"), Type::String));
   EXPECT_EQ(QSArrayifyThing(Value("only"), Type::String), Array{Value("only")});
+  EXPECT_EQ(QSArrayifyThing(Value(Array{Value(1u)}), Type::Integer), Array{Value(1u)});
   EXPECT_EQ(QSArrayifyThing(Value(Array{Value("a"), Value(2)}), Type::String), std::nullopt);
   EXPECT_EQ(QSArrayifyThing(Value(3), Type::String), std::nullopt);
   EXPECT_EQ(QSArrayifyThing(std::set<std::string>{"zeta", "alpha"}, Type::String),
