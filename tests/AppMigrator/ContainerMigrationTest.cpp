@@ -18,12 +18,10 @@ class ContainerMigration : public MigratorTest {
     makeBundle(bundle_, kIdentifier);
     ASSERT_TRUE(makeDirs(container_ + "/Documents"));
     ASSERT_TRUE(writeFile(container_ + "/Documents/note.txt", "remember"));
-    ASSERT_TRUE(makeDirs(container_ + "/Library/Preferences"));
   }
   // Creates the migrator and runs it on `info` (the application's by default).
   bool migrate(const std::optional<Dictionary>& info = std::nullopt) {
-    migrator_ = createMigrator();
-    EXPECT_TRUE(migrator_);
+    EXPECT_TRUE(makeMigrator());
     log_->clear();
     return migrator_ && migrator_->_migrateContainerWithInfo(info ? *info : appInfo());
   }
@@ -36,7 +34,6 @@ class ContainerMigration : public MigratorTest {
 
   std::string container_;
   std::string bundle_;
-  std::unique_ptr<QSAppMigrator> migrator_;
 };
 
 TEST_F(ContainerMigration, FailedPlaceholderOrRecordWithoutDataContainerKeepsContainerWithMarker) {

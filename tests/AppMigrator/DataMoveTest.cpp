@@ -11,8 +11,7 @@ class DataMove : public MigratorTest {
  protected:
   void SetUp() override {
     MigratorTest::SetUp();
-    migrator_ = createMigrator();
-    ASSERT_NE(migrator_, nullptr);
+    ASSERT_TRUE(makeMigrator());
     old_ = scratch_->path() + "/old";
     new_ = scratch_->path() + "/new";
     ASSERT_TRUE(makeDirs(old_) && makeDirs(new_));
@@ -25,7 +24,6 @@ class DataMove : public MigratorTest {
     return migrator_->_containerHasMissedItems(URL::fileURL(container, true), "com.example.a");
   }
 
-  std::unique_ptr<QSAppMigrator> migrator_;
   std::string old_, new_;
 };
 

@@ -161,6 +161,7 @@ void MigratorTest::SetUp() {
 
 void MigratorTest::TearDown() {
   for (const std::string& path : immutable_) setImmutable(path, false);
+  migrator_.reset();
   log_.reset();
   platform_.reset();
   scratch_.reset();
@@ -169,18 +170,12 @@ void MigratorTest::TearDown() {
 
 testing::AssertionResult MigratorTest::loggedOnce(const std::string& message, bool prefix) const {
   const auto lines = log_->hostMessages();
-  const auto count = prefix ? hostMessagesStartingWith(message).size() : std::ranges::count(lines, message);
+  const auto count = std::ranges::count_if(lines, [&](const std::string& line) {
+    return prefix ? line.starts_with(message) : line == message;
+  });
   if (count == 1) return testing::AssertionSuccess();
   return testing::AssertionFailure() << count << " lines " << (prefix ? "start with" : "are") << " \"" << message
                                      << "\" among " << testing::PrintToString(lines);
-}
-
-std::vector<std::string> MigratorTest::hostMessagesStartingWith(const std::string& prefix) const {
-  std::vector<std::string> found;
-  for (const std::string& message : log_->hostMessages()) {
-    if (message.rfind(prefix, 0) == 0) found.push_back(message);
-  }
-  return found;
 }
 
 std::vector<std::string> directoryNames(const std::string& path) {

@@ -111,29 +111,6 @@ class FakeSystemVersionSource final : public platform::SystemVersionSource {
   std::optional<platform::Dictionary> systemVersionDictionary() override { return dictionary; }
 };
 
-// A bundle reader that forwards to the real one, except for the bundles (by
-// directory path) it is told to fail.
-class FaultyBundleReader final : public platform::BundleReader {
- public:
-  std::set<std::string> unopenable;        // openBundle yields null
-  std::set<std::string> noInfoDictionary;  // infoDictionary yields none
-
-  std::shared_ptr<platform::Bundle> openBundle(const platform::URL& url) override {
-    return unopenable.count(url.path()) ? nullptr : inner_.openBundle(url);
-  }
-  std::optional<platform::Dictionary> infoDictionary(const platform::Bundle& bundle) override {
-    if (noInfoDictionary.count(bundle.url().path())) return std::nullopt;
-    return inner_.infoDictionary(bundle);
-  }
-  std::optional<platform::Value> filteredInfoPlist(const platform::Bundle& bundle,
-                                                   const std::set<std::string>& keys) override {
-    return inner_.filteredInfoPlist(bundle, keys);
-  }
-
- private:
-  platform::FileBundleReader inner_;
-};
-
 // The real PNG encoding, or a failure to create the encoder or to finalize it.
 class FaultyImageEncoding final : public platform::ImageEncoding {
  public:
@@ -146,7 +123,7 @@ class FaultyImageEncoding final : public platform::ImageEncoding {
   platform::PNGImageEncoding inner_;
 };
 
-// Every fake together, and the real icon renderer. `root` is a directory of
+// Every fake together, and the real bundle reader and icon renderer. `root` is a directory of
 // the test's: containers go under root/containers, the temporary directory is
 // root/tmp.
 struct FakePlatform {
@@ -155,7 +132,7 @@ struct FakePlatform {
 
   FakeApplicationRegistry registry;
   FakeInstallationDaemon daemon;
-  FaultyBundleReader bundleReader;
+  platform::FileBundleReader bundleReader;
   platform::CairoIconRenderer iconRenderer;
   FaultyImageEncoding imageEncoding;
   FakeSystemVersionSource systemVersion;
@@ -188,10 +165,9 @@ class MigratorTest : public testing::Test {
     if (!identifier.empty()) info[platform::kBundleIdentifierKey] = Value(identifier);
     writePlist(path + "/" + platform::kInfoPlistFileName, Value(info));
   }
-  // A container `name` holding the bundle `identifier`.`extension`.
-  static std::string makeBundleContainer(const std::string& name, const std::string& identifier,
-                                         const std::string& extension = "app") {
-    makeBundle(makeContainer(name) + "/" + identifier + "." + extension, identifier);
+  // A container `name` holding the application `identifier`.app.
+  static std::string makeBundleContainer(const std::string& name, const std::string& identifier) {
+    makeBundle(makeContainer(name) + "/" + identifier + ".app", identifier);
     return oldApplicationsPath() + "/" + name;
   }
   // Writes XML, with the directories it needs; fails the test when it cannot.
@@ -209,24 +185,23 @@ class MigratorTest : public testing::Test {
     immutable_.push_back(path);
   }
   static Dictionary containerInfo(const std::string& container, const std::string& bundle,
-                                  const std::string& identifier, const std::string& type,
-                                  const std::string& secondBundle = "") {
-    Dictionary info{{kQSContainerPathKey, Value(container)},
-                    {kQSBundlePathKey, Value(bundle)},
-                    {kQSBundleIdentifierKey, Value(identifier)},
-                    {kQSContainerTypeKey, Value(type)}};
-    if (!secondBundle.empty()) info[kQSSecondBundlePathKey] = Value(secondBundle);
-    return info;
+                                  const std::string& identifier, const std::string& type) {
+    return Dictionary{{kQSContainerPathKey, Value(container)},
+                      {kQSBundlePathKey, Value(bundle)},
+                      {kQSBundleIdentifierKey, Value(identifier)},
+                      {kQSContainerTypeKey, Value(type)}};
   }
   std::unique_ptr<QSAppMigrator> createMigrator() { return QSAppMigrator::create(platform_->services()); }
+  // Creates migrator_, for the tests that call the run's steps one by one.
+  bool makeMigrator() { return (migrator_ = createMigrator()) != nullptr; }
 
   // Exactly one host-log line is `message` (or, with `prefix`, starts with it).
   testing::AssertionResult loggedOnce(const std::string& message, bool prefix = false) const;
-  std::vector<std::string> hostMessagesStartingWith(const std::string& prefix) const;
 
   std::unique_ptr<TempDir> scratch_;  // the fakes' containers and the temporary directory
   std::unique_ptr<FakePlatform> platform_;
   std::unique_ptr<LogCapture> log_;
+  std::unique_ptr<QSAppMigrator> migrator_;  // made by makeMigrator()
   std::vector<std::string> immutable_;
 };
 

@@ -25,8 +25,7 @@ class GroupContainerMigration : public MigratorTest {
   // Creates the migrator with groupMap_ and installs `identifier` with these groups.
   void createAndInstall(const std::string& identifier, const std::vector<std::string>& groups) {
     writeInstallMap(Dictionary{{"GroupContainers", Value(groupMap_)}});
-    migrator_ = createMigrator();
-    ASSERT_TRUE(migrator_);
+    ASSERT_TRUE(makeMigrator());
     platform_->registry.groupsOf[identifier] = groups;
     platform_->registry.addInstalledApplication(identifier);
     log_->clear();
@@ -36,13 +35,11 @@ class GroupContainerMigration : public MigratorTest {
 
   std::string oldGroups_, newGroups_;
   Dictionary groupMap_;
-  std::unique_ptr<QSAppMigrator> migrator_;
 };
 
-TEST_F(GroupContainerMigration, ItemsReplaceNeverMergeLinksStayLinksAndOldContainerGoes) {
+TEST_F(GroupContainerMigration, ItemsReplaceNeverMergeAndOldContainerGoes) {
   const std::string old = addOldGroup("group.a", {"shared.db", "notes.txt"});
   ASSERT_TRUE(makeDirs(old + "/Library/Caches") && writeFile(old + "/Library/Caches/old.cache", "old"));
-  ASSERT_EQ(symlink("../elsewhere/target", (old + "/link").c_str()), 0);
   createAndInstall("com.example.a", {"group.a"});
   const std::string fresh = newGroups_ + "/group.a";
   ASSERT_TRUE(writeFile(fresh + "/shared.db", "new"));
@@ -52,32 +49,27 @@ TEST_F(GroupContainerMigration, ItemsReplaceNeverMergeLinksStayLinksAndOldContai
   EXPECT_EQ(readFile(fresh + "/shared.db"), "old shared.db");
   EXPECT_EQ(readFile(fresh + "/notes.txt"), "old notes.txt");
   EXPECT_EQ(directoryNames(fresh + "/Library"), std::vector<std::string>{"Caches"});
-  ASSERT_TRUE(std::filesystem::is_symlink(fresh + "/link"));
-  EXPECT_EQ(std::filesystem::read_symlink(fresh + "/link").string(), "../elsewhere/target");
   EXPECT_FALSE(pathExists(old));
   EXPECT_FALSE(mapHas("group.a"));
 }
 
 TEST_F(GroupContainerMigration, EntriesThatCannotBeMovedAreSkippedAndKept) {
+  // Entries without a container (or already gone) are met by the end-to-end
+  // suite, where groups are shared.
   const std::string number = addOldGroup("group.number", {"f"});
   groupMap_["group.number"] = Value(Dictionary{{"Container", Value(42)}});
-  groupMap_["group.string"] = Value(number);
-  const std::string missing = oldGroups_ + "/group.missing";
-  groupMap_["group.missing"] = Value(Dictionary{{"Container", Value(missing)}});
   // A file where the group container should be: it cannot be listed.
   const std::string file = oldGroups_ + "/group.file";
   ASSERT_TRUE(writeFile(file, "a file, not a container"));
   groupMap_["group.file"] = Value(Dictionary{{"Container", Value(file)}});
-  createAndInstall("com.example.a", {"group.number", "group.string", "group.missing", "group.file"});
+  createAndInstall("com.example.a", {"group.number", "group.file"});
 
   EXPECT_TRUE(migrate("com.example.a"));
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get path to group container for com.example.a[group.number]"));
-  EXPECT_TRUE(loggedOnce("QSAppMigrator: No group container entry to migrate for com.example.a[group.string]"));
-  EXPECT_TRUE(loggedOnce("QSAppMigrator: Missing source group container at " + missing));
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get all urls in source group container " + file + " : ", true));
   EXPECT_TRUE(pathExists(number + "/f"));
   EXPECT_TRUE(pathExists(file));
-  for (const char* group : {"group.number", "group.string", "group.missing", "group.file"}) EXPECT_TRUE(mapHas(group));
+  EXPECT_TRUE(mapHas("group.number") && mapHas("group.file"));
   EXPECT_FALSE(migrator_->_moveAllItemsInGroupContainerURL(URL::fileURL(file), URL::fileURL(newGroups_)));
 
   // An application without groups has nothing to migrate; one without a record fails.

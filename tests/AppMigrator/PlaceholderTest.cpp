@@ -26,8 +26,7 @@ class PlaceholderInstallation : public MigratorTest {
                                 {platform::kBundleShortVersionStringKey, Value("4.2")},
                                 {platform::kApplicationGroupsKey, Value(platform::makeStringArray({"group.atlas"}))}}));
     ASSERT_TRUE(writeSolidPNG(bundle_ + "/Icon.png", 76, 76, kOpaqueBlue));
-    migrator_ = createMigrator();
-    ASSERT_TRUE(migrator_);
+    ASSERT_TRUE(makeMigrator());
     platform_->registry.observer = [this](const std::string& call, const std::string&) {
       if (call != "installBundle") return;
       stagedAtInstall_ = directoryNames(stagedPath());
@@ -55,7 +54,6 @@ class PlaceholderInstallation : public MigratorTest {
   }
 
   std::string container_, bundle_;
-  std::unique_ptr<QSAppMigrator> migrator_;
   std::vector<std::string> stagedAtInstall_;
   std::string infoTextAtInstall_;
   std::optional<Dictionary> infoAtInstall_;
@@ -79,8 +77,8 @@ TEST_F(PlaceholderInstallation, StagesPresentKeysInOrderAndTheRenderedIconWithTh
                                                "RkBundleIconFile=Icon.png"}));
   EXPECT_EQ(infoAtInstall_->size(), entries.size());
   ASSERT_TRUE(iconAtInstall_);
-  EXPECT_EQ(iconAtInstall_->width, platform::kHomeScreenIconSize);
-  EXPECT_EQ(iconAtInstall_->height, platform::kHomeScreenIconSize);
+  EXPECT_EQ(std::pair(iconAtInstall_->width, iconAtInstall_->height),
+            std::pair(platform::kHomeScreenIconSize, platform::kHomeScreenIconSize));
   EXPECT_EQ(pixelAt(*iconAtInstall_, iconAtInstall_->width / 2, iconAtInstall_->height / 2), kOpaqueBlue);
 
   ASSERT_EQ(platform_->registry.installCalls.size(), 1u);
@@ -121,14 +119,17 @@ TEST_F(PlaceholderInstallation, IconFailuresLeaveAPlaceholderWithoutIcon) {
 }
 
 TEST_F(PlaceholderInstallation, EachFailureFailsAndLeavesNothingStaged) {
+  const std::string moved = scratch_->path() + "/Atlas.app";
   const std::vector<std::pair<std::function<void()>, std::string>> cases = {
       {[&] { writeFile(stagingParent(), "a file where the directory belongs"); },
        "QSAppMigrator: Failed to create staged placeholder directory at " + stagedPath() + " : "},
-      {[&] { std::filesystem::remove(stagingParent()), platform_->bundleReader.unopenable.insert(bundle_); },
+      // A file where the bundle should be, then a bundle without Info.plist.
+      {[&] { std::filesystem::remove(stagingParent()), std::filesystem::rename(bundle_, moved), writeFile(bundle_, ""); },
        "QSAppMigrator: Failed to create RkBundle for " + bundle_},
-      {[&] { platform_->bundleReader.unopenable.clear(), platform_->bundleReader.noInfoDictionary.insert(bundle_); },
+      {[&] { std::filesystem::remove(bundle_), makeDirs(bundle_); },
        "QSAppMigrator: Failed to get bundle info dictionary for bundle " + bundle_},
-      {[&] { platform_->bundleReader.noInfoDictionary.clear(), makeDirs(stagedPath() + "/Info.plist/occupied"); },
+      {[&] { std::filesystem::remove(bundle_), std::filesystem::rename(moved, bundle_),
+             makeDirs(stagedPath() + "/Info.plist/occupied"); },
        "QSAppMigrator: Failed to write placeholder Info.plist to file://" + stagedPath() + "/Info.plist"},
       {[&] { platform_->registry.refuseInstallOf.insert(kIdentifier); },
        "QSAppMigrator: Failed to install placeholder for " + std::string(kIdentifier) +
