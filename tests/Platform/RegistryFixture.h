@@ -23,10 +23,10 @@ struct TestBundle {
   bool noDataContainer = false;
 };
 
-// The install options of a staged application.
-inline platform::Dictionary customerOptions(const std::string& identifier) {
-  return {{platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypeCustomer},
-          {platform::kBundleIdentifierKey, identifier}};
+// The install options of a staged application, or of another package type.
+inline platform::Dictionary installOptions(const std::string& identifier,
+                                           const char* type = platform::kRegistryPackageTypeCustomer) {
+  return {{platform::kRegistryPackageTypeKey, type}, {platform::kBundleIdentifierKey, identifier}};
 }
 
 // The error's code when it is in the registry's domain, else -1.
@@ -42,6 +42,21 @@ inline void makeBundle(const std::string& path, const TestBundle& b) {
   if (!b.groups.empty()) info[platform::kApplicationGroupsKey] = platform::Array(b.groups.begin(), b.groups.end());
   ASSERT_TRUE(makeDirs(path) && platform::plist::writeFile(info, platform::URL::fileURL(path + "/Info.plist")));
   ASSERT_TRUE(writeFile(path + "/main", "executable of " + b.identifier));
+}
+
+// Entries of a directory (none when it is missing), sorted; whether a path
+// names anything, a dangling link included.
+inline std::vector<std::string> entries(const std::string& directory) {
+  std::vector<std::string> names;
+  std::error_code missing;
+  for (const auto& entry : std::filesystem::directory_iterator(directory, missing))
+    names.push_back(entry.path().filename());
+  std::sort(names.begin(), names.end());
+  return names;
+}
+inline bool exists(const std::string& path) {
+  std::error_code error;
+  return std::filesystem::exists(std::filesystem::symlink_status(path, error));
 }
 
 class RegistryTest : public testing::Test {
@@ -72,7 +87,7 @@ class RegistryTest : public testing::Test {
                platform::Error* error = nullptr, const std::string& at = "", std::function<void()> action = {}) {
     statuses_.clear(), errors_.clear();
     return registry.installPackage(
-        platform::URL::fileURL(package, true), customerOptions(identifier),
+        platform::URL::fileURL(package, true), installOptions(identifier),
         [&, this](const platform::Dictionary& report) {
           auto error = report.find(platform::kRegistryProgressErrorKey);
           if (error != report.end()) errors_.push_back(error->second.description());
@@ -100,16 +115,6 @@ class RegistryTest : public testing::Test {
     return {entries(bundleContainers()), entries(appDataContainers()),
             entries(at("private/var/mobile/Containers/Data/PluginKitPlugin")), entries(groupContainers())};
   }
-  // Entries of a directory (none when it is missing), sorted.
-  static std::vector<std::string> entries(const std::string& directory) {
-    std::vector<std::string> names;
-    std::error_code missing;
-    for (const auto& entry : std::filesystem::directory_iterator(directory, missing))
-      names.push_back(entry.path().filename());
-    std::sort(names.begin(), names.end());
-    return names;
-  }
-  static bool exists(const std::string& path) { return std::filesystem::exists(std::filesystem::symlink_status(path)); }
 
   TempDir root_{"registry"};
   std::string base_ = root_.path();  // the system root: the temporary directory unless a test names another

@@ -81,8 +81,7 @@ TEST_F(RegistryInstall, BadPackagesAreRefusedAndLeftAsTheyWere) {
   EXPECT_TRUE(exists(real + "/Info.plist"));
   // A placeholder type for a package.
   Error error;
-  Dictionary options = customerOptions("ex.x");
-  options[kRegistryPackageTypeKey] = Value(kRegistryPackageTypePlaceholder);
+  const Dictionary options = installOptions("ex.x", kRegistryPackageTypePlaceholder);
   EXPECT_FALSE(registry->installPackage(URL::fileURL(at("packages/claimed"), true), options, {}, &error));
   EXPECT_EQ(registryCode(error), kRegistryErrorInvalidOptions);
   EXPECT_TRUE(exists(at("packages/claimed/Payload/App.app")));
@@ -98,7 +97,7 @@ TEST_F(RegistryInstall, PlaceholderIsACopyWhoseDataContainerOutlivesItsReplaceme
   const std::string staged = staging / "Staged.app";
   makeBundle(staged, {.identifier = "ex.inner", .groups = {"group.game"}});
   auto placeholder = [&](const std::string& identifier, std::optional<Value> metadata, const std::string& bundle) {
-    Dictionary options{{kRegistryPackageTypeKey, kRegistryPackageTypePlaceholder}, {kBundleIdentifierKey, identifier}};
+    Dictionary options = installOptions(identifier, kRegistryPackageTypePlaceholder);
     if (metadata) options[kRegistryStoreMetadataKey] = *metadata;
     Error error;
     return registry->installBundle(URL::fileURL(bundle, true), options, &error) ? 0 : registryCode(error);

@@ -21,11 +21,10 @@ class Appregistry : public qstest::RegistryTest {
     auto registry = openRegistry();
     ASSERT_TRUE(installApp(*registry, {.identifier = kLedger, .version = "2.4.1", .groups = {"group.books"}}));
     qstest::makeBundle(at("staged.app"), {});
-    const Dictionary placeholder{{platform::kRegistryPackageTypeKey, platform::kRegistryPackageTypePlaceholder},
-                                 {platform::kBundleIdentifierKey, "com.example.a"}};
+    const Dictionary placeholder = qstest::installOptions("com.example.a", platform::kRegistryPackageTypePlaceholder);
     ASSERT_TRUE(registry->installBundle(platform::URL::fileURL(at("staged.app"), true), placeholder, nullptr));
-    ASSERT_TRUE(qstest::makeDirs(at("harbor")));
-    ASSERT_TRUE(registry->QuillsetRegisterSafeHarborForContainerType(at("harbor"), "com.example.retired", 2, nullptr));
+    ASSERT_TRUE(qstest::makeDirs(at("harbor")) &&
+                registry->QuillsetRegisterSafeHarborForContainerType(at("harbor"), "com.example.retired", 2, nullptr));
   }
   RunResult run(std::vector<std::string> args) {
     args.insert(args.end(), {"--root", base_});
@@ -35,32 +34,28 @@ class Appregistry : public qstest::RegistryTest {
   static std::string shown(std::string path) { return path.replace(path.find('\xFF'), 1, "\\xff"); }
 };
 
-TEST_F(Appregistry, ListAlignsRecordsAndShowsSafeHarborsShowPrintsOneRecordPathsEscaped) {
+// The text output aligns its columns and escapes the stray byte; the JSON
+// escapes quotes, writes each stray byte as the escape of a lone low
+// surrogate, and null for what a record does not have.
+TEST_F(Appregistry, ListAndShowAsTextAndJsonWithPathsEscaped) {
   EXPECT_NE(run({"list"}).out.find("0 records\nno safe harbors\n"), std::string::npos);
+  EXPECT_EQ(run({"list", "--json"}).out, "{\"records\":[],\"safeHarbors\":[]}\n");
   fill();
   const RunResult list = run({"list"});
   ASSERT_EQ(list.status, 0) << list.err;
-  std::vector<std::string> lines;
-  for (size_t at = 0, next; (next = list.out.find('\n', at)) != std::string::npos; at = next + 1) {
-    lines.push_back(list.out.substr(at, next - at));
-  }
-  ASSERT_GE(lines.size(), 4u) << list.out;
-  const size_t typeColumn = lines[0].find("TYPE");
-  EXPECT_EQ(lines[1].rfind("com.example.a ", 0), 0u) << "ordered by identifier";
-  EXPECT_EQ(lines[1].find("Placeholder"), typeColumn) << list.out;
-  EXPECT_NE(lines[1].find(" yes "), std::string::npos) << lines[1];
-  EXPECT_EQ(lines[2].rfind(kLedger, 0), 0u);
-  EXPECT_EQ(lines[2].find("User"), typeColumn) << list.out;
-  EXPECT_NE(lines[2].find(" 2.4.1 "), std::string::npos) << lines[2];
-  for (const std::string& text : {std::string("2 records\n"), std::string("1 safe harbor\n"),
-                                  "com.example.retired  2               " + shown(at("harbor"))}) {
+  // Ordered by identifier, each type under TYPE.
+  const size_t type = list.out.find("TYPE"), a = list.out.find("\ncom.example.a ") + 1,
+               ledger = list.out.find(std::string("\n") + kLedger + " ") + 1;
+  ASSERT_TRUE(type < a && a < ledger) << list.out;
+  EXPECT_EQ(list.out.find("Placeholder", a), a + type) << list.out;
+  EXPECT_EQ(list.out.find("User", ledger), ledger + type) << list.out;
+  for (const std::string& text :
+       {std::string(" yes "), std::string(" 2.4.1 "), std::string("2 records\n"), std::string("1 safe harbor\n"),
+        "com.example.retired  2               " + shown(at("harbor"))}) {
     EXPECT_NE(list.out.find(text), std::string::npos) << text << "\n" << list.out;
   }
-  EXPECT_EQ(list.out.find('\xFF'), std::string::npos) << "the stray byte shows escaped, never raw";
-
-  const RunResult show = run({"show", kLedger});
-  ASSERT_EQ(show.status, 0) << show.err;
   auto record = openRegistry()->recordForIdentifier(kLedger);
+  const RunResult show = run({"show", kLedger});
   for (const std::string& expected :
        {std::string("identifier:        com.example.ledger\nbundle type:       User\nversion:           2.4.1\n"),
         "bundle URL:        file://" + shown(record->bundleURL.path()),
@@ -69,22 +64,16 @@ TEST_F(Appregistry, ListAlignsRecordsAndShowsSafeHarborsShowPrintsOneRecordPaths
     EXPECT_NE(show.out.find(expected), std::string::npos) << "missing: " << expected << "\n" << show.out;
   }
   EXPECT_NE(run({"show", "com.example.a"}).out.find("group containers:  -\n"), std::string::npos);
-}
 
-// Quotes escaped, each stray byte as the escape of a lone low surrogate, and
-// null for what a record does not have.
-TEST_F(Appregistry, JsonEscapesQuotesAndBytesThatAreNotUTF8) {
-  EXPECT_EQ(run({"list", "--json"}).out, "{\"records\":[],\"safeHarbors\":[]}\n");
-  fill();
-  const RunResult list = run({"list", "--json"});
-  ASSERT_EQ(list.status, 0) << list.err;
-  EXPECT_EQ(list.out.find('\xFF'), std::string::npos);
+  const RunResult json = run({"list", "--json"});
+  ASSERT_EQ(json.status, 0) << json.err;
+  EXPECT_EQ((list.out + show.out + json.out).find('\xFF'), std::string::npos) << "stray bytes never show raw";
   const std::string jsonRoot = root_.path() + "/root \\\"q\\\" \\udcff/";
   for (const std::string& text :
        {std::string("{\"identifier\":\"com.example.ledger\",\"bundleType\":\"User\",\"version\":\"2.4.1\""),
         "\"dataContainerPath\":\"" + jsonRoot, "\"groupContainers\":{\"group.books\":\"" + jsonRoot,
         std::string("\"groupContainers\":null")}) {
-    EXPECT_NE(list.out.find(text), std::string::npos) << text << "\n" << list.out;
+    EXPECT_NE(json.out.find(text), std::string::npos) << text << "\n" << json.out;
   }
   EXPECT_NE(run({"show", "com.example.a", "--json"}).out.find("\"placeholder\":true"), std::string::npos);
 }
@@ -92,17 +81,14 @@ TEST_F(Appregistry, JsonEscapesQuotesAndBytesThatAreNotUTF8) {
 TEST_F(Appregistry, UsageErrorsExit64AndWhatCannotBeShownExits1) {
   for (const auto& args : std::vector<std::vector<std::string>>{{}, {"show"}, {"list", "--yaml"}, {"drop"}}) {
     const RunResult result = run(args);
-    EXPECT_EQ(result.status, kUsageStatus) << (args.empty() ? "" : args[0]) << "\n" << result.err;
-    EXPECT_FALSE(result.err.empty());
+    EXPECT_TRUE(result.status == kUsageStatus && !result.err.empty()) << (args.empty() ? "" : args[0]) << result.err;
   }
   EXPECT_EQ(runTool("appregistry", {"list"}).status, kUsageStatus) << "the root is required";
   const RunResult unknown = run({"show", "com.example.none"});
-  EXPECT_EQ(unknown.status, 1);
-  EXPECT_EQ(unknown.out, "");
+  EXPECT_TRUE(unknown.status == 1 && unknown.out.empty()) << unknown.out;
   EXPECT_NE(unknown.err.find("no record for com.example.none"), std::string::npos) << unknown.err;
   const RunResult missing = runTool("appregistry", {"list", "--root", root_ / "absent"});
-  EXPECT_EQ(missing.status, 1);
-  EXPECT_NE(missing.err.find("is not a directory"), std::string::npos) << missing.err;
+  EXPECT_TRUE(missing.status == 1 && missing.err.find("is not a directory") != std::string::npos) << missing.err;
 }
 
 }  // namespace

@@ -1,7 +1,6 @@
 // devicegen create: the images it writes, run as a program on temporary roots.
 #include <sys/xattr.h>
 
-#include <algorithm>
 #include <set>
 
 #include "ToolTestSupport.h"
@@ -10,56 +9,31 @@
 namespace tooltest {
 namespace {
 
-const std::vector<std::string> kStandardOptions = {
-    "--apps",    "8", "--vpn-only",     "2", "--groups",        "3", "--files-per-app", "9", "--bytes-per-file", "1500",
-    "--harbors", "2", "--placeholders", "1", "--builtin-older", "2", "--seed",          "7"};
-
-class DevicegenCreate : public ::testing::Test {
- protected:
-  RunResult create(const std::string& root, std::vector<std::string> options = kStandardOptions) {
-    options.insert(options.begin(), {"create", "--root", root});
-    return runTool("devicegen", options);
-  }
-  // An image made with the standard options.
-  std::string standardImage(const std::string& name = "image") {
-    const RunResult run = create(dir_ / name);
-    EXPECT_EQ(run.status, 0) << run.err;
-    return dir_ / name;
-  }
-  qstest::TempDir dir_{"devicegen-create"};
-};
-
-// Identical apart from the absolute paths the install map and the
-// safe-harbor map record.
-TEST_F(DevicegenCreate, SameSeedGivesIdenticalImagesUnderDifferentRootsAnotherSeedAnother) {
-  const std::string first = standardImage("first"), second = standardImage("second");
-  auto a = snapshotTree(first);
-  const auto b = snapshotTree(second);
+// Two images with the same seed are identical apart from the absolute paths
+// the install map and the safe-harbor map record; another seed gives another.
+// The manifest lists what the verifier will look for: every user item of
+// every container, as it lies on disk, with its size, digest or (relative)
+// link text.
+TEST(DevicegenCreate, SameSeedSameImageManifestListsEveryUserItemPlaceholdersMarkedIconsPNG) {
+  qstest::TempDir dir("devicegen-create");
+  const std::string root = dir / "first", second = dir / "second";
+  ASSERT_TRUE(createImage(root).status == 0 && createImage(second).status == 0);
+  auto a = snapshotTree(root);
   ASSERT_GT(a.size(), 300u);
   for (auto& [path, entry] : a) {
-    for (size_t at = entry.find(first + "/"); at != std::string::npos; at = entry.find(first + "/", at)) {
-      entry.replace(at, first.size(), second);
-    }
+    for (size_t at; (at = entry.find(root + "/")) != std::string::npos;) entry.replace(at, root.size(), second);
   }
-  const auto [x, y] = std::mismatch(a.begin(), a.end(), b.begin(), b.end());
-  EXPECT_TRUE(x == a.end() && y == b.end()) << "differs: " << (x != a.end() ? x->first : y->first);
+  EXPECT_TRUE(a == snapshotTree(second));
   std::vector<std::string> options = kStandardOptions;
   options.back() = "8";
-  ASSERT_EQ(create(dir_ / "third", options).status, 0);
-  EXPECT_NE(qstest::readFile(first + kManifest), qstest::readFile(dir_ / "third" + kManifest));
-  EXPECT_NE(listDirectory(first + kOldApplications), listDirectory(dir_ / "third" + kOldApplications));
-}
+  ASSERT_EQ(createImage(dir / "third", options).status, 0);
+  EXPECT_NE(qstest::readFile(root + kManifest), qstest::readFile(dir / "third" + kManifest));
 
-// What the verifier will look for: every user item of every container, as
-// it lies on disk, with its size, digest or (relative) link text.
-TEST_F(DevicegenCreate, ManifestListsEveryUserItemWithSizeDigestAndLinkText) {
-  const std::string root = standardImage();
   const Dictionary m = readDictionary(root + kManifest);
   std::map<std::pair<std::string, std::string>, std::string> containers;  // (owner, identifier) -> container
-  for (const char* owner : {"App", "Group"}) {
-    for (const Value& v : arrayAt(m, owner == std::string("App") ? "Containers" : "Groups")) {
+  for (auto [owner, list] : {std::pair{"App", "Containers"}, {"Group", "Groups"}}) {
+    for (const Value& v : arrayAt(m, list))
       containers[{owner, stringAt(*v.asDictionary(), "Identifier")}] = stringAt(*v.asDictionary(), "Container");
-    }
   }
   ASSERT_EQ(containers.size(), 8u + 2u + 3u);
   // The bytes of a name that is not UTF-8 are data under "<key>Bytes".
@@ -97,14 +71,10 @@ TEST_F(DevicegenCreate, ManifestListsEveryUserItemWithSizeDigestAndLinkText) {
   }
   EXPECT_EQ(m.at("Totals").asDictionary()->at("Files").uint64Value(), files);
   EXPECT_EQ(m.at("Totals").asDictionary()->at("Bytes").uint64Value(), bytes);
-}
 
-// Placeholder bundles carry the mark the migrator looks for; icons are PNG
-// images of several sizes; one name is not UTF-8.
-TEST_F(DevicegenCreate, PlaceholdersAreMarkedIconsArePNGAndOneNameIsNotUTF8) {
-  const std::string root = standardImage();
-  const Dictionary manifest = readDictionary(root + kManifest);
-  for (const Value& v : arrayAt(manifest, "Containers")) {
+  // Placeholder bundles carry the mark the migrator looks for; icons are PNG
+  // images of several sizes; one name is not UTF-8.
+  for (const Value& v : arrayAt(m, "Containers")) {
     const Dictionary& c = *v.asDictionary();
     const std::string bundle = root + "/" + stringAt(c, "Container") + "/" + stringAt(c, "Bundle");
     const bool marked = getxattr(bundle.c_str(), "user.com.vantrel.quilld.placeholder", nullptr, 0) >= 0;
@@ -126,29 +96,29 @@ TEST_F(DevicegenCreate, PlaceholdersAreMarkedIconsArePNGAndOneNameIsNotUTF8) {
 
 // Usage errors (exit 64) and an existing image (exit 1) write nothing; an
 // image without applications holds only the note.
-TEST_F(DevicegenCreate, RefusesUsageErrorsAndAnExistingImage) {
-  const std::string root = dir_ / "never";
+TEST(DevicegenCreate, RefusesUsageErrorsAndAnExistingImage) {
+  qstest::TempDir dir("devicegen-create");
+  const std::string root = dir / "never";
   for (const auto& args : std::vector<std::vector<std::string>>{{}, {"create", "--apps", "3"}, {"verify"}, {"frob"}}) {
     const RunResult run = runTool("devicegen", args);
-    EXPECT_EQ(run.status, kUsageStatus) << run.err;
-    EXPECT_FALSE(run.err.empty());
+    EXPECT_TRUE(run.status == kUsageStatus && !run.err.empty()) << run.err;
   }
-  using Options = std::vector<std::string>;
-  for (const Options& options : {Options{"--apps", "2", "--placeholders", "2", "--builtin-older", "1"},
-                                 Options{"--apps", "2", "--vpn-only", "3"}, Options{"--apps", "-1"},
-                                 Options{"--apps", "2", "--placeholders", "2", "--groups", "1"}}) {
-    EXPECT_EQ(create(root, options).status, kUsageStatus) << options.back();
+  for (const auto& [options, why] : std::vector<std::pair<std::vector<std::string>, std::string>>{
+           {{"--apps", "2", "--placeholders", "2", "--builtin-older", "1"}, "exceeds --apps"},
+           {{"--apps", "2", "--vpn-only", "3"}, "--vpn-only"},
+           {{"--apps", "-1"}, "--apps"},
+           {{"--apps", "2", "--placeholders", "2", "--groups", "1"}, "--groups"}}) {
+    const RunResult run = createImage(root, options);
+    EXPECT_TRUE(run.status == kUsageStatus && run.err.find(why) != std::string::npos) << run.err;
   }
-  EXPECT_NE(create(root, {"--apps", "1", "--builtin-older", "2"}).err.find("exceeds --apps"), std::string::npos);
   EXPECT_FALSE(exists(root));
-  ASSERT_EQ(create(root, {"--apps", "0"}).status, 0);
-  EXPECT_EQ(listDirectory(root + kOldApplications), std::vector<std::string>{"WhereDidMyApplicationsGo.txt"});
+  ASSERT_EQ(createImage(root, {"--apps", "0"}).status, 0);
+  EXPECT_EQ(entries(root + kOldApplications), std::vector<std::string>{"WhereDidMyApplicationsGo.txt"});
   EXPECT_FALSE(exists(root + kSafeHarborMap));
   EXPECT_TRUE(arrayAt(readDictionary(root + kManifest), "Items").empty());
   const auto before = snapshotTree(root);
-  const RunResult again = create(root);
-  EXPECT_EQ(again.status, 1);
-  EXPECT_NE(again.err.find("already holds an image"), std::string::npos) << again.err;
+  const RunResult again = createImage(root);
+  EXPECT_TRUE(again.status == 1 && again.err.find("already holds an image") != std::string::npos) << again.err;
   EXPECT_EQ(snapshotTree(root), before);
 }
 

@@ -7,44 +7,27 @@
 namespace tooltest {
 namespace {
 
-class DevicegenVerify : public ::testing::Test {
- protected:
-  void SetUp() override {
-    const RunResult run =
-        runTool("devicegen",
-                {"create", "--root",          root_, "--apps",           "6",   "--vpn-only", "1", "--groups",
-                 "3",      "--files-per-app", "5",   "--bytes-per-file", "700", "--harbors",  "2", "--placeholders",
-                 "1",      "--builtin-older", "1",   "--seed",           "11"});
-    ASSERT_EQ(run.status, 0) << run.err;
-  }
-  RunResult verify() { return runTool("devicegen", {"verify", "--root", root_}); }
-  static void expectLines(const RunResult& run, const std::vector<std::string>& lines) {
-    EXPECT_EQ(run.status, 1);
+// Before the migration the image fails, listing what is left and not
+// installed; after it, it passes; then each damage is reported as exactly
+// the problem it is, and an unreadable manifest fails the verification.
+TEST(DevicegenVerify, UnmigratedFailsMigratedPassesAndEachDamageIsReportedPrecisely) {
+  qstest::TempDir dir("devicegen-verify");
+  const std::string root_ = dir / "image";
+  ASSERT_EQ(createImage(root_).status, 0);
+  auto verify = [&](int status, const std::vector<std::string>& lines) {
+    const RunResult run = runTool("devicegen", {"verify", "--root", root_});
+    EXPECT_EQ(run.status, status) << run.out;
     for (const std::string& line : lines) EXPECT_NE(run.out.find(line), std::string::npos) << line << "\n" << run.out;
-  }
-
-  qstest::TempDir dir_{"devicegen-verify"};
-  const std::string root_ = dir_ / "image";
-};
-
-TEST_F(DevicegenVerify, UnmigratedImageFailsListingWhatIsLeftAndNotInstalled) {
-  expectLines(verify(),
-              {"left behind: old applications directory " + root_ + kOldApplications,
-               "registry: not installed: com.example.", "version: no last system version", "... and ", "FAILED"});
-  const RunResult absent = runTool("devicegen", {"verify", "--root", dir_ / "absent"});
+  };
+  verify(1, {"left behind: old applications directory " + root_ + kOldApplications,
+             "registry: not installed: com.example.", "version: no last system version", "... and ", "FAILED"});
+  const RunResult absent = runTool("devicegen", {"verify", "--root", dir / "absent"});
   EXPECT_EQ(absent.status, 1) << "a missing root is a failure, not a usage error";
-  EXPECT_NE(absent.err.find("realpath " + (dir_ / "absent")), std::string::npos) << absent.err;
-}
+  EXPECT_NE(absent.err.find("realpath " + (dir / "absent")), std::string::npos) << absent.err;
 
-// A migrated image passes; then each damage is reported as exactly the
-// problem it is, and an unreadable manifest fails the verification.
-TEST_F(DevicegenVerify, MigratedImagePassesAndEachDamageIsReportedPrecisely) {
-  const RunResult migration = runTool("transvale", {"--root", root_, "--progress", "never", "--log", dir_ / "log"});
-  ASSERT_EQ(migration.status, 0) << migration.err << qstest::readFile(dir_ / "log");
-  const RunResult clean = verify();
-  EXPECT_EQ(clean.status, 0) << clean.out;
-  EXPECT_NE(clean.out.find("OK: "), std::string::npos);
-
+  const RunResult migration = runTool("transvale", {"--root", root_, "--progress", "never", "--log", dir / "log"});
+  ASSERT_EQ(migration.status, 0) << migration.err << qstest::readFile(dir / "log");
+  verify(0, {"OK: "});
   auto registry = platform::SQLiteApplicationRegistry::open(root_);
   ASSERT_TRUE(registry);
   const Dictionary manifest = readDictionary(root_ + kManifest);
@@ -83,20 +66,19 @@ TEST_F(DevicegenVerify, MigratedImagePassesAndEachDamageIsReportedPrecisely) {
   ASSERT_TRUE(platform::plist::writeFile(version, platform::URL::fileURL(root_ + kLastSystemVersion)));
   ASSERT_TRUE(qstest::makeDirs(root_ + "/" + oldGroup) && qstest::writeFile(root_ + kInstallMap, "x") &&
               qstest::writeFile(root_ + kSafeHarborMap, "x") && qstest::makeDirs(root_ + kOldApplications + "/OLD"));
-  expectLines(
-      verify(),
-      {"problems: 11 (missing 2, changed 3, left behind 5, version 1)",
-       "changed: " + files[0].second + ": content differs (SHA-256 " + sha256Hex(changed),
-       "changed: " + files[1].second + ": 1 bytes, expected " + std::to_string(kept.size()),
-       "missing: " + files[2].second + " (data of " + files[2].first + ")",
-       "missing: " + groupFile + " (group " + group + ")", "changed: " + link + ": link reads \"elsewhere\"", "1A1",
-       "left behind: old applications directory " + root_ + kOldApplications + " (1 entries)",
-       "left behind: old container " + root_ + kOldApplications + "/OLD",
-       "left behind: old install map " + root_ + kInstallMap, "left behind: safe-harbor map " + root_ + kSafeHarborMap,
-       "left behind: old group container of " + group + ": " + root_ + "/" + oldGroup});
+  verify(1, {"problems: 11 (missing 2, changed 3, left behind 5, version 1)",
+             "changed: " + files[0].second + ": content differs (SHA-256 " + sha256Hex(changed),
+             "changed: " + files[1].second + ": 1 bytes, expected " + std::to_string(kept.size()),
+             "missing: " + files[2].second + " (data of " + files[2].first + ")",
+             "missing: " + groupFile + " (group " + group + ")", "changed: " + link + ": link reads \"elsewhere\"",
+             "1A1", "left behind: old applications directory " + root_ + kOldApplications + " (1 entries)",
+             "left behind: old container " + root_ + kOldApplications + "/OLD",
+             "left behind: old install map " + root_ + kInstallMap,
+             "left behind: safe-harbor map " + root_ + kSafeHarborMap,
+             "left behind: old group container of " + group + ": " + root_ + "/" + oldGroup});
 
   ASSERT_TRUE(qstest::writeFile(root_ + kManifest, "<plist>not a manifest"));
-  expectLines(verify(), {"FAILED: cannot read the manifest " + root_ + kManifest});
+  verify(1, {"FAILED: cannot read the manifest " + root_ + kManifest});
 }
 
 }  // namespace

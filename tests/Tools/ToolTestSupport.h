@@ -9,22 +9,17 @@
 #include <openssl/evp.h>
 
 #include <cstdlib>
-#include <filesystem>
 #include <map>
-#include <string>
-#include <vector>
 
-#include <gtest/gtest.h>
-
-#include "Platform/Foundation/PropertyList.h"
-#include "Platform/Registry/SQLiteRegistry.h"
-#include "support/TestSupport.h"
+#include "Platform/RegistryFixture.h"
 
 namespace tooltest {
 
 namespace fs = std::filesystem;
 using platform::Dictionary;
 using platform::Value;
+using qstest::entries;
+using qstest::exists;
 
 // Layout of an image under its root, as the programs must produce it.
 inline constexpr char kOldApplications[] = "/private/var/mobile/Applications";
@@ -35,6 +30,10 @@ inline constexpr char kSystemVersion[] = "/System/Library/CoreServices/SystemVer
 inline constexpr char kManifest[] = "/devicegen-manifest.plist";
 inline constexpr int kUsageStatus = 64;
 inline constexpr int kNotRun = 127;  // the program could not be started
+// devicegen create's options for a small image with something of every kind.
+inline const std::vector<std::string> kStandardOptions = {
+    "--apps",    "8", "--vpn-only",     "2", "--groups",        "3", "--files-per-app", "9", "--bytes-per-file", "1500",
+    "--harbors", "2", "--placeholders", "1", "--builtin-older", "2", "--seed",          "7"};
 
 struct RunResult {
   int status = -1;  // exit status; -1 when the program did not exit normally
@@ -63,6 +62,12 @@ inline RunResult runTool(const std::string& program, std::vector<std::string> ar
   }
   return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, qstest::readFile(output / "out"),
           qstest::readFile(output / "err")};
+}
+
+// Runs devicegen create on `root` with `options`.
+inline RunResult createImage(const std::string& root, std::vector<std::string> options = kStandardOptions) {
+  options.insert(options.begin(), {"create", "--root", root});
+  return runTool("devicegen", options);
 }
 
 // Every item below `root` (not following links) by path relative to it:
@@ -99,16 +104,6 @@ inline Dictionary readDictionary(const std::string& path) {
   auto dict = platform::plist::readDictionary(platform::URL::fileURL(path), &error);
   if (!dict) ADD_FAILURE() << "cannot read " << path << ": " << error.description();
   return dict ? *dict : Dictionary{};
-}
-inline bool exists(const std::string& path) {
-  std::error_code error;
-  return fs::exists(fs::symlink_status(path, error));
-}
-inline std::vector<std::string> listDirectory(const std::string& path) {
-  std::vector<std::string> names;
-  std::error_code missing;
-  for (const auto& entry : fs::directory_iterator(path, missing)) names.push_back(entry.path().filename());
-  return names;
 }
 // A string value's text, or "" (for terse lookups in manifests).
 inline std::string stringAt(const Dictionary& d, const char* key) {
