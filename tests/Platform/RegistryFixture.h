@@ -80,7 +80,6 @@ class RegistryTest : public testing::Test {
     for (const std::string& file : metadataFiles) EXPECT_TRUE(writeFile(package + "/" + file, "metadata " + file));
     return package;
   }
-  void makeBuiltIn(const std::string& name, const TestBundle& b) { makeBundle(at("Applications/" + name), b); }
   // Installs a package for `identifier`, collecting the progress reports'
   // statuses and errors, and doing `action` when the status is `at`.
   bool install(Registry& registry, const std::string& package, const std::string& identifier,

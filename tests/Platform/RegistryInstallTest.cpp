@@ -15,36 +15,9 @@ using namespace platform;
 
 using RegistryInstall = RegistryTest;
 
-TEST_F(RegistryInstall, MovesBundleAndPluginIntoNewContainersAndRemovesPackage) {
-  auto registry = openRegistry();
-  const std::string package =
-      makePackage("vpn", {.identifier = "ex.vpn"}, {.identifier = "ex.vpn.tunnel"}, {"VendraMetadata.plist"});
-  Error error;
-  ASSERT_TRUE(install(*registry, package, "ex.vpn", &error)) << error.description();
-  EXPECT_FALSE(exists(package));
-  for (auto [id, type, bundle, data] :
-       {std::tuple{"ex.vpn", kBundleTypeUser, "App.app", "Application"},
-        {"ex.vpn.tunnel", kBundleTypeVPNPlugin, "Tunnel.vpnplugin", "PluginKitPlugin"}}) {
-    std::optional<BundleRecord> r = registry->recordForIdentifier(id);
-    ASSERT_TRUE(r && r->dataContainerURL && r->groupContainerURLs) << "an installed bundle has a group dictionary";
-    EXPECT_EQ(r->bundleType, type);
-    EXPECT_EQ(r->bundleContainerURL.deletingLastPathComponent().path(), bundleContainers());
-    EXPECT_EQ(r->bundleURL.path(), r->bundleContainerURL.path() + "/" + bundle);
-    EXPECT_EQ(readFile(r->bundleURL.path() + "/main"), std::string("executable of ") + id);
-    EXPECT_EQ(r->dataContainerURL->deletingLastPathComponent().lastPathComponent(), data);
-    EXPECT_TRUE(exists(r->dataContainerURL->path()) && r->groupContainerURLs->empty());
-    EXPECT_EQ(exists(r->bundleContainerURL.path() + "/VendraMetadata.plist"), bundle == std::string("App.app"));
-  }
-
-  // A progress callback that throws loses its reports, not the installation.
-  LogCapture log;
-  EXPECT_TRUE(install(*registry, makePackage("notes", {.identifier = "ex.notes"}), "ex.notes", nullptr, "StagingFiles",
-                      [] { throw std::runtime_error("callback failure"); }));
-  EXPECT_EQ(log.count("Progress callback threw on report"), 1u);
-  EXPECT_TRUE(registry->isInstalled("ex.notes"));
-}
-
-// Any other refusal leaves the package as it was and makes no container.
+// A package whose identifier the options do not claim, that has no or two
+// applications, a broken Info.plist or a symbolic link for its application
+// is refused and left as it was, and no container is made.
 TEST_F(RegistryInstall, BadPackagesAreRefusedAndLeftAsTheyWere) {
   const std::string plist = "/Payload/App.app/Info.plist", app = "/Payload/App.app";
   const std::string array = "<?xml version=\"1.0\"?><plist version=\"1.0\"><array><string>a</string></array></plist>";
@@ -118,10 +91,9 @@ TEST_F(RegistryInstall, PlaceholderIsACopyWhoseDataContainerOutlivesItsReplaceme
   EXPECT_FALSE(exists(first.bundleContainerURL.path()));
   ASSERT_TRUE(installApp(*registry, {.identifier = "ex.game", .groups = {"group.game"}}));
   const BundleRecord real = *registry->recordForIdentifier("ex.game");
-  EXPECT_FALSE(real.isPlaceholder);
+  EXPECT_TRUE(!real.isPlaceholder && real.groupContainerURLs->size() == 1);
   EXPECT_EQ(readFile(real.dataContainerURL->path() + "/save.dat"), "level 9");
   EXPECT_FALSE(exists(second.bundleContainerURL.path()));
-  EXPECT_EQ(real.groupContainerURLs->size(), 1u);
 
   EXPECT_EQ(placeholder("ex.game", std::nullopt, staged), kRegistryErrorNotReplaceable);
   EXPECT_EQ(placeholder("ex.x", std::nullopt, staged + "x"), kRegistryErrorInvalidPackage);
@@ -143,22 +115,24 @@ int32_t protectionClass(const std::string& path) {
 // applications of the group share. The daemon's update puts class three on
 // every one, making those not looked up yet; a container that refuses it
 // fails the update but not the others'. A safe harbor is registered only
-// for an existing directory; the next one replaces it.
+// for an existing directory; the next one replaces it. A progress callback
+// that throws loses its reports, not the installation.
 TEST_F(RegistryInstall, BuiltInContainersAndTheDaemonsCalls) {
-  makeBuiltIn("Weather.app", {.identifier = "ex.weather", .version = "3", .groups = {"group.shared"}});
-  makeBuiltIn("Settings.app", {.identifier = "ex.settings", .noDataContainer = true});
-  makeBuiltIn("Maps.app", {.identifier = "ex.maps"});
-  makeBuiltIn("Clock.app", {.identifier = "ex.clock", .version = "2.10"});
+  makeBundle(at("Applications/Weather.app"), {.identifier = "ex.weather", .version = "3", .groups = {"group.shared"}});
+  makeBundle(at("Applications/Settings.app"), {.identifier = "ex.settings", .noDataContainer = true});
+  makeBundle(at("Applications/Maps.app"), {.identifier = "ex.maps"});
+  makeBundle(at("Applications/Clock.app"), {.identifier = "ex.clock", .version = "2.10"});
   auto registry = openRegistry();
   EXPECT_TRUE(entries(appDataContainers()).empty()) << "nothing is made before the first lookup";
   EXPECT_FALSE(registry->recordForIdentifier("ex.settings")->dataContainerURL) << "RkNoDataContainer";
   std::optional<BundleRecord> record = registry->recordForIdentifier("ex.weather");
   ASSERT_TRUE(record && record->dataContainerURL && record->groupContainerURLs);
-  EXPECT_EQ(std::tie(record->bundleType, record->version), std::make_tuple(std::string(kBundleTypeSystem), "3"));
-  EXPECT_EQ(record->bundleURL.path(), at("Applications/Weather.app"));
   EXPECT_EQ(openRegistry()->recordForIdentifier("ex.weather")->dataContainerURL, record->dataContainerURL);
   const std::string weather = record->dataContainerURL->path();
-  ASSERT_TRUE(installApp(*registry, {.identifier = "ex.a", .groups = {"group.shared"}}));
+  LogCapture log;
+  const std::string a = makePackage("a", {.identifier = "ex.a", .groups = {"group.shared"}});
+  ASSERT_TRUE(install(*registry, a, "ex.a", nullptr, "StagingFiles", [] { throw std::runtime_error("x"); }));
+  EXPECT_EQ(log.count("Progress callback threw on report"), 1u);
   EXPECT_EQ(registry->recordForIdentifier("ex.a")->groupContainerURLs->at("group.shared"),
             record->groupContainerURLs->at("group.shared"));
   EXPECT_EQ(entries(groupContainers()).size(), 1u);
@@ -168,7 +142,6 @@ TEST_F(RegistryInstall, BuiltInContainersAndTheDaemonsCalls) {
   EXPECT_EQ(protectionClass(weather), -1) << "without the option nothing changes";
   EXPECT_EQ(entries(appDataContainers()).size(), 2u);
   ASSERT_TRUE(setImmutable(weather, true));
-  LogCapture log;
   EXPECT_FALSE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{update, true}}));
   EXPECT_TRUE(log.contains("Could not update the data protection of ex.weather"));
   ASSERT_TRUE(setImmutable(weather, false));
@@ -182,14 +155,10 @@ TEST_F(RegistryInstall, BuiltInContainersAndTheDaemonsCalls) {
     Error error;
     EXPECT_FALSE(install(*registry, package, "ex.clock", &error)) << version;
     EXPECT_EQ(registryCode(error), kRegistryErrorAlreadyInstalled);
-    EXPECT_EQ(errors_, std::vector<std::string>{"ApplicationAlreadyInstalled"});
     EXPECT_FALSE(exists(package));
     EXPECT_EQ(registry->recordForIdentifier("ex.clock")->bundleType, kBundleTypeSystem);
     EXPECT_EQ(entries(bundleContainers()).size(), 1u) << "only ex.a's";
   }
-  std::vector<std::string> all;
-  for (const BundleRecord& r : registry->allRecords()) all.push_back(r.identifier);
-  EXPECT_EQ(all, (std::vector<std::string>{"ex.a", "ex.clock", "ex.maps", "ex.settings", "ex.weather"}));
 
   ASSERT_TRUE(makeDirs(at("harbors/game")) && makeDirs(at("harbors/two")) && writeFile(at("harbors/file"), "x"));
   EXPECT_FALSE(registry->QuillsetRegisterSafeHarborForContainerType(at("harbors/file"), "ex.b", 2, nullptr));
@@ -198,9 +167,8 @@ TEST_F(RegistryInstall, BuiltInContainersAndTheDaemonsCalls) {
   for (const char* path : {"harbors/game", "harbors/two"}) {
     EXPECT_TRUE(registry->QuillsetRegisterSafeHarborForContainerType(at(path), "ex.game", 2, nullptr));
     std::vector<SafeHarborRecord> harbors = openRegistry()->safeHarbors();
-    ASSERT_EQ(harbors.size(), 1u);
-    EXPECT_EQ(std::tie(harbors[0].identifier, harbors[0].path, harbors[0].containerType),
-              std::make_tuple(std::string("ex.game"), at(path), 2));
+    EXPECT_TRUE(harbors.size() == 1 && harbors[0].identifier == "ex.game" && harbors[0].path == at(path) &&
+                harbors[0].containerType == 2);
   }
 }
 

@@ -32,7 +32,8 @@ class RegistryRecovery : public RegistryTest {
 // stage in turn. Opening the registry again rolls back what was not
 // committed (the package whole again, nothing new left, the old record and
 // its data) or finishes what was (the old container and the package gone);
-// either way the caller's retry succeeds. Only the stages between the
+// either way the caller's retry succeeds. What was committed has the new
+// plug-in and the store metadata in their places. Only the stages between the
 // journal's writing and its clearing leave anything to recover.
 TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpened) {
   const char* stages[] = {"VerifyingApplication", "StagingFiles", "RegisteringApplication", "CleaningUp", "Complete"};
@@ -66,6 +67,18 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
       ASSERT_TRUE(install(*registry, package, id, &error)) << error.description();
       continue;
     }
+    // The application and its new plug-in in containers of their own, the
+    // store metadata beside the application only.
+    const std::optional<BundleRecord> tunnel = registry->recordForIdentifier(id + ".tunnel");
+    ASSERT_TRUE(tunnel && tunnel->dataContainerURL && exists(tunnel->dataContainerURL->path()) &&
+                tunnel->groupContainerURLs && tunnel->groupContainerURLs->empty());
+    EXPECT_EQ(record.bundleType + tunnel->bundleType, std::string(kBundleTypeUser) + kBundleTypeVPNPlugin);
+    EXPECT_EQ(record.bundleURL.path() + tunnel->bundleURL.path(),
+              record.bundleContainerURL.path() + "/App.app" + tunnel->bundleContainerURL.path() + "/Tunnel.vpnplugin");
+    EXPECT_EQ(readFile(tunnel->bundleURL.path() + "/main"), "executable of " + id + ".tunnel");
+    EXPECT_EQ(tunnel->dataContainerURL->deletingLastPathComponent().lastPathComponent(), "PluginKitPlugin");
+    EXPECT_TRUE(exists(record.bundleContainerURL.path() + "/VendraMetadata.plist") &&
+                !exists(tunnel->bundleContainerURL.path() + "/VendraMetadata.plist"));
     // Resuming, the caller finds its package gone or stages it again: a
     // replay, but not from another package or for another identifier.
     EXPECT_TRUE(install(*registry, package, id, &error)) << error.description();
