@@ -33,7 +33,6 @@ class BundleInventory : public ::testing::Test {
     return keys;
   }
 
-  supporttest::ScopedLogHandle noHandle_{std::nullopt};
   supporttest::MemoryPreferenceStore store_;
   qstest::TempDir root_{"inventory"};
   QSGlobalConfiguration config_{root_.path(), store_};

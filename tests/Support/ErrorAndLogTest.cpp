@@ -7,14 +7,12 @@
 using platform::Dictionary;
 using platform::Error;
 using platform::Value;
-using supporttest::ScopedLogHandle;
 
 namespace {
 
 constexpr char kFunction[] = "-[QSFileManager removeItemAtURL:error:]";
 
 TEST(ErrorConstructors, RecordsHoldTheirKeysAndOnlyALoggedRecordWithAFormatWritesALine) {
-  ScopedLogHandle noHandle(std::nullopt);
   qstest::LogCapture log;
   Error error = _CreateError(kFunction, 77, QSInstallerErrorDomain, 4, "Failed to remove %s: %d", "/x", 5);
   EXPECT_EQ(error.userInfo(), (Dictionary{{platform::kLocalizedDescriptionKey, Value("Failed to remove /x: 5")},
@@ -41,7 +39,7 @@ TEST(LogLevel, LinesPassAccordingToTheHandle) {
   const std::pair<std::optional<int>, std::string> cases[] = {
       {std::nullopt, "1101"}, {0, "0000"}, {4, "1001"}, {5, "1101"}, {7, "1111"}};
   for (const auto& [level, passed] : cases) {
-    ScopedLogHandle handle(level);
+    supporttest::ScopedLogHandle handle(level);
     qstest::LogCapture log;
     QS_SYSLOG(kQSLogLevelError, "f", "error");
     QS_SYSLOG(kQSLogLevelNotice, "f", "notice");

@@ -26,7 +26,6 @@ class LoadInfoPlist : public ::testing::Test {
     return URL::fileURL(dir_ / name, true);
   }
   const std::set<std::string> keys_{"RkBundleIdentifier", "RkBundleVersion"};
-  supporttest::ScopedLogHandle noHandle_{std::nullopt};
   qstest::TempDir dir_{"infoplist"};
   qstest::LogCapture log_;
 };
@@ -77,7 +76,6 @@ class Digest : public ::testing::Test {
     EXPECT_TRUE(qstest::writeFile(dir_ / name, bytes));
     return dir_ / name;
   }
-  supporttest::ScopedLogHandle noHandle_{std::nullopt};
   qstest::TempDir dir_{"digest"};
   qstest::LogCapture log_;
 };
