@@ -120,7 +120,6 @@ int32_t protectionClass(const std::string& path) {
 TEST_F(RegistryInstall, BuiltInContainersAndTheDaemonsCalls) {
   makeBundle(at("Applications/Weather.app"), {.identifier = "ex.weather", .version = "3", .groups = {"group.shared"}});
   makeBundle(at("Applications/Settings.app"), {.identifier = "ex.settings", .noDataContainer = true});
-  makeBundle(at("Applications/Maps.app"), {.identifier = "ex.maps"});
   makeBundle(at("Applications/Clock.app"), {.identifier = "ex.clock", .version = "2.10"});
   auto registry = openRegistry();
   EXPECT_TRUE(entries(appDataContainers()).empty()) << "nothing is made before the first lookup";
@@ -145,10 +144,10 @@ TEST_F(RegistryInstall, BuiltInContainersAndTheDaemonsCalls) {
   EXPECT_FALSE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{update, true}}));
   EXPECT_TRUE(log.contains("Could not update the data protection of ex.weather"));
   ASSERT_TRUE(setImmutable(weather, false));
-  EXPECT_EQ(protectionClass(registry->recordForIdentifier("ex.maps")->dataContainerURL->path()), 3);
+  EXPECT_EQ(protectionClass(registry->recordForIdentifier("ex.clock")->dataContainerURL->path()), 3);
   ASSERT_TRUE(registry->QuillsetUpdateContainerDataProtectionForMigratorOnly({{update, true}}));
   EXPECT_EQ(protectionClass(weather), 3);
-  EXPECT_EQ(entries(appDataContainers()).size(), 4u) << "built-ins, but not the one without a data container";
+  EXPECT_EQ(entries(appDataContainers()).size(), 3u) << "built-ins, but not the one without a data container";
 
   for (const char* version : {"2.9", "2.10.0"}) {  // not newer: refused, and the package removed
     std::string package = makePackage(version, {.identifier = "ex.clock", .version = version});

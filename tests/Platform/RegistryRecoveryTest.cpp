@@ -12,21 +12,7 @@ namespace {
 
 using namespace platform;
 
-class RegistryRecovery : public RegistryTest {
- protected:
-  // Installs `package` in a forked child that kills itself with SIGKILL when
-  // the installation reports `status`. True when the child died that way.
-  bool installKilledAt(const std::string& package, const std::string& id, const char* status) {
-    const pid_t child = fork();
-    if (child == 0) {
-      if (auto registry = Registry::open(base_))
-        install(*registry, package, id, nullptr, status, [] { raise(SIGKILL); });
-      _exit(3);  // the kill never came
-    }
-    int result = 0;
-    return child > 0 && waitpid(child, &result, 0) == child && WIFSIGNALED(result) && WTERMSIG(result) == SIGKILL;
-  }
-};
+using RegistryRecovery = RegistryTest;
 
 // A reinstall that adds a group, a plug-in and store metadata, killed at each
 // stage in turn. Opening the registry again rolls back what was not
@@ -47,7 +33,14 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
     const auto before = allContainers();
     const std::string package = makePackage(stages[k], {.identifier = id, .version = "2", .groups = {"group." + id}},
                                             {.identifier = id + ".tunnel"}, {"VendraMetadata.plist"});
-    ASSERT_TRUE(installKilledAt(package, id, stages[k]));
+    const pid_t child = fork();
+    if (child == 0) {  // the child installs and kills itself when the stage is reported
+      if (auto registry = Registry::open(base_))
+        install(*registry, package, id, nullptr, stages[k], [] { raise(SIGKILL); });
+      _exit(3);  // the kill never came
+    }
+    int result = 0;
+    ASSERT_TRUE(child > 0 && waitpid(child, &result, 0) == child && WIFSIGNALED(result) && WTERMSIG(result) == SIGKILL);
 
     LogCapture log;
     auto registry = openRegistry();
