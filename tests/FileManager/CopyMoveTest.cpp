@@ -73,15 +73,19 @@ class FileManagerCopy : public qstest::FileLayerTest {
   }
 };
 
-TEST_F(FileManagerCopy, TreeKeepsDataAttributesOwnersModesTimesAndLinks) {
+// A copy on the same file system, then a move of the copy to another one
+// (copy and removal of the source): both keep everything.
+TEST_F(FileManagerCopy, TreeCopiedAndMovedAcrossDevicesKeepsDataAttributesOwnersModesTimesAndLinks) {
+  qstest::ShmDir shm;
   ASSERT_NO_FATAL_FAILURE(buildSource(dir / "src"));
-  Error error = qstest::kUntouched;
+  Error error;
   ASSERT_TRUE(fm.copyItemAtURL(fileURL(dir / "src", true), fileURL(dir / "dst", true), &error)) << error.description();
-  EXPECT_TRUE(error.is("Sentinel", 99));
-  expectCopied(dir / "src", dir / "dst");
-  EXPECT_TRUE(exists(dir / "src/data")) << "a copy leaves its source";
+  ASSERT_TRUE(fm.moveItemAtURL(fileURL(dir / "dst", true), fileURL(shm / "dst", true), &error)) << error.description();
+  expectCopied(dir / "src", shm / "dst");
+  EXPECT_TRUE(exists(dir / "src/data") && !exists(dir / "dst"));
+  EXPECT_TRUE(log.systemLines().empty());
   // A directory cannot be copied into itself.
-  EXPECT_FALSE(fm.copyItemAtURL(fileURL(dir / "dst", true), fileURL(dir / "dst/sub/copy", true), &error));
+  EXPECT_FALSE(fm.copyItemAtURL(fileURL(shm / "dst", true), fileURL(shm / "dst/sub/copy", true), &error));
   EXPECT_TRUE(error.isPOSIX(EINVAL)) << error.description();
 }
 
@@ -126,22 +130,10 @@ TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitIsCopied) {
 
 using FileManagerMove = FileManagerCopy;
 
-TEST_F(FileManagerMove, CrossDeviceCopiesThenRemovesTheSource) {
-  qstest::ShmDir shm;
-  ASSERT_NO_FATAL_FAILURE(buildSource(dir / "src"));
-  ASSERT_NO_FATAL_FAILURE(buildSource(dir / "reference"));
-  Error error = qstest::kUntouched;
-  ASSERT_TRUE(fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error)) << error.description();
-  EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_FALSE(exists(dir / "src"));
-  expectCopied(dir / "reference", shm / "dst");
-  EXPECT_TRUE(log.systemLines().empty());
-}
-
 TEST_F(FileManagerMove, CrossDeviceKeepsDestinationWhenSourceRemovalFails) {
   qstest::ShmDir shm;
   ASSERT_NO_FATAL_FAILURE(qstest::makeTree(dir / "src", {"locked/file"}));
-  Error error = qstest::kUntouched;
+  Error error = qstest::kUntouched;  // the failed removal is no failure of the move
   EXPECT_TRUE(qstest::whileImmutable(dir / "src/locked", [&] {
     return fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error);
   }));
@@ -184,31 +176,17 @@ class StoreData : public qstest::FileLayerTest {
   std::string to_ = dir / "staging";
 };
 
-TEST_F(StoreData, CopyTakesTheItemsPresentAndLeavesThemAtTheSource) {
-  Error error = qstest::kUntouched;
-  EXPECT_TRUE(capture(true, true, &error));
-  EXPECT_TRUE(error.is("Sentinel", 99));
-  for (const char* item : {"Manifest.plist", "VendraArtwork/icon.png", "VendraMetadata.plist"}) {
+TEST_F(StoreData, NonFatalFailureIsLoggedAndTheRestIsCopiedAndKeptAtTheSource) {
+  ASSERT_NO_FATAL_FAILURE(blockArtworkAtTarget());
+  EXPECT_TRUE(capture(true, false));
+  for (const char* item : {"Manifest.plist", "VendraMetadata.plist"}) {
     EXPECT_EQ(qstest::readFile(to_ + "/" + item), qstest::readFile(from_ + "/" + item)) << item;
   }
-  EXPECT_FALSE(exists(to_ + "/GeoJSON"));
-  EXPECT_FALSE(exists(to_ + "/Unrelated.plist"));
-  EXPECT_TRUE(log.systemLines().empty());
-}
-
-TEST_F(StoreData, NonFatalFailureIsLoggedAndTheRestIsCaptured) {
-  ASSERT_NO_FATAL_FAILURE(blockArtworkAtTarget());
-  Error error = qstest::kUntouched;
-  EXPECT_TRUE(capture(false, false, &error));
-  EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_TRUE(exists(to_ + "/Manifest.plist"));
-  EXPECT_TRUE(exists(from_ + "/VendraArtwork/icon.png"));
-  EXPECT_TRUE(exists(to_ + "/VendraArtwork/occupied"));
-  EXPECT_TRUE(exists(to_ + "/VendraMetadata.plist"));
-  EXPECT_FALSE(exists(from_ + "/VendraMetadata.plist"));
+  EXPECT_TRUE(exists(from_ + "/VendraArtwork/icon.png") && !exists(to_ + "/VendraArtwork/icon.png"));
+  EXPECT_FALSE(exists(to_ + "/GeoJSON") || exists(to_ + "/Unrelated.plist"));
   // The one line that tells which item stayed behind.
   ASSERT_EQ(log.systemLines().size(), 1u);
-  EXPECT_EQ(log.count("Failed to move file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork"), 1u);
+  EXPECT_EQ(log.count("Failed to copy file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork"), 1u);
 }
 
 TEST_F(StoreData, FatalFailureStopsAndReturnsTheKeyedError) {
@@ -218,11 +196,10 @@ TEST_F(StoreData, FatalFailureStopsAndReturnsTheKeyedError) {
   qstest::expectInstallerError(error, kQSErrorCodeStoreDataCaptureFailed, ENOTEMPTY);
   EXPECT_EQ(error.userInfo().at(kQSLegacyErrorStringKey), platform::Value("VendraArtworkCaptureFailed"));
   // The first item went; the third was never touched.
-  EXPECT_TRUE(exists(to_ + "/Manifest.plist"));
-  EXPECT_FALSE(exists(from_ + "/Manifest.plist"));
-  EXPECT_TRUE(exists(from_ + "/VendraMetadata.plist"));
-  EXPECT_FALSE(exists(to_ + "/VendraMetadata.plist"));
-  EXPECT_EQ(log.systemLines().size(), 1u);
+  EXPECT_TRUE(exists(to_ + "/Manifest.plist") && !exists(from_ + "/Manifest.plist"));
+  EXPECT_TRUE(exists(from_ + "/VendraMetadata.plist") && !exists(to_ + "/VendraMetadata.plist"));
+  ASSERT_EQ(log.systemLines().size(), 1u);
+  EXPECT_EQ(log.count("Failed to move file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork"), 1u);
 }
 
 }  // namespace
