@@ -110,21 +110,23 @@ TEST_F(FileManagerCopy, UnreadableOrUnexaminableSourceFailsTheCopyAndMove) {
   EXPECT_EQ(status, 0);
 }
 
-TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitIsCopied) {
-  constexpr int kDepth = 1000;
-  // The copy keeps two descriptors for each of its open levels; one pair per
-  // level of this tree would need 2,000.
+// Both walks bound their open descriptors and never name a whole path.
+TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitAndPathMaxIsCopiedAndRemoved) {
+  constexpr int kDepth = 2100;  // more than PATH_MAX bytes of "/d"
+  // The copy keeps two descriptors for each of its open levels and removal
+  // one; one per level of this tree would need 2,100.
   constexpr rlim_t kDescriptorLimit = 2 * qsfs::kMaxOpenDirectories + 64;
   qstest::ShmDir shm;
   const std::string src = shm / "src", dst = shm / "dst", chain = qstest::chainPath(kDepth);
   ASSERT_NO_FATAL_FAILURE(qstest::makeChain(src, kDepth));
-  ASSERT_TRUE(qstest::writeFile(src + chain + "/bottom", "deep"));
+  ASSERT_TRUE(qstest::writeFile(src + chain.substr(0, 2000) + "/data", "deep"));
   ASSERT_EQ(chmod((src + chain.substr(0, 100)).c_str(), 0705), 0);
-  EXPECT_EQ(qstest::runWithDescriptorLimit(
-                kDescriptorLimit, [&] { return fm.copyItemAtURL(fileURL(src, true), fileURL(dst, true)) ? 0 : 1; }),
-            0);
-  EXPECT_EQ(qstest::readFile(dst + chain + "/bottom"), "deep");
-  EXPECT_EQ(qstest::readFile(dst + chain.substr(0, 1000) + "/f"), "");
+  EXPECT_EQ(qstest::runWithDescriptorLimit(kDescriptorLimit, [&] {
+    return fm.copyItemAtURL(fileURL(src, true), fileURL(dst, true)) && fm.removeItemAtURL(fileURL(src, true)) ? 0 : 1;
+  }), 0);
+  EXPECT_FALSE(exists(src));
+  EXPECT_EQ(qstest::readFile(dst + chain.substr(0, 2000) + "/data"), "deep");
+  EXPECT_TRUE(exists(dst + chain.substr(0, 4000) + "/f"));
   EXPECT_EQ(qstest::permissionsOf(dst + chain.substr(0, 100)), 0705u) << "status goes on levels that were reopened";
 }
 

@@ -52,16 +52,6 @@ TEST_F(FileManagerRemoval, ImmutableDirectoryKeepsFirstErrorAndRemovesTheRest) {
   EXPECT_FALSE(exists(dir / "tree/free0") || exists(dir / "tree/free2"));
 }
 
-// Far deeper than the walk keeps directories open and than PATH_MAX allows.
-// On tmpfs, where deep directory removal is cheap.
-TEST_F(FileManagerRemoval, VeryDeepTreeIsRemovedWithFewDescriptors) {
-  qstest::ShmDir shm;
-  const std::string deep = shm / "deep";
-  ASSERT_NO_FATAL_FAILURE(qstest::makeChain(deep, 10000));
-  EXPECT_EQ(qstest::runWithDescriptorLimit(256, [&] { return fm.removeItemAtURL(fileURL(deep, true)) ? 0 : 1; }), 0);
-  EXPECT_FALSE(exists(deep));
-}
-
 TEST_F(FileManagerRemoval, EntriesVanishingDuringRemovalAreNoFailure) {
   constexpr int kFiles = 3000;
   qstest::ShmDir shm;
