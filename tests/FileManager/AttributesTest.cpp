@@ -70,9 +70,8 @@ TEST_F(FileManagerDirectories, IntermediatesGetTheModeAndTheLastOneTheClass) {
   for (const char* p : {"a", "a/b", "a/b/c"}) EXPECT_EQ(qstest::lstatOf(dir / p)->st_mode, S_IFDIR | kMode) << p;
   EXPECT_EQ(classOf(dir / "a/b/c"), kClass);
   EXPECT_FALSE(qstest::xattrOf(dir / "a/b", qsfs::kDataProtectionClassAttributeName));
-  // An existing directory keeps its mode and gets the class again.
+  // An existing directory keeps its mode and gets the class.
   ASSERT_EQ(chmod((dir / "a").c_str(), 0750), 0);
-  ASSERT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), false, kMode, 2));
   EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), true, kMode, kClass));
   EXPECT_EQ(classOf(dir / "a"), kClass);
   EXPECT_EQ(qstest::permissionsOf(dir / "a"), 0750u);
@@ -118,8 +117,6 @@ TEST_F(Attributes, PlaceholderMarkIsFourBytesOnTheBundleItself) {
   EXPECT_TRUE(fm.bundleAtURLIsPlaceholder(bundleURL()));
   qstest::makeSymlink(bundle_, dir / "Link.app");
   EXPECT_FALSE(fm.bundleAtURLIsPlaceholder(fileURL(dir / "Link.app")));
-  qstest::setXattr(bundle_, kQSPlaceholderAttributeName, std::string(8, '\1'));
-  EXPECT_FALSE(fm.bundleAtURLIsPlaceholder(bundleURL())) << "only four bytes are a mark";
   const std::string missing = dir / "absent.app";
   Error error;
   EXPECT_FALSE(fm.markBundleAsPlaceholder(fileURL(missing, true), &error));

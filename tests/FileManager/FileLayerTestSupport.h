@@ -26,18 +26,14 @@ namespace qstest {
 // test root (ext4), removed when the object goes away.
 class ShmDir {
  public:
-  ShmDir() {
-    char buffer[] = "/dev/shm/qs-filelayer.XXXXXX";
-    EXPECT_NE(mkdtemp(buffer), nullptr) << strerror(errno);
-    path_ = buffer;
-  }
+  ShmDir() { EXPECT_NE(mkdtemp(path_.data()), nullptr) << strerror(errno); }
   ~ShmDir() { EXPECT_TRUE(QSFileManager::defaultManager().removeItemAtURL(platform::URL::fileURL(path_, true))); }
   ShmDir(const ShmDir&) = delete;
   ShmDir& operator=(const ShmDir&) = delete;
   std::string operator/(const std::string& rest) const { return path_ + "/" + rest; }
 
  private:
-  std::string path_;
+  std::string path_ = "/dev/shm/qs-filelayer.XXXXXX";
 };
 
 // The shared manager, a fresh directory and a capture of both logs.
