@@ -147,7 +147,4 @@ auto whileImmutable(const std::string& path, const Fn& fn) {
   return result;
 }
 
-// An error record that a successful call must leave as it was.
-inline const platform::Error kUntouched("Sentinel", 99);
-
 }  // namespace qstest

@@ -36,13 +36,14 @@ TEST_F(Traversal, ModesAndOwnersBecomeStandardAndLinksInsideTheTreePass) {
   // Special bits go too, also where the permission bits are already standard.
   ASSERT_NO_FATAL_FAILURE(qstest::makeTree(root_, {"private/f", "sticky/", "setuid"}));
   ASSERT_NO_FATAL_FAILURE(chmodAll({{"/private", 0700}, {"/sticky", 01755}, {"/setuid", 04644}, {"/private/f", 0600}}));
-  for (const char* rel : {"/private", "/private/f"}) ASSERT_EQ(lchown((root_ + rel).c_str(), kForeignUID, kForeignGID), 0);
+  for (const char* rel : {"/private", "/private/f"})
+    ASSERT_EQ(lchown((root_ + rel).c_str(), kForeignUID, kForeignGID), 0);
   ASSERT_EQ(mkfifo((root_ + "/fifo").c_str(), 0600), 0);
   qstest::makeSymlink("private/../setuid", root_ + "/ok");
   qstest::makeSymlink("..", root_ + "/private/up");
   Error error;
   ASSERT_TRUE(standardize(true, &error)) << error.description();
-  const std::pair<const char*, mode_t> standard[] = {{"", 0755},          {"/private", 0755}, {"/sticky", 0755},
+  const std::pair<const char*, mode_t> standard[] = {{"", 0755},           {"/private", 0755}, {"/sticky", 0755},
                                                      {"/private/f", 0644}, {"/setuid", 0644},  {"/fifo", 0644},
                                                      {"/ok", 0777}};
   for (const auto& [rel, mode] : standard) {
