@@ -153,47 +153,32 @@ TEST_F(FileManagerMove, CrossDeviceMoveNeverReplacesWhatIsAtTheDestination) {
 
 // --- Capture of the store items ------------------------------------------------
 
-class StoreData : public qstest::FileLayerTest {
- protected:
-  void SetUp() override {
-    ASSERT_NO_FATAL_FAILURE(qstest::makeTree(
-        from_, {"VendraArtwork/icon.png", "Manifest.plist", "VendraMetadata.plist", "Unrelated.plist"}));
-    ASSERT_TRUE(qstest::makeDirs(to_));
-  }
-  // A non-empty directory where the artwork would go: a rename cannot replace it.
-  void blockArtworkAtTarget() { ASSERT_NO_FATAL_FAILURE(qstest::makeTree(to_, {"VendraArtwork/occupied"})); }
-  bool capture(bool doCopy, bool fatal, Error* error = nullptr) {
-    return fm.captureStoreDataFromDirectory(fileURL(from_, true), fileURL(to_, true), doCopy, fatal, error);
-  }
+using StoreData = qstest::FileLayerTest;
 
-  std::string from_ = dir / "container";
-  std::string to_ = dir / "staging";
-};
-
-TEST_F(StoreData, NonFatalFailureIsLoggedAndTheRestIsCopiedAndKeptAtTheSource) {
-  ASSERT_NO_FATAL_FAILURE(blockArtworkAtTarget());
-  EXPECT_TRUE(capture(true, false));
+TEST_F(StoreData, FailureIsLoggedAndStopsTheCaptureOnlyWhenFatal) {
+  const std::string from = dir / "container", to = dir / "staging";
+  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(
+      from, {"VendraArtwork/icon.png", "Manifest.plist", "VendraMetadata.plist", "Unrelated.plist"}));
+  // A non-empty directory where the artwork would go: neither a copy nor a
+  // rename can replace it.
+  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(to, {"VendraArtwork/occupied"}));
+  const std::string artwork = "file://" + from + "/VendraArtwork to file://" + to + "/VendraArtwork";
+  EXPECT_TRUE(fm.captureStoreDataFromDirectory(fileURL(from, true), fileURL(to, true), true, false));
   for (const char* item : {"Manifest.plist", "VendraMetadata.plist"}) {
-    EXPECT_EQ(qstest::readFile(to_ + "/" + item), qstest::readFile(from_ + "/" + item)) << item;
+    EXPECT_EQ(qstest::readFile(to + "/" + item), qstest::readFile(from + "/" + item)) << item;
   }
-  EXPECT_TRUE(exists(from_ + "/VendraArtwork/icon.png") && !exists(to_ + "/VendraArtwork/icon.png"));
-  EXPECT_FALSE(exists(to_ + "/GeoJSON") || exists(to_ + "/Unrelated.plist"));
+  EXPECT_TRUE(exists(from + "/VendraArtwork/icon.png") && !exists(to + "/VendraArtwork/icon.png"));
+  EXPECT_FALSE(exists(to + "/GeoJSON") || exists(to + "/Unrelated.plist"));
   // The one line that tells which item stayed behind.
-  ASSERT_EQ(log.systemLines().size(), 1u);
-  EXPECT_EQ(log.count("Failed to copy file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork"), 1u);
-}
-
-TEST_F(StoreData, FatalFailureStopsAndReturnsTheKeyedError) {
-  ASSERT_NO_FATAL_FAILURE(blockArtworkAtTarget());
+  EXPECT_EQ(log.count("Failed to copy " + artwork), 1u);
+  // Fatal: the first item goes, the third is never touched.
   Error error;
-  EXPECT_FALSE(capture(false, true, &error));
+  EXPECT_FALSE(fm.captureStoreDataFromDirectory(fileURL(from, true), fileURL(to, true), false, true, &error));
   qstest::expectInstallerError(error, kQSErrorCodeStoreDataCaptureFailed, ENOTEMPTY);
   EXPECT_EQ(error.userInfo().at(kQSLegacyErrorStringKey), platform::Value("VendraArtworkCaptureFailed"));
-  // The first item went; the third was never touched.
-  EXPECT_TRUE(exists(to_ + "/Manifest.plist") && !exists(from_ + "/Manifest.plist"));
-  EXPECT_TRUE(exists(from_ + "/VendraMetadata.plist") && !exists(to_ + "/VendraMetadata.plist"));
-  ASSERT_EQ(log.systemLines().size(), 1u);
-  EXPECT_EQ(log.count("Failed to move file://" + from_ + "/VendraArtwork to file://" + to_ + "/VendraArtwork"), 1u);
+  EXPECT_TRUE(!exists(from + "/Manifest.plist") && exists(from + "/VendraMetadata.plist"));
+  EXPECT_EQ(log.count("Failed to move " + artwork), 1u);
+  EXPECT_EQ(log.systemLines().size(), 2u);
 }
 
 }  // namespace
