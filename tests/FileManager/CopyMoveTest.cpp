@@ -1,5 +1,7 @@
 // Copy and move on real trees, within and across file systems, and the
 // capture of the store items that uses them.
+#include <sys/resource.h>
+
 #include <tuple>
 
 #include "FileLayerTestSupport.h"
@@ -115,10 +117,13 @@ TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitAndPathMaxIsCopiedAndRem
   ASSERT_NO_FATAL_FAILURE(qstest::makeChain(src, kDepth));
   ASSERT_TRUE(qstest::writeFile(src + chain.substr(0, 2000) + "/data", "deep"));
   ASSERT_EQ(chmod((src + chain.substr(0, 100)).c_str(), 0705), 0);
-  auto copyAndRemove = [&] {
-    return fm.copyItemAtURL(fileURL(src, true), fileURL(dst, true)) && fm.removeItemAtURL(fileURL(src, true)) ? 0 : 1;
-  };
-  EXPECT_EQ(qstest::runWithDescriptorLimit(kDescriptorLimit, copyAndRemove), 0);
+  rlimit saved{};
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &saved), 0);
+  const rlimit lowered{kDescriptorLimit, saved.rlim_max};
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &lowered), 0);
+  const bool done = fm.copyItemAtURL(fileURL(src, true), fileURL(dst, true)) && fm.removeItemAtURL(fileURL(src, true));
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &saved), 0);
+  EXPECT_TRUE(done);
   EXPECT_FALSE(exists(src));
   EXPECT_EQ(qstest::readFile(dst + chain.substr(0, 2000) + "/data"), "deep");
   EXPECT_TRUE(exists(dst + chain.substr(0, 4000) + "/f"));

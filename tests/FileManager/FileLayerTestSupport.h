@@ -5,13 +5,10 @@
 
 #include <fcntl.h>
 #include <stdlib.h>
-#include <sys/resource.h>
-#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cstring>
-#include <functional>
 
 #include <gtest/gtest.h>
 
@@ -85,21 +82,6 @@ inline void expectInstallerError(const platform::Error& error, int64_t code, int
 // Creates a symbolic link at `at` holding `text`; fails the test otherwise.
 inline void makeSymlink(const std::string& text, const std::string& at) {
   ASSERT_EQ(symlink(text.c_str(), at.c_str()), 0) << at << ": " << strerror(errno);
-}
-
-// Runs `fn` in a forked child whose descriptor limit is `limit`; returns the
-// child's exit status (fn's result), or -1 when the child died otherwise.
-inline int runWithDescriptorLimit(rlim_t limit, const std::function<int()>& fn) {
-  pid_t pid = fork();
-  if (pid < 0) return -1;
-  if (pid == 0) {
-    const rlimit lowered{limit, limit};
-    if (setrlimit(RLIMIT_NOFILE, &lowered) != 0) _exit(125);
-    _exit(fn());
-  }
-  int status = 0;
-  if (waitpid(pid, &status, 0) != pid) return -1;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 // "/d" repeated `depth` times: the path of the bottom of a chain below its root.
