@@ -162,8 +162,8 @@ using StoreData = qstest::FileLayerTest;
 
 TEST_F(StoreData, FailureIsLoggedAndStopsTheCaptureOnlyWhenFatal) {
   const std::string from = dir / "container", to = dir / "staging";
-  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(
-      from, {"VendraArtwork/icon.png", "Manifest.plist", "VendraMetadata.plist", "Unrelated.plist"}));
+  ASSERT_NO_FATAL_FAILURE(
+      qstest::makeTree(from, {"VendraArtwork/icon.png", "Manifest.plist", "VendraMetadata.plist", "Unrelated.plist"}));
   // A non-empty directory where the artwork would go: neither a copy nor a
   // rename can replace it.
   ASSERT_NO_FATAL_FAILURE(qstest::makeTree(to, {"VendraArtwork/occupied"}));
