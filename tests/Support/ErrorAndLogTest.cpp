@@ -14,10 +14,6 @@ constexpr char kFunction[] = "-[QSFileManager removeItemAtURL:error:]";
 
 TEST(ErrorConstructors, RecordsHoldTheirKeysAndOnlyALoggedRecordWithAFormatWritesALine) {
   qstest::LogCapture log;
-  Error error = _CreateError(kFunction, 77, QSInstallerErrorDomain, 4, "Failed to remove %s: %d", "/x", 5);
-  EXPECT_EQ(error.userInfo(), (Dictionary{{platform::kLocalizedDescriptionKey, Value("Failed to remove /x: 5")},
-                                          {"FunctionName", Value(kFunction)},
-                                          {"SourceFileLine", Value(77)}}));
   // Constructor values override the additions; without a format there is no description and no line.
   Dictionary additions{{"LegacyErrorString", Value("EXTRA")}, {"FunctionName", Value("impostor")}};
   Error underlying = QSPOSIXUnderlyingError(EIO);
