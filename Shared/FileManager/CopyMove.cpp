@@ -126,6 +126,8 @@ bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, E
                                       QSErrorText(errnum)));
   };
   if (incoming.empty() || outgoing.empty()) return copyFailure(ENAMETOOLONG);
+  // rename reports EXDEV before it looks for the source.
+  if (!present(src.path())) return copyFailure(ENOENT);
   // A copy that an interrupted attempt left is incomplete: the source is
   // still here, so it is started again.
   if (int errnum = removeHidden(incoming); errnum != 0) return copyFailure(errnum);

@@ -164,6 +164,12 @@ TEST_F(FileManagerMove, CrossDeviceMoveNeverReplacesWhatIsAtTheDestinationAndLea
   EXPECT_EQ(qstest::readFile(shm / "dst"), "there");
   EXPECT_EQ(qstest::readFile(dir / "src"), "new");
   EXPECT_FALSE(exists(shm / (std::string(kQSMoveIncomingPrefix) + "dst")));
+  // Without its source, a hidden copy is all there is: it stays.
+  const std::string incoming = shm / (std::string(kQSMoveIncomingPrefix) + "other");
+  ASSERT_TRUE(qstest::writeFile(incoming, "only copy"));
+  EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "absent"), fileURL(shm / "other"), &error));
+  EXPECT_TRUE(error.isPOSIX(ENOENT)) << error.description();
+  EXPECT_EQ(qstest::readFile(incoming), "only copy");
 }
 
 // What an interrupted move can leave, and what the next attempt makes of it:
