@@ -21,7 +21,7 @@ using qstest::lstatOf;
 constexpr off_t kBlock = 4096;
 constexpr off_t kMiB = 1 << 20;
 // What a file system may allocate beyond the data (extent blocks and the like).
-constexpr off_t kAllocationSlack = 64 * 1024;
+constexpr off_t kAllocationSlack = 16 * 1024;
 
 using CopyFidelity = qstest::FileLayerTest;
 
