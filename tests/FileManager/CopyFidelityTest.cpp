@@ -203,9 +203,10 @@ TEST_F(CopyFidelity, HardLinksInTheTreeStayLinksAtAnyDepth) {
 
 // ---- Shared blocks --------------------------------------------------------
 
-// Runs a shell command line; its exit status, with its output in `output`.
+// Runs a shell command line, with the administrator's programs on its path;
+// its exit status, with its output in `output`.
 int runCommand(const std::string& commandLine, std::string& output) {
-  FILE* pipe = popen((commandLine + " 2>&1").c_str(), "r");
+  FILE* pipe = popen(("PATH=\"/usr/sbin:/sbin:$PATH\" " + commandLine + " 2>&1").c_str(), "r");
   if (pipe == nullptr) return -1;
   char buffer[512];
   while (size_t n = fread(buffer, 1, sizeof buffer, pipe)) output.append(buffer, n);
