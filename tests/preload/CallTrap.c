@@ -23,8 +23,8 @@
 // descriptor's path is the kernel's name for it ("... (deleted)" for an
 // unnamed file).
 //
-// In recording mode copy_file_range is recorded as the write of the data it
-// copied, read back from the destination.
+// copy_file_range and sendfile are recorded as the writes of the data they
+// copied, read again from the source; clones (FICLONE) are refused.
 #define _GNU_SOURCE
 #pragma GCC diagnostic ignored "-Wformat-truncation"
 #include <dlfcn.h>
@@ -38,6 +38,9 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/sendfile.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/types.h>
@@ -296,14 +299,54 @@ ssize_t copy_file_range(int in, off_t* inOffset, int out, off_t* outOffset, size
   }
   if (!countFD(out, path)) return REAL(copy_file_range)(in, inOffset, out, outOffset, length, flags);
   off_t at = outOffset ? *outOffset : lseek(out, 0, SEEK_CUR);
+  off_t from = inOffset ? *inOffset : lseek(in, 0, SEEK_CUR);
   ssize_t n = REAL(copy_file_range)(in, inOffset, out, outOffset, length, flags);
   if (n > 0 && gRecordFD >= 0) {
     char* copied = malloc((size_t)n);
-    if (!copied || pread(out, copied, (size_t)n, at) != n) abort();
+    if (!copied || pread(in, copied, (size_t)n, from) != n) abort();
     recordOnFD("write", out, NULL, at, 0, 0, copied, (size_t)n);
     free(copied);
   }
   return n;
+}
+
+// sendfile writes at the destination's file offset.
+static ssize_t sendFile(int out, int in, off_t* inOffset, size_t length) {
+  char path[PATH_MAX];
+  if (failsReading(in)) {
+    errno = EIO;
+    return -1;
+  }
+  if (!countFD(out, path)) return REAL(sendfile)(out, in, inOffset, length);
+  off_t at = lseek(out, 0, SEEK_CUR);
+  off_t from = inOffset ? *inOffset : lseek(in, 0, SEEK_CUR);
+  ssize_t n = REAL(sendfile)(out, in, inOffset, length);
+  if (n > 0 && gRecordFD >= 0) {
+    char* sent = malloc((size_t)n);
+    if (!sent || pread(in, sent, (size_t)n, from) != n) abort();
+    recordOnFD("write", out, NULL, at, 0, 0, sent, (size_t)n);
+    free(sent);
+  }
+  return n;
+}
+ssize_t sendfile(int out, int in, off_t* inOffset, size_t length) { return sendFile(out, in, inOffset, length); }
+ssize_t sendfile64(int out, int in, off_t* inOffset, size_t length) { return sendFile(out, in, inOffset, length); }
+
+// Of ioctl only a clone changes a file: it is refused here, so that copies
+// take the ways whose data the record can see.
+int ioctl(int fd, unsigned long request, ...) {
+  va_list args;
+  va_start(args, request);
+  void* argument = va_arg(args, void*);
+  va_end(args);
+  if (request == FICLONE || request == FICLONERANGE) {
+    char path[PATH_MAX];
+    if (countFD(fd, path)) {
+      errno = EOPNOTSUPP;
+      return -1;
+    }
+  }
+  return REAL(ioctl)(fd, request, argument);
 }
 
 static int truncateFD(int fd, off_t length) {
