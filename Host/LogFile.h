@@ -7,6 +7,7 @@
 #pragma once
 
 #include <cstdio>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -42,6 +43,9 @@ class LogFile {
   LogFile& operator=(const LogFile&) = delete;
 
   void write(const LogRecord& record);
+  // Also hands every record to `listener` (on the writing thread), until
+  // replaced. Set it before the sinks are installed.
+  void setListener(std::function<void(const LogRecord&)> listener) { listener_ = std::move(listener); }
   // Routes both sinks of the process here until the object is destroyed, when
   // the previous sinks are put back.
   void installSinks();
@@ -54,15 +58,10 @@ class LogFile {
   const bool owned_;
   const LogFormat format_;
   bool sinksInstalled_ = false;
+  std::function<void(const LogRecord&)> listener_;
   platform::HostLogSink previousHostSink_;
   platform::SystemLogSink previousSystemSink_;
 };
-
-// A JSON string literal (quotes included) for any bytes: valid UTF-8 passes
-// through, control characters are escaped, and each byte that is not part of
-// valid UTF-8 becomes the lone surrogate escape \udcXX, so that the original
-// bytes can be recovered (Python's "surrogateescape" convention).
-std::string jsonQuoted(std::string_view bytes);
 
 // The current time as "YYYY-MM-DDTHH:MM:SS.mmmZ".
 std::string timestampNow();

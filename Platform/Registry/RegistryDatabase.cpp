@@ -1,5 +1,7 @@
 #include "Platform/Registry/RegistryDatabase.h"
 
+#include <sys/stat.h>
+
 #include "Platform/Foundation/Format.h"
 #include "Platform/Registry/SQLiteRegistry.h"
 
@@ -51,6 +53,30 @@ constexpr char kSchema[] =
     "  source TEXT NOT NULL,"
     "  destination TEXT NOT NULL);";
 
+// Read-only opening: the suffix of the write-ahead log, and the URI
+// parameters with and without one. "readonly_shm" keeps the log's index file
+// from being written; "immutable" keeps SQLite from making either file.
+constexpr char kWriteAheadLogSuffix[] = "-wal";
+constexpr char kReadOnlyWithLog[] = "?mode=ro&readonly_shm=1";
+constexpr char kReadOnlyImmutable[] = "?mode=ro&immutable=1";
+
+// A path as the path part of a file: URI ('?', '#' and '%' would end or
+// change it).
+std::string uriEscaped(const std::string& path) {
+  static constexpr char kHex[] = "0123456789ABCDEF";
+  std::string out;
+  for (const char c : path) {
+    if (c == '?' || c == '#' || c == '%') {
+      out += '%';
+      out += kHex[static_cast<unsigned char>(c) >> 4];
+      out += kHex[static_cast<unsigned char>(c) & 0xF];
+    } else {
+      out += c;
+    }
+  }
+  return out;
+}
+
 Error sqliteFailure(const std::string& path, const std::string& what, int resultCode, const char* message) {
   Dictionary info{
       {kLocalizedDescriptionKey, Value(Format("registry database %s: %s: %s", path, what, message ? message : ""))},
@@ -83,6 +109,28 @@ std::unique_ptr<Database> Database::open(const std::string& path, Error* error) 
     return nullptr;
   }
   if (!db->execute(kSchema, error)) return nullptr;
+  return db;
+}
+
+std::unique_ptr<Database> Database::openReadOnly(const std::string& path, Error* error) {
+  struct stat status;
+  const bool hasLog = ::stat((path + kWriteAheadLogSuffix).c_str(), &status) == 0;
+  const std::string uri = "file:" + uriEscaped(path) + (hasLog ? kReadOnlyWithLog : kReadOnlyImmutable);
+  sqlite3* handle = nullptr;
+  int rc = sqlite3_open_v2(uri.c_str(), &handle, SQLITE_OPEN_READONLY | SQLITE_OPEN_URI | SQLITE_OPEN_FULLMUTEX,
+                           nullptr);
+  if (rc != SQLITE_OK) {
+    if (error) *error = sqliteFailure(path, "open for reading", rc, handle ? sqlite3_errmsg(handle) : sqlite3_errstr(rc));
+    sqlite3_close(handle);
+    return nullptr;
+  }
+  std::unique_ptr<Database> db(new Database(handle, path));
+  sqlite3_extended_result_codes(handle, 1);
+  sqlite3_busy_timeout(handle, kBusyTimeoutMilliseconds);
+  // Reading the schema proves the file is a database of ours.
+  auto check = db->prepare("SELECT count(*) FROM records;", error);
+  bool failed = false;
+  if (!check || (!check->step(&failed, error) && failed)) return nullptr;
   return db;
 }
 

@@ -28,6 +28,11 @@ class Database {
   // Opens (creating when needed) the database at `path` in WAL mode with
   // synchronous=FULL and creates the schema. Null on failure.
   static std::unique_ptr<Database> open(const std::string& path, Error* error);
+  // Opens an existing database for reading only, changing nothing on disk:
+  // with its write-ahead log when one is there (its index is then only read),
+  // else as an immutable file, so that no log or index file is made. Null on
+  // failure, also when there is no database at `path`.
+  static std::unique_ptr<Database> openReadOnly(const std::string& path, Error* error);
   ~Database();
   Database(const Database&) = delete;
   Database& operator=(const Database&) = delete;
