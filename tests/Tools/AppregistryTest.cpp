@@ -78,6 +78,7 @@ TEST_F(Appregistry, ListAndShowAsTextAndJsonWithPathsEscaped) {
 }
 
 TEST_F(Appregistry, UsageErrorsExit64AndWhatCannotBeShownExits1) {
+  fill();
   for (const auto& args : std::vector<std::vector<std::string>>{{}, {"show"}, {"list", "--yaml"}, {"drop"}}) {
     const RunResult result = run(args);
     EXPECT_TRUE(result.status == kUsageStatus && !result.err.empty()) << (args.empty() ? "" : args[0]) << result.err;

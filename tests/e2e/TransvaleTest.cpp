@@ -105,7 +105,11 @@ class EndToEnd : public testing::Test {
     std::cerr << "--- stdout ---\n"
               << out() << "--- stderr ---\n"
               << err() << "--- log (tail) ---\n"
-              << log.substr(log.size() > 6000 ? log.size() - 6000 : 0);
+              << log.substr(log.size() > 6000 ? log.size() - 6000 : 0) << "--- failure lines of the log ---\n";
+    std::istringstream lines(log);
+    for (std::string line; std::getline(lines, line);) {
+      if (line.find(" <3> ") != std::string::npos) std::cerr << line << "\n";
+    }
   }
 
   int run(const std::vector<std::string>& argv) { return Process(argv, dir_.path()).wait(); }
@@ -182,7 +186,8 @@ TEST_F(Transvale, ExitCodesOutputAndLogModes) {
       {"no migrator", ApplicationsIsAFile, {}, kExitPluginUnusable,
        {{InError, "could not create its migrator"}, {InLog, "QSAppMigrator: Failed to get items at file://" + apps}}},
       {"nothing to migrate", Empty, {"--progress", "never"}, kExitSuccess,
-       {{InOutput, "Data class: QSAppMigrator\nEstimated duration: 20\n"}, {InOutput, "transvale: migration succeeded"},
+       {{InOutput, "Data class: QSAppMigrator\nEstimated duration: 20 s\n"},
+        {InOutput, "transvale: no old application layout under {root}"}, {InOutput, "transvale: migration succeeded"},
         {NotInOutput, "progress"}, {InLog, "QSAppMigrator: Recorded current system version as 21A100"},
         {InLog, "host <5> [Transvaler] -[QSAppMigrator performMigration] (QSAppMigrator.cpp:"}}},
       {"progress bar", Empty, {"--progress", "always"}, kExitSuccess,
@@ -454,18 +459,20 @@ TEST_F(Migration, PlanChangesNothingAndForetellsWhatTheReportThenConfirms) {
   // An earlier attempt on one container: its marker, and its placeholder in
   // the registry, whose database is open (write-ahead log present) for the
   // first plan and closed for the second.
-  // An ordinary application: neither a placeholder nor one with a built-in copy.
+  // An ordinary application: neither a placeholder nor one with a built-in
+  // copy, and without a VPN plug-in (a marker without it would strand the
+  // plug-in's container, as the plan rightly says).
   const auto manifest = platform::plist::readDictionary(URL::fileURL(image_ + "/devicegen-manifest.plist"));
   ASSERT_TRUE(manifest);
   std::string container, bundle, identifier;
   for (const Value& entry : *QSValueForKey(*manifest, "Containers")->asArray()) {
     const Dictionary& c = *entry.asDictionary();
     if (*QSStringForKey(c, "Kind") != "App" || c.at("Placeholder").boolValue(true) ||
-        c.at("BuiltInRefusal").boolValue(true)) {
+        c.at("BuiltInRefusal").boolValue(true) || c.count("VPNPluginIdentifier")) {
       continue;
     }
     container = image_ + "/" + *QSStringForKey(c, "Container");
-    bundle = image_ + "/" + *QSStringForKey(c, "Bundle");
+    bundle = container + "/" + *QSStringForKey(c, "Bundle");
     identifier = *QSStringForKey(c, "Identifier");
     break;
   }
@@ -499,7 +506,11 @@ TEST_F(Migration, PlanChangesNothingAndForetellsWhatTheReportThenConfirms) {
     EXPECT_NE(out().find("com.example."), std::string::npos);
     ASSERT_EQ(run({"transvale", "--root", image_, "--plan", "--json"}), kExitSuccess) << err();
     plan = out();
-    EXPECT_EQ(treeState(image_), before) << "the plan changed the tree";
+    const auto after = treeState(image_);
+    for (const auto& [path, state] : before) {
+      EXPECT_TRUE(after.count(path) && after.at(path) == state) << "the plan changed or removed " << path;
+    }
+    for (const auto& [path, state] : after) EXPECT_TRUE(before.count(path)) << "the plan made " << path;
   }
 
   // What the image holds, as the plan tells it: 10 applications (1 placeholder,
@@ -517,13 +528,13 @@ TEST_F(Migration, PlanChangesNothingAndForetellsWhatTheReportThenConfirms) {
   EXPECT_EQ(jsonNumber(plan, "bytes", "/NOBUNDLE\""), 300);
   EXPECT_NE(plan.find("\"resumedFromMarker\": true"), std::string::npos);
   EXPECT_NE(plan.find("\"enough\": true"), std::string::npos);
-  EXPECT_EQ(jsonNumber(plan, "problem", "\"safeHarbors\""), -1) << "harbors the registry takes have no problem";
+  EXPECT_EQ(plan.find("\"problem\": \""), std::string::npos) << "harbors the registry takes have no problem";
 
   const std::string report = dir_ / "report.json";
   ASSERT_EQ(run({"transvale", "--root", image_, "--progress", "never", "--report", report}), kExitSuccess) << err();
   const std::string json = readFile(report);
   const std::pair<const char*, long long> outcomes[] = {
-      {"migrated", 12}, {"kept", 0}, {"failed", 0}, {"removed", 3}, {"exitStatus", 0}};
+      {"migrated", 12}, {"kept", 0}, {"failed", 0}, {"removed", 3}};
   for (const auto& [key, count] : outcomes) EXPECT_EQ(jsonNumber(json, key, "\"totals\""), count) << key;
   EXPECT_EQ(jsonNumber(json, "exitStatus"), 0);
   EXPECT_EQ(jsonNumber(json, "bytesMoved", "\"totals\""), manifestTotal(image_, "Bytes"));
@@ -542,7 +553,9 @@ class SmallDestination {
     mounted_ = mount("tmpfs", path.c_str(), "tmpfs", 0, (std::string("size=") + size).c_str()) == 0;
   }
   ~SmallDestination() {
-    if (mounted_) EXPECT_EQ(umount2(path_.c_str(), MNT_DETACH), 0);
+    if (mounted_) {
+      EXPECT_EQ(umount2(path_.c_str(), MNT_DETACH), 0);
+    }
   }
   bool mounted() const { return mounted_; }
 
