@@ -32,12 +32,12 @@ struct QSPlanState {
 
 namespace {
 
-// Measured on the demonstration image (docs/BENCHMARKS.md): the fixed cost of
-// one container (marker, placeholder, staging, registry transactions) and the
-// cost of each byte copied to another file system.
-constexpr double kPlanSecondsPerContainer = 0.012;
+// Measured (docs/BENCHMARKS.md, "Plan estimate"): the cost of one container
+// (marker, placeholder, staging, registry transactions and their flushes) on
+// the demonstration image, and of each byte copied to another file system.
+constexpr double kPlanSecondsPerContainer = 0.15;
 constexpr double kPlanSecondsPerCopiedByte = 1.0 / (400.0 * 1024 * 1024);
-constexpr double kPlanSecondsBase = 0.05;
+constexpr double kPlanSecondsBase = 0.3;
 
 void add(PlanSize& total, const PlanSize& more) {
   total.files += more.files;
