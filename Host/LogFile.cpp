@@ -7,6 +7,7 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <vector>
 
 #include "Platform/Foundation/Json.h"
 
@@ -64,13 +65,21 @@ std::unique_ptr<LogFile> LogFile::open(const std::string& path, LogFormat format
 
   const std::filesystem::path parent = std::filesystem::path(path).parent_path();
   if (!parent.empty()) {
+    // Only the directories made here get the log directories' mode; one that
+    // was there already (say /tmp) keeps its own.
     std::error_code ec;
+    std::vector<std::filesystem::path> made;
+    for (std::filesystem::path at = parent; !at.empty() && !std::filesystem::exists(std::filesystem::symlink_status(at, ec));
+         at = at.parent_path()) {
+      made.push_back(at);
+      if (at == at.parent_path()) break;
+    }
     std::filesystem::create_directories(parent, ec);
     if (ec) {
       *error = "cannot create the log directory " + parent.string() + ": " + ec.message();
       return nullptr;
     }
-    ::chmod(parent.c_str(), kLogDirectoryMode);
+    for (const std::filesystem::path& directory : made) ::chmod(directory.c_str(), kLogDirectoryMode);
   }
   std::FILE* stream = std::fopen(path.c_str(), "ae");
   if (!stream) {
@@ -78,6 +87,10 @@ std::unique_ptr<LogFile> LogFile::open(const std::string& path, LogFormat format
     return nullptr;
   }
   return std::unique_ptr<LogFile>(new LogFile(stream, true, format));
+}
+
+std::unique_ptr<LogFile> LogFile::discarding(LogFormat format) {
+  return std::unique_ptr<LogFile>(new LogFile(nullptr, false, format));
 }
 
 LogFile::~LogFile() {
@@ -91,8 +104,10 @@ LogFile::~LogFile() {
 void LogFile::write(const LogRecord& record) {
   const std::string line = formatRecord(record, format_, timestampNow()) + "\n";
   std::lock_guard<std::mutex> lock(mutex_);
-  std::fwrite(line.data(), 1, line.size(), stream_);
-  std::fflush(stream_);
+  if (stream_) {
+    std::fwrite(line.data(), 1, line.size(), stream_);
+    std::fflush(stream_);
+  }
   if (listener_) listener_(record);
 }
 

@@ -38,6 +38,9 @@ class LogFile {
   // Opens `path` for appending, making missing parent directories; "-" means
   // standard error. Null with a message in *error when it cannot be opened.
   static std::unique_ptr<LogFile> open(const std::string& path, LogFormat format, std::string* error);
+  // A log that keeps no line (a dry run writes nothing); lines still reach
+  // the listener.
+  static std::unique_ptr<LogFile> discarding(LogFormat format);
   ~LogFile();
   LogFile(const LogFile&) = delete;
   LogFile& operator=(const LogFile&) = delete;
@@ -54,7 +57,7 @@ class LogFile {
   LogFile(std::FILE* stream, bool owned, LogFormat format) : stream_(stream), owned_(owned), format_(format) {}
 
   std::mutex mutex_;  // guards stream_ and serialises lines
-  std::FILE* stream_;
+  std::FILE* stream_;  // null: lines are not kept
   const bool owned_;
   const LogFormat format_;
   bool sinksInstalled_ = false;

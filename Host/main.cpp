@@ -31,7 +31,6 @@ namespace {
 
 constexpr char kSystemRootVariable[] = "QS_SYSTEM_ROOT";
 constexpr char kDefaultLogPathInRoot[] = "/private/var/mobile/Library/Logs/Transvale/transvale.log";
-constexpr char kDiscardedLog[] = "/dev/null";
 constexpr char kTemporarySuffix[] = ".tmp";
 // How often the progress display is refreshed while the run goes on.
 constexpr std::chrono::milliseconds kProgressInterval(100);
@@ -141,9 +140,10 @@ int main(int argc, char** argv) {
 
   std::string error;
   // A plan changes nothing on disk, so it writes no log unless asked to.
-  const std::string logPath =
-      options->log.value_or(options->plan ? kDiscardedLog : systemRoot + kDefaultLogPathInRoot);
-  std::unique_ptr<LogFile> log = LogFile::open(logPath, options->logFormat, &error);
+  const std::string logPath = options->log.value_or(systemRoot + kDefaultLogPathInRoot);
+  std::unique_ptr<LogFile> log = options->plan && !options->log
+                                     ? LogFile::discarding(options->logFormat)
+                                     : LogFile::open(logPath, options->logFormat, &error);
   if (!log) {
     std::fprintf(stderr, "transvale: %s\n", error.c_str());
     return kExitUsage;

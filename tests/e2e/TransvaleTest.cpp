@@ -253,6 +253,22 @@ TEST_F(Transvale, ExitCodesOutputAndLogModes) {
   }
 }
 
+// A log in a directory that exists leaves that directory's mode alone (a log
+// in /tmp must not take its sticky, world-writable mode away); directories
+// made for a log get 0755.
+TEST_F(Transvale, LogDirectoriesGetTheirModeOnlyWhenMadeForTheLog) {
+  makeLayout(Layout::Empty);
+  const std::string shared = dir_ / "shared";
+  ASSERT_TRUE(makeDirs(shared));
+  ASSERT_EQ(chmod(shared.c_str(), 01777), 0);
+  ASSERT_EQ(run({"transvale", "--root", image_, "--progress", "never", "--log", shared + "/made/x.log"}), kExitSuccess);
+  struct stat st {};
+  ASSERT_EQ(stat(shared.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 01777u);
+  ASSERT_EQ(stat((shared + "/made").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0755u);
+}
+
 // --- Migrations of device images -------------------------------------------------------------
 
 class Migration : public EndToEnd {
