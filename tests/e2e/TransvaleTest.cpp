@@ -261,7 +261,9 @@ TEST_F(Transvale, LogDirectoriesGetTheirModeOnlyWhenMadeForTheLog) {
   const std::string shared = dir_ / "shared";
   ASSERT_TRUE(makeDirs(shared));
   ASSERT_EQ(chmod(shared.c_str(), 01777), 0);
-  ASSERT_EQ(run({"transvale", "--root", image_, "--progress", "never", "--log", shared + "/made/x.log"}), kExitSuccess);
+  for (const char* log : {"/x.log", "/made/x.log"}) {
+    ASSERT_EQ(run({"transvale", "--root", image_, "--progress", "never", "--log", shared + log}), kExitSuccess);
+  }
   struct stat st {};
   ASSERT_EQ(stat(shared.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 01777u);
