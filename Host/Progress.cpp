@@ -14,7 +14,8 @@ namespace {
 
 constexpr char kBarDone = '#';
 constexpr char kBarToDo = '-';
-// The bar takes what the text beside it leaves, within these bounds.
+// The bar takes a share of the terminal's width, within these bounds.
+constexpr int kBarShareOfWidth = 3;
 constexpr int kMinimumBarWidth = 10;
 constexpr int kMaximumBarWidth = 40;
 constexpr int kDefaultColumns = 80;
@@ -125,9 +126,9 @@ std::string ProgressDisplay::barLine(const ProgressSample& sample, int columns) 
   text += "  " + minutesAndSeconds(elapsed) + (remaining ? " (" + minutesAndSeconds(*remaining) + " left)" : "");
   if (!sample.current.empty()) text += "  " + sample.current;
 
-  // "[" bar "] " text, cut to the terminal's width.
-  const int room = columns - 1 - static_cast<int>(text.size()) - 3;
-  const int width = std::clamp(room, kMinimumBarWidth, kMaximumBarWidth);
+  // "[" bar "] " text, cut to the terminal's width. The bar keeps a third of
+  // the width whatever the text, so that it does not jump as the text changes.
+  const int width = std::clamp(columns / kBarShareOfWidth, kMinimumBarWidth, kMaximumBarWidth);
   const int filled = known ? static_cast<int>(sample.fraction * static_cast<float>(width)) : 0;
   std::string line = "[" + std::string(static_cast<size_t>(filled), kBarDone) +
                      std::string(static_cast<size_t>(width - filled), kBarToDo) + "] " + text;
