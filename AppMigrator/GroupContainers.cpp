@@ -73,6 +73,7 @@ bool QSAppMigrator::_migrateGroupContainersForIdentifier(const std::string& iden
     QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: No group containers to migrate for %@", identifier);
     return true;
   }
+  if (!_groupContainersFitForIdentifier(identifier, *record->groupContainerURLs)) return false;
   // The record's dictionary is walked while the map loses entries. A group
   // whose items did not all move keeps this application's container, and
   // with it the record of what is left, for a later run.
