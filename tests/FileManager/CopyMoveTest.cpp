@@ -1,7 +1,9 @@
 // Copy and move on real trees, within and across file systems, and the
 // capture of the store items that uses them.
+#include <sys/mount.h>
 #include <sys/resource.h>
 
+#include <memory>
 #include <tuple>
 
 #include "FileLayerTestSupport.h"
@@ -170,6 +172,26 @@ TEST_F(FileManagerMove, CrossDeviceMoveNeverReplacesWhatIsAtTheDestinationAndLea
   EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "absent"), fileURL(shm / "other"), &error));
   EXPECT_TRUE(error.isPOSIX(ENOENT)) << error.description();
   EXPECT_EQ(qstest::readFile(incoming), "only copy");
+}
+
+// A destination file system that fills up in the middle of the copy: the
+// move fails with the copy's error, the source stays whole where it was and
+// no part of the copy is left taking space at the destination.
+TEST_F(FileManagerMove, CrossDeviceMoveThatRunsOutOfSpaceLeavesTheSourceWholeAndNoPartialCopy) {
+  const std::string small = dir / "small";
+  ASSERT_EQ(mkdir(small.c_str(), 0755), 0);
+  ASSERT_EQ(mount("none", small.c_str(), "tmpfs", 0, "size=256k"), 0) << strerror(errno);
+  const std::unique_ptr<const char, void (*)(const char*)> unmount(small.c_str(), [](const char* path) {
+    EXPECT_EQ(umount2(path, MNT_DETACH), 0) << strerror(errno);
+  });
+  ASSERT_TRUE(qstest::makeDirs(dir / "src"));
+  const std::string chunk(100 << 10, 'q');
+  for (const char* name : {"a", "b", "c", "d"}) ASSERT_TRUE(qstest::writeFile(dir / "src/" + name, chunk)) << name;
+  Error error;
+  EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(small + "/dst", true), &error));
+  EXPECT_TRUE(error.isPOSIX(ENOSPC)) << error.description();
+  for (const char* name : {"a", "b", "c", "d"}) EXPECT_EQ(qstest::readFile(dir / "src/" + name), chunk) << name;
+  EXPECT_EQ(fm.urlsForItemsInDirectoryAtURL(fileURL(small, true), false)->size(), 0u);
 }
 
 // What an interrupted move can leave, and what the next attempt makes of it:

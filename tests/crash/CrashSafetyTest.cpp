@@ -45,9 +45,9 @@ constexpr int kRunsToFinish = 3;  // a run may fail once on what a crash left, t
 const std::vector<std::string> kSmallImage{"--apps", "1", "--groups", "1", "--files-per-app", "1",
                                            "--bytes-per-file", "2000", "--seed", "3"};
 const std::string kTrap = kBin + "/../lib/libqs_calltrap.so";
-// Every how many calls a kill or a power cut is tried: QS_CRASH_STRIDE, 3 by
-// default to keep the suite's time bounded (1 tries every call).
-const long kStride = getenv("QS_CRASH_STRIDE") ? std::max(1L, atol(getenv("QS_CRASH_STRIDE"))) : 3;
+// Every how many calls a kill or a power cut is tried: QS_CRASH_STRIDE, 1 by
+// default (every call); a larger stride gives a quicker run by hand.
+const long kStride = getenv("QS_CRASH_STRIDE") ? std::max(1L, atol(getenv("QS_CRASH_STRIDE"))) : 1;
 
 enum class Layout { SameFileSystem, ContainersOnTmpfs };
 
