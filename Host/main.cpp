@@ -1,6 +1,7 @@
 // transvale: the data-migration host. Loads the application-migration
 // plug-in, creates its migrator, runs the migration on a worker thread while it
 // shows progress, and routes every log line of the process into one log.
+#include <malloc.h>
 #include <stdlib.h>
 #include <unistd.h>
 
@@ -67,7 +68,19 @@ bool runMigration(platform::DataClassMigrator& migrator, ProgressDisplay& displa
 
 }  // namespace
 
+// The migration frees and allocates the same few hundred kilobytes for every
+// application (icon surfaces, the PNG encoder's zlib state). Handing them back
+// to the kernel at each free and faulting them in again, with a TLB flush on
+// every core the process runs on, cost about half its system time; kept for
+// reuse instead, they add nothing to the peak.
+namespace {
+constexpr int kMallocMmapThreshold = 4 << 20;
+constexpr int kMallocTrimThreshold = 32 << 20;
+}  // namespace
+
 int main(int argc, char** argv) {
+  (void)mallopt(M_MMAP_THRESHOLD, kMallocMmapThreshold);  // only a tuning: a refusal changes nothing else
+  (void)mallopt(M_TRIM_THRESHOLD, kMallocTrimThreshold);
   int exitCode = kExitUsage;
   std::optional<Options> options = parseOptions(argc, argv, &exitCode);
   if (!options) return exitCode;
