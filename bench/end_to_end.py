@@ -12,6 +12,7 @@ copy made with `cp -a` outside the timed part. Each repetition runs, in turn:
          moved into a new group container)
   transvale as it is (flushes included), for information
   floor that also flushes each new data and group container once
+(the last two only for the sizes of --wall-sizes)
 
 It reports (a) the work apart from flushes: medians of transvale without
 flushes against the floor, their ratio and ms per application; (b) flushes and
@@ -20,7 +21,7 @@ peak RSS, and the real wall times. Waiting for the disk is noisy on a shared
 machine, the rest is not; hence the split and the medians of alternating runs.
 
   bench/end_to_end.py --build build [--sizes 100,1000,5000] [--repetitions 5]
-      [--strace-sizes 100,1000] [--work DIR] [--keep] [--json FILE]
+      [--strace-sizes 100,1000] [--wall-sizes 100] [--work DIR] [--keep] [--json FILE]
 
 The script also runs the floor itself: end_to_end.py floor ROOT [--flush].
 """
@@ -129,7 +130,7 @@ class Tools:
 
 
 def run_measured(argv, env, log):
-    """Runs argv to its end; (seconds, peak RSS in KiB). Fails on a non-zero exit."""
+    """Runs argv to its end; (wall seconds, CPU seconds, peak RSS in KiB). Fails on a non-zero exit."""
     with open(log, "ab") as err:
         start = time.perf_counter()
         child = subprocess.Popen(argv, env=env, stdout=subprocess.DEVNULL, stderr=err)
@@ -138,7 +139,7 @@ def run_measured(argv, env, log):
         child.returncode = os.waitstatus_to_exitcode(status)
     if child.returncode != 0:
         sys.exit(f"end_to_end.py: {' '.join(argv)} exited with {child.returncode}; see {log}")
-    return elapsed, usage.ru_maxrss
+    return elapsed, usage.ru_utime + usage.ru_stime, usage.ru_maxrss
 
 
 def run_root(work):
@@ -209,23 +210,26 @@ def strace_counts(tools, root, work):
     return counts
 
 
-def measure(tools, work, size, repetitions, with_strace, log):
+def measure(tools, work, size, repetitions, with_strace, with_flushes, log):
     image = make_image(tools, work, size)
-    times = {variant: [] for variant in VARIANTS}
+    variants = VARIANTS if with_flushes else VARIANTS[:2]
+    times = {variant: [] for variant in variants}
+    cpu = {variant: [] for variant in variants}
     peak_rss = 0
     for repetition in range(repetitions):
-        for variant in VARIANTS:
+        for variant in variants:
             root = fresh_copy(image, work)
             argv, env = command(tools, variant, root)
-            seconds, rss = run_measured(argv, env, log)
+            seconds, cpu_seconds, rss = run_measured(argv, env, log)
             times[variant].append(seconds)
+            cpu[variant].append(cpu_seconds)
             if variant.startswith("transvale"):
                 peak_rss = max(peak_rss, rss)
                 if repetition == 0:
                     verify(tools, root, log)
-            print(f"  {size} apps, run {repetition + 1}/{repetitions}, {variant}: {seconds * 1000:.0f} ms",
-                  file=sys.stderr)
-    result = {"size": size, "times": times, "peak_rss_kib": peak_rss}
+            print(f"  {size} apps, run {repetition + 1}/{repetitions}, {variant}: {seconds * 1000:.0f} ms "
+                  f"(CPU {cpu_seconds * 1000:.0f} ms)", file=sys.stderr)
+    result = {"size": size, "times": times, "cpu": cpu, "peak_rss_kib": peak_rss}
     if with_strace:
         result["syscalls"] = strace_counts(tools, fresh_copy(image, work), work)
     remove_run(work)
@@ -237,18 +241,23 @@ def measure(tools, work, size, repetitions, with_strace, log):
 
 def report(results, repetitions):
     out = []
-    out.append(f"(a) Work apart from flushes: medians of {repetitions} alternating runs on fresh copies")
+    out.append(f"(a) Work apart from flushes: medians of {repetitions} alternating runs on fresh copies, wall time "
+               "and CPU time (user + system) of the process")
     out.append("")
-    out.append("| Applications | transvale, no flushes | floor | ratio | transvale ms/app | floor ms/app |")
-    out.append("|---:|---:|---:|---:|---:|---:|")
+    out.append("| Applications | transvale, no flushes | floor | ratio | transvale ms/app | floor ms/app "
+               "| CPU: transvale | CPU: floor | CPU ratio |")
+    out.append("|---:|---:|---:|---:|---:|---:|---:|---:|---:|")
     per_app = {}
     for r in results:
         n = r["size"]
         work = statistics.median(r["times"]["transvale-noflush"])
         bare = statistics.median(r["times"]["floor"])
+        work_cpu = statistics.median(r["cpu"]["transvale-noflush"])
+        bare_cpu = statistics.median(r["cpu"]["floor"])
         per_app[n] = work * 1000 / n
         out.append(f"| {n:,} | {work * 1000:.0f} ms | {bare * 1000:.0f} ms | {work / bare:.2f}x | "
-                   f"{work * 1000 / n:.2f} | {bare * 1000 / n:.2f} |")
+                   f"{work * 1000 / n:.2f} | {bare * 1000 / n:.2f} | {work_cpu * 1000:.0f} ms | "
+                   f"{bare_cpu * 1000:.0f} ms | {work_cpu / bare_cpu:.2f}x |")
     sizes = sorted(per_app)
     if len(sizes) > 1:
         out.append("")
@@ -277,6 +286,8 @@ def report(results, repetitions):
     out.append("|---:|---:|---:|---:|---:|")
     for r in results:
         n = r["size"]
+        if "transvale" not in r["times"]:
+            continue
         real = statistics.median(r["times"]["transvale"])
         bare = statistics.median(r["times"]["floor-flush"])
         out.append(f"| {n:,} | {real * 1000:.0f} ms | {bare * 1000:.0f} ms | {real / bare:.2f}x | "
@@ -297,6 +308,8 @@ def main():
     parser.add_argument("--sizes", default=DEFAULT_SIZES, help=f"applications per image (default: {DEFAULT_SIZES})")
     parser.add_argument("--repetitions", type=int, default=DEFAULT_REPETITIONS)
     parser.add_argument("--strace-sizes", default=None, help="sizes traced with strace (default: all)")
+    parser.add_argument("--wall-sizes", default=None,
+                        help="sizes also run with real flushes, for information (default: all)")
     parser.add_argument("--work", help="directory for images and runs (images are reused; default: a new one)")
     parser.add_argument("--keep", action="store_true", help="keep the work directory")
     parser.add_argument("--json", help="also write the raw figures here")
@@ -304,13 +317,14 @@ def main():
     tools = Tools(options.build)
     sizes = [int(s) for s in options.sizes.split(",")]
     traced = sizes if options.strace_sizes is None else [int(s) for s in options.strace_sizes.split(",") if s]
+    flushed = sizes if options.wall_sizes is None else [int(s) for s in options.wall_sizes.split(",") if s]
     if traced and not shutil.which("strace"):
         sys.exit("end_to_end.py: strace is missing (apt-get install strace)")
     work = os.path.abspath(options.work) if options.work else tempfile.mkdtemp(prefix="qs-end-to-end-")
     os.makedirs(work, exist_ok=True)
     log = os.path.join(work, "runs.log")
     try:
-        results = [measure(tools, work, n, options.repetitions, n in traced, log) for n in sizes]
+        results = [measure(tools, work, n, options.repetitions, n in traced, n in flushed, log) for n in sizes]
     finally:
         if not options.keep and not options.work:
             shutil.rmtree(work, ignore_errors=True)
