@@ -39,6 +39,9 @@ bool QSAppMigrator::_migrateDataContainerForIdentifier(const std::string& identi
   for (const std::string& name : QSGlobalConfiguration::sharedInstance().appUserDataItemNames()) {
     const URL source = fromURL.appending(name, true);
     const URL destination = toURL.appending(name, true);
+    // What an interrupted move of this item left goes first; a source set
+    // aside whose copy cannot be found stays, a missed item of the container.
+    (void)fileManager.finishInterruptedMoveOfItemAtURL(source, destination);
     if (!fileManager.itemExistsAtURL(source)) continue;
 
     // Replace, never merge: whatever the new container holds under this name

@@ -28,13 +28,26 @@ bool moveAllItems(const URL& source, const URL& destination, size_t* failedItems
   }
   *failedItems = 0;
   for (const URL& item : *items) {
-    const URL target = destination.appending(item.lastPathComponent());
+    const std::string name = item.lastPathComponent();
+    if (name.starts_with(kQSMoveOutgoingPrefix)) {
+      // An item an interrupted run had already moved, set aside for removal:
+      // it goes once its copy is found in the new container, else it stays.
+      const std::string moved = name.substr(std::string_view(kQSMoveOutgoingPrefix).size());
+      if (!fm.finishInterruptedMoveOfItemAtURL(source.appending(moved), destination.appending(moved))) ++*failedItems;
+      continue;
+    }
+    const URL target = destination.appending(name);
+    (void)fm.finishInterruptedMoveOfItemAtURL(item, target);
     // The outcome is not tested: the move that follows fails if the old item
     // is still in the way.
     (void)fm.removeItemAtURL(target);
     if (!fm.moveItemIfExistsAtURL(item, target, &error)) {
       QSAM_LOG(kQSLogLevelError, kMoveAllFunction, "QSAppMigrator: Failed to move item %@ to %@ : %@", item.path(),
                target.path(), error);
+      ++*failedItems;
+    } else if (fm.itemExistsAtURL(item)) {
+      // Copied to another file system, but the source could not be set
+      // aside: it is still the item of the old container.
       ++*failedItems;
     }
   }
@@ -61,14 +74,17 @@ bool QSAppMigrator::_migrateGroupContainersForIdentifier(const std::string& iden
     return true;
   }
   if (!_groupContainersFitForIdentifier(identifier, *record->groupContainerURLs)) return false;
-  // The record's dictionary is walked while the map loses entries.
+  // The record's dictionary is walked while the map loses entries. A group
+  // whose items did not all move keeps this application's container, and
+  // with it the record of what is left, for a later run.
+  bool everyGroupMoved = true;
   for (const auto& [group, newContainer] : *record->groupContainerURLs) {
-    _migrateGroupContainer(identifier, group, newContainer);
+    if (!_migrateGroupContainer(identifier, group, newContainer)) everyGroupMoved = false;
   }
-  return true;
+  return everyGroupMoved;
 }
 
-void QSAppMigrator::_migrateGroupContainer(const std::string& identifier, const std::string& group,
+bool QSAppMigrator::_migrateGroupContainer(const std::string& identifier, const std::string& group,
                                            const URL& newContainer) {
   const auto entry = _groupContainerMap->find(group);
   const platform::Dictionary* entryDictionary =
@@ -76,41 +92,45 @@ void QSAppMigrator::_migrateGroupContainer(const std::string& identifier, const 
   if (!entryDictionary) {
     QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: No group container entry to migrate for %@[%@]",
              identifier, group);
-    return;
+    return true;
   }
   const platform::Value* path = entry->second.get(kQSGroupContainerPathKey);
   if (!path || !path->isString()) {
     QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: Failed to get path to group container for %@[%@]",
              identifier, group);
-    return;
+    return true;
   }
   const URL oldContainer = URL::fileURL(*path->asString(), true);
   const QSFileManager& fm = QSFileManager::defaultManager();
   if (!fm.itemExistsAtURL(oldContainer)) {
     QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Missing source group container at %@",
              oldContainer.path());
-    return;
+    return true;
   }
   QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: Migrating group container %@ at %@ to %@", group,
            oldContainer, newContainer);
   size_t failedItems = 0;
-  if (!moveAllItems(oldContainer, newContainer, &failedItems)) return;
-  _groupContainerMap->erase(entry);
+  // A container that cannot be listed keeps everything, as one whose items
+  // did not all move.
+  if (!moveAllItems(oldContainer, newContainer, &failedItems)) return false;
 
-  // Items that could not be moved are still in the old group container: it is
-  // kept so that nothing is lost. Its map entry goes all the same, as for any
-  // group whose items have been moved, so it is not moved a second time.
+  // Items that could not be moved are still in the old group container: it
+  // keeps them, and its map entry keeps pointing at it, so that the next
+  // attempt (of this application, kept for it, or of another member of the
+  // group) moves them.
   if (failedItems > 0) {
     QSAM_LOG(kQSLogLevelError, kMigrateFunction,
              "QSAppMigrator: Keeping old group container at %@ : %lu items could not be moved", oldContainer.path(),
              static_cast<unsigned long>(failedItems));
-    return;
+    return false;
   }
+  _groupContainerMap->erase(entry);
   Error error;
   if (!fm.removeItemAtURL(oldContainer, &error)) {
     QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Failed to remove old group container at %@ : %@",
              oldContainer.path(), error);
   }
+  return true;
 }
 
 bool QSAppMigrator::_moveAllItemsInGroupContainerURL(const URL& source, const URL& toGroupContainerURL) {

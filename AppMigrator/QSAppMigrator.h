@@ -206,8 +206,9 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   // caller removes the staged directory afterwards.
   bool _installPlaceholderStagedAtURL(const platform::URL& staged, const platform::URL& bundle,
                                       const std::string& identifier, const platform::URL& storeMetadataURL);
-  // The per-group step of _migrateGroupContainersForIdentifier.
-  void _migrateGroupContainer(const std::string& identifier, const std::string& group,
+  // The per-group step of _migrateGroupContainersForIdentifier: false when
+  // items of the group were left in its old container (its map entry stays).
+  bool _migrateGroupContainer(const std::string& identifier, const std::string& group,
                               const platform::URL& newContainer);
 
   // Fields of the run, in their declared order.

@@ -1,6 +1,7 @@
 // Group containers: emptied into the new ones the registry names, removed, and
 // dropped from the map, without ever losing an item that could not be moved.
 #include "FakePlatform.h"
+#include "Shared/FileManager/QSFileManager.h"
 
 namespace qstest {
 namespace {
@@ -64,7 +65,8 @@ TEST_F(GroupContainerMigration, EntriesThatCannotBeMovedAreSkippedAndKept) {
   groupMap_["group.file"] = Value(Dictionary{{"Container", Value(file)}});
   createAndInstall("com.example.a", {"group.number", "group.file"});
 
-  EXPECT_TRUE(migrate("com.example.a"));
+  // The unlistable container keeps the application's container (false).
+  EXPECT_FALSE(migrate("com.example.a"));
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get path to group container for com.example.a[group.number]"));
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get all urls in source group container " + file + " : ", true));
   EXPECT_TRUE(pathExists(number + "/f"));
@@ -80,18 +82,29 @@ TEST_F(GroupContainerMigration, EntriesThatCannotBeMovedAreSkippedAndKept) {
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get bundle proxy for com.example.b"));
 }
 
-TEST_F(GroupContainerMigration, ItemThatCannotMoveKeepsTheOldContainer) {
+TEST_F(GroupContainerMigration, ItemThatCannotMoveKeepsTheGroupRecordedUntilALaterAttemptMovesIt) {
   const std::string old = addOldGroup("group.a", {"movable", "stuck"});
   createAndInstall("com.example.a", {"group.a"});
-  makeImmutable(old + "/stuck");
-  EXPECT_TRUE(migrate("com.example.a"));
-  EXPECT_EQ(readFile(newGroups_ + "/group.a/movable"), "old movable");
+  // What a move killed after it set its source aside leaves: the aside, and
+  // its complete copy in the new container.
+  const std::string fresh = newGroups_ + "/group.a";
+  ASSERT_TRUE(writeFile(old + "/" + kQSMoveOutgoingPrefix + "done", "old done") &&
+              writeFile(fresh + "/done", "old done"));
+  ASSERT_TRUE(setImmutable(old + "/stuck", true));  // cleared below, or by the scratch directory
+  EXPECT_FALSE(migrate("com.example.a"));
+  EXPECT_EQ(readFile(fresh + "/movable"), "old movable");
   EXPECT_EQ(readFile(old + "/stuck"), "old stuck");
-  EXPECT_FALSE(mapHas("group.a"));
+  EXPECT_EQ(directoryNames(old), std::vector<std::string>{"stuck"});
+  EXPECT_EQ(readFile(fresh + "/done"), "old done");
+  EXPECT_TRUE(mapHas("group.a"));
   EXPECT_TRUE(loggedOnce(
-      "QSAppMigrator: Failed to move item " + old + "/stuck to " + newGroups_ + "/group.a/stuck : Error Domain=",
-      true));
+      "QSAppMigrator: Failed to move item " + old + "/stuck to " + fresh + "/stuck : Error Domain=", true));
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Keeping old group container at " + old + " : 1 items could not be moved"));
+
+  ASSERT_TRUE(setImmutable(old + "/stuck", false));
+  EXPECT_TRUE(migrate("com.example.a"));
+  EXPECT_EQ(readFile(fresh + "/stuck"), "old stuck");
+  EXPECT_FALSE(pathExists(old) || mapHas("group.a"));
 }
 
 }  // namespace

@@ -132,21 +132,30 @@ TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitAndPathMaxIsCopiedAndRem
 
 using FileManagerMove = qstest::FileLayerTest;
 
-TEST_F(FileManagerMove, CrossDeviceKeepsDestinationWhenSourceRemovalFails) {
+// A source that cannot be removed whole (an immutable file in it) is left
+// set aside, beside its complete copy; the next attempt on the item finds
+// the copy and removes the aside once it can.
+TEST_F(FileManagerMove, CrossDeviceSourceThatCannotBeRemovedStaysAsideBesideItsCompleteCopy) {
   qstest::ShmDir shm;
-  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(dir / "src", {"locked/file"}));
+  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(dir / "src", {"keep.txt", "locked.txt"}));
+  const std::string aside = dir / (std::string(kQSMoveOutgoingPrefix) + "src");
   Error error("Sentinel", 99);  // the failed removal is no failure of the move
-  EXPECT_TRUE(qstest::whileImmutable(dir / "src/locked", [&] {
-    return fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error);
-  }));
+  ASSERT_TRUE(qstest::setImmutable(dir / "src/locked.txt", true));
+  EXPECT_TRUE(fm.moveItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true), &error));
+  EXPECT_FALSE(fm.finishInterruptedMoveOfItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true)));
+  ASSERT_TRUE(qstest::setImmutable(aside + "/locked.txt", false));
   EXPECT_TRUE(error.is("Sentinel", 99));
-  EXPECT_EQ(qstest::readFile(shm / "dst/locked/file"), "x");
-  EXPECT_EQ(qstest::readFile(dir / "src/locked/file"), "x");
-  // The line that tells both copies are left.
+  EXPECT_EQ(qstest::readFile(shm / "dst/keep.txt") + qstest::readFile(shm / "dst/locked.txt"), "xx");
+  EXPECT_EQ(qstest::readFile(aside + "/locked.txt"), "x");
+  EXPECT_FALSE(exists(dir / "src"));
+  // The line that tells both copies are left, once (the retry above logs its own).
   EXPECT_EQ(log.count("Failed to remove move source after copy at " + dir.path() + "/src : "), 1u);
+  EXPECT_TRUE(fm.finishInterruptedMoveOfItemAtURL(fileURL(dir / "src", true), fileURL(shm / "dst", true)));
+  EXPECT_FALSE(exists(aside));
+  EXPECT_EQ(qstest::readFile(shm / "dst/locked.txt"), "x");
 }
 
-TEST_F(FileManagerMove, CrossDeviceMoveNeverReplacesWhatIsAtTheDestination) {
+TEST_F(FileManagerMove, CrossDeviceMoveNeverReplacesWhatIsAtTheDestinationAndLeavesNoCopy) {
   qstest::ShmDir shm;
   ASSERT_TRUE(qstest::writeFile(dir / "src", "new") && qstest::writeFile(shm / "dst", "there"));
   Error error;
@@ -154,6 +163,49 @@ TEST_F(FileManagerMove, CrossDeviceMoveNeverReplacesWhatIsAtTheDestination) {
   EXPECT_TRUE(error.isPOSIX(EEXIST)) << error.description();
   EXPECT_EQ(qstest::readFile(shm / "dst"), "there");
   EXPECT_EQ(qstest::readFile(dir / "src"), "new");
+  EXPECT_FALSE(exists(shm / (std::string(kQSMoveIncomingPrefix) + "dst")));
+  // Without its source, a hidden copy is all there is: it stays.
+  const std::string incoming = shm / (std::string(kQSMoveIncomingPrefix) + "other");
+  ASSERT_TRUE(qstest::writeFile(incoming, "only copy"));
+  EXPECT_FALSE(fm.moveItemAtURL(fileURL(dir / "absent"), fileURL(shm / "other"), &error));
+  EXPECT_TRUE(error.isPOSIX(ENOENT)) << error.description();
+  EXPECT_EQ(qstest::readFile(incoming), "only copy");
+}
+
+// What an interrupted move can leave, and what the next attempt makes of it:
+// a leftover goes only when the item is provably complete elsewhere.
+TEST_F(FileManagerMove, LeftoversOfAnInterruptedMoveGoOnlyWhenTheItemIsCompleteElsewhere) {
+  struct Case {
+    const char* name;
+    std::vector<std::string> before;  // "s": source, "d": destination, "in": hidden copy, "out": source aside
+    bool finished;
+    std::vector<std::string> after;
+  };
+  const Case cases[] = {
+      {"aside beside its copy", {"d", "out"}, true, {"d"}},
+      {"aside without a copy", {"out"}, false, {"out"}},
+      {"unfinished copy while the source is in place", {"s", "in"}, true, {"s"}},
+      {"hidden copy without its source", {"in"}, true, {"in"}},
+      {"a copy replaced by the source again", {"s", "d"}, true, {"s", "d"}},
+  };
+  qstest::ShmDir shm;
+  const std::map<std::string, std::string> paths{{"s", dir / "item"},
+                                                 {"d", shm / "item"},
+                                                 {"in", shm / (std::string(kQSMoveIncomingPrefix) + "item")},
+                                                 {"out", dir / (std::string(kQSMoveOutgoingPrefix) + "item")}};
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    for (const std::string& item : c.before) {
+      ASSERT_TRUE(qstest::makeDirs(paths.at(item)) && qstest::writeFile(paths.at(item) + "/f", item));
+    }
+    EXPECT_EQ(fm.finishInterruptedMoveOfItemAtURL(fileURL(paths.at("s"), true), fileURL(paths.at("d"), true)),
+              c.finished);
+    for (const auto& [item, path] : paths) {
+      const bool kept = std::find(c.after.begin(), c.after.end(), item) != c.after.end();
+      EXPECT_EQ(qstest::readFile(path + "/f"), kept ? item : "") << item;
+      ASSERT_TRUE(fm.removeItemAtURL(fileURL(path, true)));
+    }
+  }
 }
 
 // --- Capture of the store items ------------------------------------------------

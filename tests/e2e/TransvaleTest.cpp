@@ -22,6 +22,7 @@
 #include "AppMigrator/QSAppMigrator.h"
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Registry/SQLiteRegistry.h"
+#include "e2e/Programs.h"
 #include "support/TestSupport.h"
 
 namespace fs = std::filesystem;
@@ -39,9 +40,6 @@ constexpr char kOldInstallMap[] = "/private/var/mobile/Library/Caches/com.vantre
 constexpr char kDefaultLog[] = "/private/var/mobile/Library/Logs/Transvale/transvale.log";
 constexpr char kSystemVersion[] = "/System/Library/CoreServices/SystemVersion.plist";
 
-// The built programs lie beside this binary.
-const std::string kBin = fs::read_symlink("/proc/self/exe").parent_path().string();
-
 bool pathExists(const std::string& path) {
   std::error_code ec;
   return fs::exists(fs::symlink_status(path, ec));
@@ -55,46 +53,6 @@ std::vector<std::string> entriesOf(const std::string& dir) {
   std::sort(paths.begin(), paths.end());
   return paths;
 }
-
-// A program of the build running with its standard output and error in
-// `dir`/stdout and `dir`/stderr, TMPDIR `dir`/tmp, and no QS_SYSTEM_ROOT (only
-// --root counts).
-class Process {
- public:
-  Process(std::vector<std::string> argv, const std::string& dir) : pid_(fork()) {
-    if (pid_ != 0) return;
-    if (!freopen((dir + "/stdout").c_str(), "w", stdout) || !freopen((dir + "/stderr").c_str(), "w", stderr))
-      _exit(126);
-    setenv("TMPDIR", (dir + "/tmp").c_str(), 1);
-    unsetenv("QS_SYSTEM_ROOT");
-    argv[0] = kBin + "/" + argv[0];
-    std::vector<char*> args;
-    for (std::string& arg : argv) args.push_back(arg.data());
-    args.push_back(nullptr);
-    execv(args[0], args.data());
-    _exit(127);
-  }
-  // The exit status, or -signal when it was killed.
-  int wait() {
-    int status = 0;
-    while (waitpid(pid_, &status, 0) < 0 && errno == EINTR) {
-    }
-    return decode(status);
-  }
-  bool running() {
-    int status = 0;
-    if (waitpid(pid_, &status, WNOHANG) == 0) return true;
-    exited_ = decode(status);
-    return false;
-  }
-  int exited() const { return exited_; }
-  void kill() { ::kill(pid_, SIGKILL); }
-
- private:
-  static int decode(int status) { return WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status); }
-  pid_t pid_;
-  int exited_ = 0;
-};
 
 class EndToEnd : public testing::Test {
  protected:
