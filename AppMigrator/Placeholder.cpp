@@ -24,6 +24,12 @@ constexpr char kStagedPlaceholdersDirectoryName[] = "com.vantrel.quill.set.migra
 constexpr char kBundleExtension[] = "app";
 constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
 constexpr size_t kSingleImage = 1;
+// The staged bundle's files are written whole (atomically) but not flushed:
+// the registry copies them, flushing its copy before it records it, and the
+// staged directory is removed when the call ends. After a crash the staged
+// directory is reused and its files replaced, so nothing depends on them
+// surviving one.
+constexpr platform::plist::Durability kStagedFileDurability = platform::plist::Durability::Scratch;
 
 // The keys a placeholder carries over from the application's info dictionary,
 // in the order they are copied.
@@ -123,7 +129,8 @@ bool QSAppMigrator::_installPlaceholderStagedAtURL(const URL& staged, const URL&
   }
 
   const URL infoURL = staged.appending(platform::kInfoPlistFileName);
-  if (!platform::plist::writeOrderedDictionary(info, infoURL, platform::plist::Format::XML, true)) {
+  if (!platform::plist::writeOrderedDictionary(info, infoURL, platform::plist::Format::XML, true, nullptr,
+                                               kStagedFileDurability)) {
     QSAM_LOG(kQSLogLevelError, kPlaceholderFunction, "QSAppMigrator: Failed to write placeholder Info.plist to %@",
              infoURL);
     return false;
@@ -161,7 +168,7 @@ bool QSAppMigrator::_writeIconForBundle(const platform::Bundle& bundle, const UR
     return false;
   }
   Error error;
-  if (!platform::plist::writeFileBytes(buffer, toURL, true, &error)) {
+  if (!platform::plist::writeFileBytes(buffer, toURL, true, &error, kStagedFileDurability)) {
     QSAM_LOG(kQSLogLevelError, kIconFunction, "QSAppMigrator: Failed to write image data to %@ : %@", toURL, error);
     return false;
   }

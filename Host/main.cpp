@@ -3,6 +3,7 @@
 // shows progress, and routes every log line of the process into one log. With
 // --plan it asks the plug-in for a dry run instead and prints the plan.
 #include <fcntl.h>
+#include <malloc.h>
 #include <stdlib.h>
 #include <unistd.h>
 
@@ -128,7 +129,19 @@ int runPlan(const LoadedPlugin& plugin, const Options& options) {
 
 }  // namespace
 
+// The migration frees and allocates the same few hundred kilobytes for every
+// application (icon surfaces, the PNG encoder's zlib state). Handing them back
+// to the kernel at each free and faulting them in again, with a TLB flush on
+// every core the process runs on, cost about half its system time; kept for
+// reuse instead, they add nothing to the peak.
+namespace {
+constexpr int kMallocMmapThreshold = 4 << 20;
+constexpr int kMallocTrimThreshold = 32 << 20;
+}  // namespace
+
 int main(int argc, char** argv) {
+  (void)mallopt(M_MMAP_THRESHOLD, kMallocMmapThreshold);  // only a tuning: a refusal changes nothing else
+  (void)mallopt(M_TRIM_THRESHOLD, kMallocTrimThreshold);
   int exitCode = kExitUsage;
   std::optional<Options> options = parseOptions(argc, argv, &exitCode);
   if (!options) return exitCode;

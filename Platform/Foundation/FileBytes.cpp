@@ -116,31 +116,39 @@ bool syncDirectory(const std::string& directory) {
   return ::fsync(dir.get()) == 0 || errno == EINVAL;
 }
 
-// Fills `fd` with the data and the target's permissions and flushes it.
-bool fillAndFlush(int fd, const Data& data, const URL& url, const std::string& shownPath, Error* error) {
+// Fills `fd` with the data and the target's permissions and flushes it
+// unless the write is scratch.
+bool fillAndFlush(int fd, const Data& data, const URL& url, const std::string& shownPath, Durability durability,
+                  Error* error) {
   if (!writeAll(fd, data)) return writeFailure(error, url, "write", shownPath);
   if (::fchmod(fd, modeForReplacing(url.path())) != 0) return writeFailure(error, url, "fchmod", shownPath);
-  if (::fsync(fd) != 0) return writeFailure(error, url, "fsync", shownPath);
+  if (durability == Durability::Flushed && ::fsync(fd) != 0) return writeFailure(error, url, "fsync", shownPath);
+  return true;
+}
+
+bool syncDirectoryOf(const URL& url, Durability durability, Error* error) {
+  const std::string directory = url.deletingLastPathComponent().path();
+  if (durability == Durability::Flushed && !syncDirectory(directory)) {
+    return writeFailure(error, url, "fsync", directory);
+  }
   return true;
 }
 
 // The portable way: a named temporary file, renamed over the target. A
 // process killed before the rename leaves the temporary file behind.
-bool writeThroughNamedTempFile(const Data& data, const URL& url, Error* error) {
+bool writeThroughNamedTempFile(const Data& data, const URL& url, Durability durability, Error* error) {
   std::string tmpl = tempTemplateFor(url);
   UniqueFd fd(::mkostemp(tmpl.data(), O_CLOEXEC));
   if (!fd.valid()) return writeFailure(error, url, "mkstemp", tmpl);
   TempFileGuard temp(tmpl);
 
-  if (!fillAndFlush(fd.get(), data, url, temp.path(), error)) return false;
+  if (!fillAndFlush(fd.get(), data, url, temp.path(), durability, error)) return false;
   if (!fd.close()) return writeFailure(error, url, "close", temp.path());
   if (::rename(temp.path().c_str(), url.fileSystemRepresentation()) != 0) {
     return writeFailure(error, url, "rename", url.path());
   }
   temp.keep();
-  const std::string directory = url.deletingLastPathComponent().path();
-  if (!syncDirectory(directory)) return writeFailure(error, url, "fsync", directory);
-  return true;
+  return syncDirectoryOf(url, durability, error);
 }
 
 // A fresh name for the temporary link of a replacing write.
@@ -159,20 +167,20 @@ std::string uniqueTempName(const URL& url) {
 // the target (a stray file in an application container would otherwise count
 // as a missed item for ever). Falls back to a named temporary file where
 // unnamed files or /proc are not available.
-bool writeAtomically(const Data& data, const URL& url, Error* error) {
+bool writeAtomically(const Data& data, const URL& url, Durability durability, Error* error) {
   const std::string directory = url.deletingLastPathComponent().path();
   UniqueFd fd(::open(directory.c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, kNewFileMode));
   if (!fd.valid()) {
-    if (errno == EOPNOTSUPP || errno == EISDIR) return writeThroughNamedTempFile(data, url, error);
+    if (errno == EOPNOTSUPP || errno == EISDIR) return writeThroughNamedTempFile(data, url, durability, error);
     return writeFailure(error, url, "open", directory);
   }
-  if (!fillAndFlush(fd.get(), data, url, directory, error)) return false;
+  if (!fillAndFlush(fd.get(), data, url, directory, durability, error)) return false;
   const std::string procPath = "/proc/self/fd/" + std::to_string(fd.get());
   auto linkTo = [&](const std::string& path) {
     return ::linkat(AT_FDCWD, procPath.c_str(), AT_FDCWD, path.c_str(), AT_SYMLINK_FOLLOW) == 0;
   };
   if (!linkTo(url.path())) {
-    if (errno == ENOENT) return writeThroughNamedTempFile(data, url, error);  // no /proc
+    if (errno == ENOENT) return writeThroughNamedTempFile(data, url, durability, error);  // no /proc
     if (errno != EEXIST) return writeFailure(error, url, "linkat", url.path());
     std::string tempPath = uniqueTempName(url);
     while (!linkTo(tempPath)) {
@@ -186,8 +194,7 @@ bool writeAtomically(const Data& data, const URL& url, Error* error) {
     temp.keep();
   }
   if (!fd.close()) return writeFailure(error, url, "close", directory);
-  if (!syncDirectory(directory)) return writeFailure(error, url, "fsync", directory);
-  return true;
+  return syncDirectoryOf(url, durability, error);
 }
 
 bool writeInPlace(const Data& data, const URL& url, Error* error) {
@@ -229,9 +236,9 @@ std::optional<Data> readFileBytes(const URL& url, Error* error) {
   }
 }
 
-bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error) {
+bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error, Durability durability) {
   if (url.empty()) return failWith(error, FileWriteError(url, "no path given"));
-  return atomically ? writeAtomically(data, url, error) : writeInPlace(data, url, error);
+  return atomically ? writeAtomically(data, url, durability, error) : writeInPlace(data, url, error);
 }
 
 }  // namespace platform::plist

@@ -425,12 +425,12 @@ bool writeFile(const Value& value, const URL& url, Format format, bool atomicall
 }
 
 bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Format format, bool atomically,
-                            Error* error) {
+                            Error* error, Durability durability) {
   std::string problem;
   std::optional<Data> data =
       serializeWith(format, &problem, [&](NodeWriter& writer) { return writer.orderedDictionary(entries); });
   if (!data) return failWith(error, FileWriteError(url, problem));
-  return writeFileBytes(*data, url, atomically, error);
+  return writeFileBytes(*data, url, atomically, error, durability);
 }
 
 }  // namespace platform::plist

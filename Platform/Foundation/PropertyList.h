@@ -41,6 +41,11 @@ namespace platform::plist {
 
 enum class Format { XML, Binary };
 
+// Whether an atomic write is flushed. Scratch writes still replace the target
+// whole or not at all for every reader, but a power cut may lose them: for
+// files that are read back and removed before anything depends on them.
+enum class Durability { Flushed, Scratch };
+
 // Parses a property list from memory (either format).
 std::optional<Value> parse(const void* bytes, size_t length, Error* error = nullptr);
 // Reads and parses a whole file.
@@ -59,12 +64,14 @@ bool writeFile(const Value& value, const URL& url, Format format = Format::XML, 
 // ordered by key). Later duplicates of a key replace earlier ones in place.
 using OrderedEntries = std::vector<std::pair<std::string, Value>>;
 bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Format format = Format::XML,
-                            bool atomically = true, Error* error = nullptr);
+                            bool atomically = true, Error* error = nullptr,
+                            Durability durability = Durability::Flushed);
 
 // Reads a whole file's bytes (no caching). Missing file: kFileErrorDomain 260
 // with the POSIX error underneath; other failures: kFileErrorDomain 256.
 std::optional<Data> readFileBytes(const URL& url, Error* error = nullptr);
 // Writes bytes, atomically when asked (temporary file, fsync, rename).
-bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error = nullptr);
+bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error = nullptr,
+                    Durability durability = Durability::Flushed);
 
 }  // namespace platform::plist

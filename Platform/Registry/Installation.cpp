@@ -226,8 +226,16 @@ bool Installation::run(const Reporter& reporter, Error* error) {
     }
   }
   {
+    // A move must not reach the disk before the journal entry that undoes it,
+    // so the journal of a move is flushed before any file moves. A copy only
+    // makes new directories under fresh names: if a power cut loses its
+    // journal, they are empty or copied directories that nothing records and
+    // nothing else will ever use. Its journal goes to the disk with the
+    // commit that records them (same log, written before it).
+    const CommitDurability durability =
+        transfer_ == Transfer::Move ? CommitDurability::Immediate : CommitDurability::WithNextFlush;
     std::lock_guard dbLock(state_.dbMutex);
-    auto transaction = Transaction::begin(*state_.db, error);
+    auto transaction = Transaction::begin(*state_.db, error, durability);
     if (!transaction || !appendJournal(*state_.db, journal_, error) || !transaction->commit(error)) return false;
   }
   reporter.status(kRegistryStatusStaging, kPercentStaging);
@@ -264,13 +272,16 @@ bool Installation::takeFileActions(Error* error) {
   return syncTouchedDirectories(error);
 }
 
-// The commit must not become durable before the file actions it records.
+// The commit must not become durable before the file actions it records:
+// every directory that received an entry is flushed, once. The directories
+// that moved items left (Payload, the package directory) are not: until the
+// commit is durable a power cut rolls the move back whatever they say, and
+// after it the item is whole under its new name, which is flushed; at worst
+// the old name survives beside it until the package directory is removed,
+// and no item is ever in neither place. A copy flushes its own tree.
 bool Installation::syncTouchedDirectories(Error* error) const {
   std::set<std::string> directories;
-  for (const JournalEntry& entry : journal_) {
-    directories.insert(parentOf(entry.destination));
-    if (entry.kind == JournalKind::Move) directories.insert(parentOf(entry.source));
-  }
+  for (const JournalEntry& entry : journal_) directories.insert(parentOf(entry.destination));
   for (const BundlePlan& plan : bundles_) directories.insert(plan.container);
   for (const std::string& directory : directories) {
     if (!syncDirectory(directory, error)) return false;
@@ -325,10 +336,17 @@ void Installation::rollBack() {
   (void)clearJournal(*state_.db, nullptr);
 }
 
+// The emptied journal need not reach the disk by itself: if a power cut
+// loses it, the next opening or installation finds only these removals and
+// repeats them, which finds nothing left to do (the paths are fresh container
+// names and the package directory, which nothing recreates before that
+// recovery). The next immediate commit carries it to the disk.
 void Installation::cleanUp() {
   (void)undoJournal(removals_, function_, nullptr);  // removal failures are logged and leave only garbage
   std::lock_guard dbLock(state_.dbMutex);
-  (void)clearJournal(*state_.db, nullptr);  // failing here leaves removals the next recovery repeats harmlessly
+  // Failing here leaves removals the next recovery repeats harmlessly.
+  auto transaction = Transaction::begin(*state_.db, nullptr, CommitDurability::WithNextFlush);
+  if (transaction && clearJournal(*state_.db, nullptr)) (void)transaction->commit(nullptr);
 }
 
 // The contents of a package directory.

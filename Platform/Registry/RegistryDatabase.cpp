@@ -189,6 +189,15 @@ bool Database::execute(const char* sql, Error* error) {
   return false;
 }
 
+bool Database::setCommitDurability(CommitDurability durability, Error* error) {
+  if (durability == durability_) return true;
+  const char* pragma =
+      durability == CommitDurability::Immediate ? "PRAGMA synchronous=FULL;" : "PRAGMA synchronous=NORMAL;";
+  if (!execute(pragma, error)) return false;
+  durability_ = durability;
+  return true;
+}
+
 std::optional<Statement> Database::prepare(const char* sql, Error* error) {
   sqlite3_stmt* stmt = nullptr;
   int rc = sqlite3_prepare_v2(handle_, sql, -1, &stmt, nullptr);
@@ -258,17 +267,26 @@ int64_t Statement::integer(int column) const {
   return sqlite3_column_int64(stmt_, column);
 }
 
-std::optional<Transaction> Transaction::begin(Database& db, Error* error) {
-  if (!db.execute("BEGIN IMMEDIATE;", error)) return std::nullopt;
+std::optional<Transaction> Transaction::begin(Database& db, Error* error, CommitDurability durability) {
+  if (!db.setCommitDurability(durability, error)) return std::nullopt;
+  if (!db.execute("BEGIN IMMEDIATE;", error)) {
+    (void)db.setCommitDurability(CommitDurability::Immediate, nullptr);
+    return std::nullopt;
+  }
   return Transaction(&db);
 }
 
 Transaction::~Transaction() {
-  if (db_) (void)db_->execute("ROLLBACK;", nullptr);  // nothing more can be done about a failed rollback
+  if (!db_) return;
+  (void)db_->execute("ROLLBACK;", nullptr);  // nothing more can be done about a failed rollback
+  // A connection left at WithNextFlush would weaken every later commit; the
+  // pragma only fails when the connection itself is gone.
+  (void)db_->setCommitDurability(CommitDurability::Immediate, nullptr);
 }
 
 bool Transaction::commit(Error* error) {
   if (!db_->execute("COMMIT;", error)) return false;  // the destructor rolls back
+  (void)db_->setCommitDurability(CommitDurability::Immediate, nullptr);
   db_ = nullptr;
   return true;
 }

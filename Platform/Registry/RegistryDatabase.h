@@ -23,6 +23,19 @@ namespace platform::registry {
 
 class Statement;
 
+// When a commit reaches the disk. The connection runs in WAL mode, where every
+// commit appends to one log file in order: a commit made durable also makes
+// every earlier one durable.
+enum class CommitDurability {
+  // The commit flushes the log (synchronous=FULL) before it returns.
+  Immediate,
+  // The commit returns without a flush (synchronous=NORMAL); it reaches the
+  // disk with the next immediate commit or checkpoint. Only for changes whose
+  // loss in a power cut is harmless, or that a later immediate commit makes
+  // durable before anything depends on them.
+  WithNextFlush,
+};
+
 class Database {
  public:
   // Opens (creating when needed) the database at `path` in WAL mode with
@@ -43,6 +56,8 @@ class Database {
 
   // Runs one or more statements without results.
   bool execute(const char* sql, Error* error);
+  // How the following commits reach the disk; Immediate after open().
+  bool setCommitDurability(CommitDurability durability, Error* error);
   std::optional<Statement> prepare(const char* sql, Error* error);
   const std::string& path() const { return path_; }
   // The record for the connection's last failure while `what`.
@@ -54,6 +69,7 @@ class Database {
   sqlite3* handle_;
   std::string path_;
   std::string privateCopy_;  // directory of the private copy, "" when there is none
+  CommitDurability durability_ = CommitDurability::Immediate;
 };
 
 // A prepared statement; parameters are bound by position (1-based).
@@ -87,10 +103,12 @@ class Statement {
 };
 
 // BEGIN IMMEDIATE on construction; rolled back on destruction unless
-// committed.
+// committed. A transaction begun WithNextFlush puts the connection back to
+// Immediate when it ends.
 class Transaction {
  public:
-  static std::optional<Transaction> begin(Database& db, Error* error);
+  static std::optional<Transaction> begin(Database& db, Error* error,
+                                          CommitDurability durability = CommitDurability::Immediate);
   Transaction(Transaction&& other) noexcept : db_(other.db_) { other.db_ = nullptr; }
   Transaction& operator=(Transaction&&) = delete;
   Transaction(const Transaction&) = delete;

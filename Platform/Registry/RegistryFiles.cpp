@@ -207,6 +207,7 @@ bool copyTree(const std::string& source, const std::string& destination, Error* 
         break;
       case FTS_DP:
         if (chmod(target.c_str(), entry->fts_statp->st_mode & 07777) != 0) return fail(error, "chmod", target, errno);
+        if (!syncDirectory(target, error)) return false;
         break;
       case FTS_F:
         if (!copyFileContents(entry->fts_path, target, entry->fts_statp->st_mode, error)) return false;

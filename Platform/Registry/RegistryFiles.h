@@ -39,7 +39,8 @@ bool createNewDirectory(const std::string& path, Error* error);
 // Removes the item at `path` and everything under it; nothing there is success.
 bool removeTree(const std::string& path, Error* error);
 // Copies the tree at `source` to `destination` (which must not exist):
-// directories, regular files (with their modes) and symbolic links.
+// directories, regular files (with their modes) and symbolic links. Every file
+// and directory of the copy is flushed; the parent of `destination` is not.
 bool copyTree(const std::string& source, const std::string& destination, Error* error);
 // Renames `source` to `destination`. Only a rename can be undone after a crash,
 // so there is no copying fallback: across file systems this fails (EXDEV).

@@ -1,6 +1,9 @@
 #include "Platform/Registry/SQLiteRegistry.h"
 
 #include <algorithm>
+#include <condition_variable>
+#include <functional>
+#include <mutex>
 #include <system_error>
 #include <thread>
 
@@ -115,8 +118,57 @@ void logFailure(const char* function, const char* what, const std::string& subje
 
 }  // namespace
 
+// The thread that runs installations and delivers their progress reports:
+// started with the first installation and kept until the registry goes away,
+// so that an installation does not pay for starting a thread and for handing
+// its stack back when it ends. Callers take turns.
+class InstallWorker {
+ public:
+  ~InstallWorker() {
+    {
+      std::lock_guard lock(mutex_);
+      stopping_ = true;
+    }
+    wake_.notify_all();
+    if (thread_.joinable()) thread_.join();
+  }
+
+  // Runs `job` on the worker and returns once it has ended. Throws
+  // std::system_error when the thread cannot be started.
+  void run(const std::function<void()>& job) {
+    std::lock_guard turn(turnMutex_);
+    std::unique_lock lock(mutex_);
+    if (!thread_.joinable()) thread_ = std::thread([this] { serve(); });
+    job_ = &job;
+    wake_.notify_all();
+    wake_.wait(lock, [this] { return job_ == nullptr; });
+  }
+
+ private:
+  void serve() {
+    std::unique_lock lock(mutex_);
+    for (;;) {
+      wake_.wait(lock, [this] { return stopping_ || job_ != nullptr; });
+      if (!job_) return;  // stopping, with nothing left to run
+      lock.unlock();
+      (*job_)();
+      lock.lock();
+      job_ = nullptr;
+      wake_.notify_all();
+    }
+  }
+
+  std::mutex turnMutex_;  // one caller at a time
+  std::mutex mutex_;
+  std::condition_variable wake_;
+  const std::function<void()>* job_ = nullptr;  // guarded by mutex_
+  bool stopping_ = false;                       // guarded by mutex_
+  std::thread thread_;
+};
+
 struct SQLiteApplicationRegistry::Impl : RegistryState {
   using RegistryState::RegistryState;
+  InstallWorker installWorker;
 };
 
 std::unique_ptr<SQLiteApplicationRegistry> SQLiteApplicationRegistry::open(const std::string& systemRoot,
@@ -180,13 +232,12 @@ std::optional<BundleRecord> SQLiteApplicationRegistry::recordForIdentifier(const
 
 bool SQLiteApplicationRegistry::installPackage(const URL& package, const Dictionary& options,
                                                const InstallProgressCallback& progress, Error* error) {
-  // The installation runs on a worker thread of its own, which delivers every
-  // report; joining it means the last report has been delivered.
+  // The installation runs on the registry's worker thread, which delivers
+  // every report; once run() returns, the last report has been delivered.
   bool installed = false;
   Error failure;
   try {
-    std::thread worker([&] { installed = installPackageDirectory(*impl_, package, options, progress, &failure); });
-    worker.join();
+    impl_->installWorker.run([&] { installed = installPackageDirectory(*impl_, package, options, progress, &failure); });
   } catch (const std::system_error& e) {
     failure = registryError(kRegistryErrorFileOperation,
                             Format("Could not start the installation of %s: %s", package.path(), e.what()));

@@ -18,8 +18,9 @@
 // modification time changes; their data and group containers are made on
 // their first lookup (allRecords and the data-protection update look up).
 //
-// Installation (installPackage) runs on a worker thread that delivers every
-// progress report; the call joins it before returning. A package is its
+// Installation (installPackage) runs on the registry's worker thread (started
+// with the first installation, kept until the registry goes away), which
+// delivers every progress report; the call returns after the last one. A package is its
 // "Payload" directory (exactly one *.app and at most one *.vpnplugin, or a
 // single *.vpnplugin alone) and store-metadata items beside "Payload", which
 // are kept beside the bundle in its new container. After a successful

@@ -5,6 +5,7 @@
 
 #include <atomic>
 
+#include "Platform/Registry/RegistryDatabase.h"
 #include "Platform/RegistryFixture.h"
 
 namespace qstest {
@@ -144,6 +145,40 @@ TEST_F(RegistryRecovery, UnwritableDatabaseOrContainerFailsAndLeavesThePackageWh
   EXPECT_EQ(allContainers(), (std::vector<std::vector<std::string>>(4)));
   EXPECT_FALSE(registry->isInstalled("ex.notes"));
   ASSERT_TRUE(install(*registry, package, "ex.notes", &error)) << error.description();
+}
+
+// A commit that reaches the disk only with the next flush weakens that one
+// transaction: whether it is committed or rolled back, every later commit on
+// the connection is flushed again; one refused because another is open leaves
+// that one flushed.
+TEST_F(RegistryRecovery, CommitWithoutItsOwnFlushLastsOneTransaction) {
+  using registry::CommitDurability;
+  using registry::Transaction;
+  Error error;
+  auto db = registry::Database::open(at("registry.sqlite"), &error);
+  ASSERT_TRUE(db) << error.description();
+  auto synchronous = [&] {
+    auto query = db->prepare("PRAGMA synchronous;", &error);
+    bool failed = false;
+    return query && query->step(&failed, &error) ? query->integer(0) : -1;
+  };
+  constexpr int64_t kNormal = 1, kFull = 2;
+  const std::function<void(std::optional<Transaction>&)> endings[] = {
+      [&](auto& t) { EXPECT_TRUE(db->execute("DELETE FROM install_journal;", &error) && t->commit(&error)); },
+      [](auto& t) { t.reset(); },
+  };
+  for (size_t k = 0; k < std::size(endings); ++k) {
+    SCOPED_TRACE(k);
+    std::optional<Transaction> transaction = Transaction::begin(*db, &error, CommitDurability::WithNextFlush);
+    ASSERT_TRUE(transaction) << error.description();
+    EXPECT_EQ(synchronous(), kNormal);
+    endings[k](transaction);
+    EXPECT_EQ(synchronous(), kFull);
+  }
+  std::optional<Transaction> open = Transaction::begin(*db, &error);
+  ASSERT_TRUE(open) << error.description();
+  EXPECT_FALSE(Transaction::begin(*db, &error, CommitDurability::WithNextFlush));
+  EXPECT_EQ(synchronous(), kFull);
 }
 
 }  // namespace
