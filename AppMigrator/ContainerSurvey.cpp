@@ -7,6 +7,7 @@
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Host/HostLog.h"
 #include "Shared/FileManager/QSFileManager.h"
+#include "Shared/Support/QSGlobalConfiguration.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -28,7 +29,18 @@ constexpr char kVPNPluginBundleExtension[] = "vpnplugin";
 struct FoundBundles {
   std::optional<URL> application;
   std::optional<URL> vpnPlugin;
+  std::vector<URL> unreadable;  // bundles without a readable identifier
 };
+
+// What of a container without a usable bundle is worth keeping: its user data
+// items and the bundles that could not be read.
+std::vector<URL> recoverableItems(const URL& container, const std::vector<URL>& unreadableBundles) {
+  std::vector<URL> items = unreadableBundles;
+  for (const std::string& name : QSGlobalConfiguration::sharedInstance().appUserDataItemNames()) {
+    items.push_back(container.appending(name, true));
+  }
+  return items;
+}
 
 }  // namespace
 
@@ -79,6 +91,7 @@ std::optional<Dictionary> QSAppMigrator::_introspectContainer(const URL& entry, 
       if (!identifier) {
         QSAM_LOG(kQSLogLevelError, kIntrospectFunction, "QSAppMigrator: Could not get identifier for bundle at %@",
                  child.path());
+        found.unreadable.push_back(child);
         continue;
       }
       found.application = child;
@@ -94,7 +107,10 @@ std::optional<Dictionary> QSAppMigrator::_introspectContainer(const URL& entry, 
         return std::nullopt;
       }
       std::optional<std::string> identifier = _bundleIdentifierForBundle(child);
-      if (!identifier) continue;
+      if (!identifier) {
+        found.unreadable.push_back(child);
+        continue;
+      }
       found.vpnPlugin = child;
       if (!found.application) {
         result[kQSBundlePathKey] = Value(child.path());
@@ -110,6 +126,13 @@ std::optional<Dictionary> QSAppMigrator::_introspectContainer(const URL& entry, 
         return std::nullopt;
       }
       std::optional<Dictionary> marker = _loadAndValidateMigrationMarkerAtURL(child);
+      if (marker && _identifierIsBuiltIn(*QSStringForKey(*marker, kQSBundleIdentifierKey))) {
+        // Its data would be moved into a built-in application's container.
+        QSAM_LOG(kQSLogLevelError, kIntrospectFunction,
+                 "QSAppMigrator: Migration marker %@ names the built-in application %@ ; keeping container %@",
+                 child.path(), QSValueForKey(*marker, kQSBundleIdentifierKey), entry.path());
+        return std::nullopt;
+      }
       if (marker) {
         // What an earlier attempt recorded wins over what the container holds
         // now: the bundle may already have left it.
@@ -128,7 +151,11 @@ std::optional<Dictionary> QSAppMigrator::_introspectContainer(const URL& entry, 
   if (!found.application && !found.vpnPlugin) {
     QSAM_LOG(kQSLogLevelError, kIntrospectFunction,
              "QSAppMigrator: No app or vpn bundle found in container %@ ; removing it", entry.path());
-    (void)fileManager.removeItemAtURL(entry);  // the outcome does not change the answer
+    // The user's data and any bundle that could not be read are kept for a
+    // person; a container whose items could not all be kept stays.
+    if (_moveItemsToRecovery(recoverableItems(entry, found.unreadable), entry)) {
+      (void)fileManager.removeItemAtURL(entry);  // the outcome does not change the answer
+    }
     return std::nullopt;
   }
   if (found.application && found.vpnPlugin) {
@@ -138,7 +165,8 @@ std::optional<Dictionary> QSAppMigrator::_introspectContainer(const URL& entry, 
 }
 
 std::optional<Dictionary> QSAppMigrator::_loadAndValidateMigrationMarkerAtURL(const URL& marker) {
-  std::optional<Dictionary> loaded = platform::plist::readDictionary(marker);
+  std::optional<Dictionary> loaded = platform::plist::readDictionary(
+      marker, platform::plist::ReadOptions{.finalLink = platform::plist::FinalLink::Refuse});
   if (!loaded) {
     QSAM_LOG(kQSLogLevelError, kLoadMarkerFunction, "QSAppMigrator: Failed to load migration marker file from %@",
              marker);
@@ -169,6 +197,7 @@ std::optional<Dictionary> QSAppMigrator::_loadAndValidateMigrationMarkerAtURL(co
              secondBundlePath);
     return std::nullopt;
   }
+  if (!_migrationMarkerPathsStayInContainer(*loaded, marker)) return std::nullopt;
   return loaded;
 }
 

@@ -195,7 +195,7 @@ bool QSAppMigrator::_migrateWorkList(const std::deque<Dictionary>& workList) {
     const Value* identifier = QSValueForKey(info, kQSBundleIdentifierKey);
     const Value* bundlePath = QSValueForKey(info, kQSBundlePathKey);
     QSAM_LOG(kQSLogLevelNotice, kPerformMigrationFunction, "QSAppMigrator: Migrating %@ at %@", identifier, bundlePath);
-    if (!_migrateContainerWithInfo(info)) {
+    if (!_claimIdentifierForRun(info) || !_migrateContainerWithInfo(info)) {
       QSAM_LOG(kQSLogLevelError, kPerformMigrationFunction, "QSAppMigrator: Migration of %@ at %@ failed", identifier,
                bundlePath);
       result = false;
