@@ -604,7 +604,8 @@ bool installPackageDirectory(RegistryState& state, const URL& package, const Dic
   reporter.status(kRegistryStatusVerifying, kPercentVerifying);
   Error failure;
   bool installed = underInstallLocks(state, kInstallPackageFunction, &failure, [&] {
-    return installPackageLocked(state, package.path(), options, reporter, &failure);
+    return checkPackagePath(state.layout, package.path(), &failure) &&
+           installPackageLocked(state, package.path(), options, reporter, &failure);
   });
   if (installed) return true;
   reporter.failure(failure);

@@ -50,6 +50,17 @@ bool checkContainerPath(const std::string& path, const std::string& area, const 
   return failWith(error, outside(Format("The recorded %s %s does not lie inside %s", what, path, area)));
 }
 
+bool checkPackagePath(const RegistryLayout& layout, const std::string& package, Error* error) {
+  if (path::liesInside(package, layout.systemRoot) &&
+      !insideAny(package, {&layout.databaseDirectory, &layout.systemApplications, &layout.bundleContainers,
+                           &layout.applicationDataContainers, &layout.pluginDataContainers, &layout.groupContainers})) {
+    return true;
+  }
+  return failWith(error, outside(Format("The package %s does not lie in the system root %s, outside the registry's "
+                                        "own directories",
+                                        package, layout.systemRoot)));
+}
+
 bool checkJournalEntry(const RegistryLayout& layout, const JournalEntry& entry, Error* error) {
   auto inContainerArea = [&](const std::string& path) {
     return insideAny(path, {&layout.bundleContainers, &layout.applicationDataContainers, &layout.pluginDataContainers,

@@ -20,6 +20,12 @@ namespace platform::registry {
 // naming `what` and the path.
 bool checkContainerPath(const std::string& path, const std::string& area, const char* what, Error* error);
 
+// A package the registry may install from (and so journal moves out of and
+// remove): inside the system root, outside the database directory, the
+// built-in applications and the containers. Otherwise false with
+// kRegistryErrorOutsideAreas.
+bool checkPackagePath(const RegistryLayout& layout, const std::string& package, Error* error);
+
 // A journal row the registry could have written: creations and removals of
 // containers inside its container directories, moves into its bundle
 // containers from a place inside the system root, removals of a package

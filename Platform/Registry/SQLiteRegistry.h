@@ -19,7 +19,9 @@
 // their first lookup (allRecords and the data-protection update look up).
 //
 // Installation (installPackage) runs on a worker thread that delivers every
-// progress report; the call joins it before returning. A package is its
+// progress report; the call joins it before returning. The package must lie
+// inside the system root, outside the registry's own directories (else
+// kRegistryErrorOutsideAreas). A package is its
 // "Payload" directory (exactly one *.app and at most one *.vpnplugin, or a
 // single *.vpnplugin alone) and store-metadata items beside "Payload", which
 // are kept beside the bundle in its new container. After a successful

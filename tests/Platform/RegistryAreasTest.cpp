@@ -58,6 +58,13 @@ TEST_F(RegistryAreas, JournalRowsPointingElsewhereAreRefusedAndKept) {
                    "');");
   ASSERT_TRUE(installApp(*openRegistry(), {.identifier = "ex.after", .version = "1"}));
   EXPECT_FALSE(exists(at("elsewhere")));
+  // A package outside the root is not installed from (nor, later, removed).
+  TempDir outside;
+  makeBundle(outside / "Payload/App.app", {.identifier = "ex.outside"});
+  Error error;
+  EXPECT_FALSE(install(*openRegistry(), outside.path(), "ex.outside", &error));
+  EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorOutsideAreas)) << error.description();
+  EXPECT_TRUE(exists(outside / "Payload/App.app/Info.plist"));
 }
 
 TEST_F(RegistryAreas, RecordedContainersElsewhereStopTheInstallation) {
