@@ -116,7 +116,7 @@ std::optional<Dictionary> QSAppMigrator::_actOnSurvey(const URL& entry, QSEntryS
         return std::nullopt;
       }
       (void)fileManager.removeItemAtURL(entry);  // the outcome does not change the answer
-      _reportEntry(platform::EntryOutcome::Removed, "no application or VPN plug-in bundle; data kept for recovery");
+      _reportEntry(platform::EntryOutcome::Removed, "no application or VPN plug-in bundle");
       return std::nullopt;
     case QSEntrySurvey::Finding::Vanished:
       _reportEntry(platform::EntryOutcome::Removed, "gone before it was looked into");
