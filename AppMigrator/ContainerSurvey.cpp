@@ -7,6 +7,7 @@
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Host/HostLog.h"
 #include "Shared/FileManager/QSFileManager.h"
+#include "Shared/Support/QSGlobalConfiguration.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -76,6 +77,16 @@ struct FoundBundles {
   std::optional<URL> vpnPlugin;
 };
 
+// What of a container without a usable bundle is worth keeping: its user data
+// items and the bundles that could not be read.
+std::vector<URL> recoverableItems(const URL& container, const std::vector<URL>& unreadableBundles) {
+  std::vector<URL> items = unreadableBundles;
+  for (const std::string& name : QSGlobalConfiguration::sharedInstance().appUserDataItemNames()) {
+    items.push_back(container.appending(name, true));
+  }
+  return items;
+}
+
 }  // namespace
 
 std::optional<Dictionary> QSAppMigrator::_introspectContainer(const URL& entry, bool* orderResultEarly) {
@@ -98,6 +109,12 @@ std::optional<Dictionary> QSAppMigrator::_actOnSurvey(const URL& entry, QSEntryS
     case QSEntrySurvey::Finding::NoBundle:
       QSAM_LOG(kQSLogLevelError, kIntrospectFunction,
                "QSAppMigrator: No app or vpn bundle found in container %@ ; removing it", entry.path());
+      // The user's data and any bundle that could not be read are kept for a
+      // person; a container whose items could not all be kept stays.
+      if (!_moveItemsToRecovery(recoverableItems(entry, survey.unreadableBundles), entry)) {
+        _reportEntry(platform::EntryOutcome::Kept, "its data could not be moved to the recovery directory");
+        return std::nullopt;
+      }
       (void)fileManager.removeItemAtURL(entry);  // the outcome does not change the answer
       _reportEntry(platform::EntryOutcome::Removed, "no application or VPN plug-in bundle");
       return std::nullopt;
@@ -154,7 +171,15 @@ QSEntrySurvey QSAppMigrator::_surveyEntry(const URL& entry) {
     if (!rule->announcedBeforeLinkCheck) QSAM_LOG(kQSLogLevelNotice, kIntrospectFunction, rule->foundLine, child.path());
 
     if (rule->kind == ChildKind::Marker) {
-      if (std::optional<Dictionary> marker = _loadAndValidateMigrationMarkerAtURL(child)) {
+      std::optional<Dictionary> marker = _loadAndValidateMigrationMarkerAtURL(child);
+      if (marker && _identifierIsBuiltIn(*QSStringForKey(*marker, kQSBundleIdentifierKey))) {
+        // Its data would be moved into a built-in application's container.
+        QSAM_LOG(kQSLogLevelError, kIntrospectFunction,
+                 "QSAppMigrator: Migration marker %@ names the built-in application %@ ; keeping container %@",
+                 child.path(), QSValueForKey(*marker, kQSBundleIdentifierKey), entry.path());
+        return surveyResult(Finding::Unsafe, "its migration marker names a built-in application");
+      }
+      if (marker) {
         // What an earlier attempt recorded wins over what the container holds
         // now: the bundle may already have left it.
         survey.finding = Finding::Container;
@@ -173,6 +198,7 @@ QSEntrySurvey QSAppMigrator::_surveyEntry(const URL& entry) {
 
     std::optional<std::string> identifier = _bundleIdentifierForBundle(child);
     if (!identifier) {
+      survey.unreadableBundles.push_back(child);
       if (rule->kind == ChildKind::Application) {
         QSAM_LOG(kQSLogLevelError, kIntrospectFunction, "QSAppMigrator: Could not get identifier for bundle at %@",
                  child.path());
@@ -191,7 +217,11 @@ QSEntrySurvey QSAppMigrator::_surveyEntry(const URL& entry) {
     }
   }
 
-  if (!found.application && !found.vpnPlugin) return surveyResult(Finding::NoBundle);
+  if (!found.application && !found.vpnPlugin) {
+    QSEntrySurvey none = surveyResult(Finding::NoBundle);
+    none.unreadableBundles = std::move(survey.unreadableBundles);
+    return none;
+  }
   if (found.application && found.vpnPlugin) result[kQSSecondBundlePathKey] = Value(found.vpnPlugin->path());
   survey.finding = Finding::Container;
   survey.info = std::move(result);
@@ -199,7 +229,8 @@ QSEntrySurvey QSAppMigrator::_surveyEntry(const URL& entry) {
 }
 
 std::optional<Dictionary> QSAppMigrator::_loadAndValidateMigrationMarkerAtURL(const URL& marker) {
-  std::optional<Dictionary> loaded = platform::plist::readDictionary(marker);
+  std::optional<Dictionary> loaded = platform::plist::readDictionary(
+      marker, platform::plist::ReadOptions{.finalLink = platform::plist::FinalLink::Refuse});
   if (!loaded) {
     QSAM_LOG(kQSLogLevelError, kLoadMarkerFunction, "QSAppMigrator: Failed to load migration marker file from %@",
              marker);
@@ -230,6 +261,7 @@ std::optional<Dictionary> QSAppMigrator::_loadAndValidateMigrationMarkerAtURL(co
              secondBundlePath);
     return std::nullopt;
   }
+  if (!_migrationMarkerPathsStayInContainer(*loaded, marker)) return std::nullopt;
   return loaded;
 }
 

@@ -45,7 +45,9 @@ bool QSAppMigrator::_migrateDataContainerForIdentifier(const std::string& identi
     if (!fileManager.itemExistsAtURL(source)) continue;
 
     // Replace, never merge: whatever the new container holds under this name
-    // goes first. A removal that fails leaves the move below to report it.
+    // goes first, unless another container moved it there in this run. A
+    // removal that fails leaves the move below to report it.
+    if (!_mayReplaceItemAtURL(destination)) return false;
     (void)fileManager.removeItemAtURL(destination);
     Error error;
     if (!fileManager.moveItemIfExistsAtURL(source, destination, &error)) {
@@ -53,6 +55,7 @@ bool QSAppMigrator::_migrateDataContainerForIdentifier(const std::string& identi
                "QSAppMigrator: Failed to move %@ to %@ migrating for %@ : %@", source, destination, identifier, error);
       return false;
     }
+    _noteItemMovedInRun(destination);
   }
   return true;
 }

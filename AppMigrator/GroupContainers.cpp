@@ -101,6 +101,7 @@ bool QSAppMigrator::_migrateGroupContainer(const std::string& identifier, const 
     return true;
   }
   const URL oldContainer = URL::fileURL(*path->asString(), true);
+  if (!_groupContainerPathIsAcceptable(oldContainer, group)) return;
   const QSFileManager& fm = QSFileManager::defaultManager();
   if (!fm.itemExistsAtURL(oldContainer)) {
     QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Missing source group container at %@",

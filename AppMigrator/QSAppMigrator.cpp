@@ -231,7 +231,7 @@ bool QSAppMigrator::_migrateWorkList(const std::deque<Dictionary>& workList) {
       services_.observer->entryStarted(identifier ? identifier->description() : "", container ? *container : "");
     }
     QSAM_LOG(kQSLogLevelNotice, kPerformMigrationFunction, "QSAppMigrator: Migrating %@ at %@", identifier, bundlePath);
-    const bool migrated = _migrateContainerWithInfo(info);
+    const bool migrated = _claimIdentifierForRun(info) && _migrateContainerWithInfo(info);
     if (!migrated) {
       QSAM_LOG(kQSLogLevelError, kPerformMigrationFunction, "QSAppMigrator: Migration of %@ at %@ failed", identifier,
                bundlePath);

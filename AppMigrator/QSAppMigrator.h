@@ -18,6 +18,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -55,7 +56,7 @@ struct QSEntrySurvey {
   enum class Finding {
     Container,   // to be migrated: `info` describes it
     StrayFile,   // a file where a container should be: removed
-    NoBundle,    // a container without an identifiable bundle: removed with its items
+    NoBundle,    // a container without an identifiable bundle: its data recovered, then removed
     Vanished,    // gone since the run listed it
     Unreadable,  // cannot be looked into: stays
     Unsafe,      // a bundle or marker is a symbolic link: stays untouched
@@ -65,6 +66,7 @@ struct QSEntrySurvey {
   bool orderEarly = false;  // an application container: migrated before the VPN-only ones
   bool fromMarker = false;  // described by the marker of an earlier attempt
   std::string reason;       // Unreadable, Unsafe: why it stays
+  std::vector<platform::URL> unreadableBundles;  // NoBundle: bundles without an identifier, kept for recovery
 };
 
 // A container information dictionary with its paths as URLs.
@@ -148,6 +150,29 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   bool _migrateGroupContainersForIdentifier(const std::string& identifier);
   bool _moveAllItemsInGroupContainerURL(const platform::URL& source, const platform::URL& toGroupContainerURL);
 
+  // --- Untrusted paths and identifiers (TrustChecks.cpp) ----------------------
+  // A marker describes the container it lies in: its "ContainerPath" is that
+  // container and its bundle paths lie inside it. False, with a level-3 line
+  // naming the reason, otherwise.
+  bool _migrationMarkerPathsStayInContainer(const platform::Dictionary& marker, const platform::URL& markerURL);
+  // Whether a built-in application has this identifier.
+  bool _identifierIsBuiltIn(const std::string& identifier);
+  // Whether a group's old container may be emptied and removed: it lies inside
+  // the system root, is no directory of the layout nor holds one, lies in no
+  // application's container, built-in bundle or system directory, and holds
+  // no other group's container. False with a level-3 line otherwise.
+  bool _groupContainerPathIsAcceptable(const platform::URL& oldContainer, const std::string& group);
+  // True the first time an identifier is claimed in this run; false, with a
+  // level-3 line, when another container was already migrated as it.
+  bool _claimIdentifierForRun(const platform::Dictionary& info);
+  // An item that a container moved in this run is never replaced by another's.
+  bool _mayReplaceItemAtURL(const platform::URL& destination);
+  void _noteItemMovedInRun(const platform::URL& destination);
+  // Moves the items (those present) into a new directory of the recovery
+  // directory named after the container, flushed, with a level-5 line. False,
+  // with a level-3 line, when any could not be moved: the container must stay.
+  bool _moveItemsToRecovery(const std::vector<platform::URL>& items, const platform::URL& fromContainer);
+
   // Read access for tests and the host.
   uint64_t countItemsMigrated() const { return _countItemsMigrated.load(); }
   const std::optional<std::vector<platform::URL>>& itemsToMigrate() const { return _itemsToMigrate; }
@@ -218,6 +243,10 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   std::optional<platform::Dictionary> _harborMap;
   std::optional<platform::Dictionary> _groupContainerMap;
   std::optional<std::string> _lastSystemBuildVersion;
+  // What this run has done so far: identifiers migrated and items moved into
+  // new containers.
+  std::set<std::string> _identifiersMigratedInRun;
+  std::set<std::string> _itemsMovedInRun;
 };
 
 // Names and keys of the migrator's files and dictionaries.

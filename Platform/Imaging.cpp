@@ -4,7 +4,10 @@
 #include <png.h>
 
 #include <csetjmp>
+#include <cstring>
 #include <numbers>
+
+#include "Platform/Foundation/PropertyList.h"
 
 namespace platform {
 
@@ -21,6 +24,8 @@ constexpr uint8_t kOpaqueAlpha = 255;
 // level 6, for a file a little larger.
 constexpr int kPNGCompressionLevel = 1;
 constexpr int kPNGRowFilters = PNG_FILTER_PAETH;
+// Largest side of an icon image that is decoded (an icon is shown at 120).
+constexpr uint32_t kIconDimensionLimit = 4096;
 
 // --- cairo objects, each released by its owner --------------------------------
 
@@ -51,15 +56,47 @@ std::optional<std::string> iconFileName(const Bundle& bundle) {
   return name;
 }
 
-// The decoded PNG, or none when it cannot be read or is empty.
+// A PNG in memory, handed to cairo piece by piece.
+struct PNGSource {
+  const Data& bytes;
+  size_t offset = 0;
+};
+
+cairo_status_t readFromMemory(void* closure, unsigned char* out, unsigned int length) {
+  auto* source = static_cast<PNGSource*>(closure);
+  if (source->bytes.size() - source->offset < length) return CAIRO_STATUS_READ_ERROR;
+  std::memcpy(out, source->bytes.data() + source->offset, length);
+  source->offset += length;
+  return CAIRO_STATUS_SUCCESS;
+}
+
+// The width and height a PNG's header claims, before anything is decoded
+// (signature, chunk length, "IHDR", then both as big-endian 32-bit values).
+bool claimedDimensionsFit(const Data& png) {
+  constexpr size_t kWidthOffset = 16;
+  constexpr size_t kHeaderEnd = 24;
+  if (png.size() < kHeaderEnd) return false;
+  auto be32 = [&](size_t at) {
+    return (uint32_t{png[at]} << 24) | (uint32_t{png[at + 1]} << 16) | (uint32_t{png[at + 2]} << 8) | png[at + 3];
+  };
+  return be32(kWidthOffset) <= kIconDimensionLimit && be32(kWidthOffset + 4) <= kIconDimensionLimit;
+}
+
+// The decoded PNG, or none when it cannot be read or is empty. The file is
+// read through the bounded reader (so a FIFO, a device or a huge file is
+// refused, not waited on or swallowed) and an image whose header claims more
+// pixels than an icon could use is not decoded at all.
 SurfacePtr decodePNG(const URL& file) {
-  SurfacePtr source(cairo_image_surface_create_from_png(file.fileSystemRepresentation()));
+  const std::optional<Data> bytes = plist::readFileBytes(file, plist::ReadOptions{.sizeLimit = plist::kIconFileSizeLimit});
+  if (!bytes || !claimedDimensionsFit(*bytes)) return nullptr;
+  PNGSource source{*bytes};
+  SurfacePtr surface(cairo_image_surface_create_from_png_stream(&readFromMemory, &source));
   // cairo never returns null: a failed decode is a surface in an error state.
-  if (cairo_surface_status(source.get()) != CAIRO_STATUS_SUCCESS) return nullptr;
-  if (cairo_image_surface_get_width(source.get()) <= 0 || cairo_image_surface_get_height(source.get()) <= 0) {
+  if (cairo_surface_status(surface.get()) != CAIRO_STATUS_SUCCESS) return nullptr;
+  if (cairo_image_surface_get_width(surface.get()) <= 0 || cairo_image_surface_get_height(surface.get()) <= 0) {
     return nullptr;
   }
-  return source;
+  return surface;
 }
 
 // Adds a rounded square of side `size` and corner radius `radius` to the path.

@@ -8,7 +8,8 @@
 
 namespace platform {
 
-ReadOnlyFile::ReadOnlyFile(const char* path) : fd_(::open(path, O_RDONLY | O_CLOEXEC)) {}
+// O_NONBLOCK: a FIFO at the path must not hold the caller up in open().
+ReadOnlyFile::ReadOnlyFile(const char* path) : fd_(::open(path, O_RDONLY | O_CLOEXEC | O_NONBLOCK)) {}
 
 ReadOnlyFile::~ReadOnlyFile() {
   if (fd_ < 0) return;

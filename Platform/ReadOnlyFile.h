@@ -14,7 +14,8 @@ namespace platform {
 
 class ReadOnlyFile {
  public:
-  // Opens `path` read-only; check isOpen() (errno holds the reason when not).
+  // Opens `path` read-only without blocking (a FIFO opens at once and reads
+  // as empty); check isOpen() (errno holds the reason when not).
   explicit ReadOnlyFile(const char* path);
   ~ReadOnlyFile();
   ReadOnlyFile(const ReadOnlyFile&) = delete;

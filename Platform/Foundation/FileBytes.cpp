@@ -75,8 +75,16 @@ bool writeFailure(Error* error, const URL& url, const char* call, const std::str
 
 std::optional<Data> readFailure(Error* error, const URL& url, const char* call, int errnum) {
   Error posix = POSIXCallError(errnum, call, url.path());
-  std::string reason = errnum == ENOENT ? "no such file" : std::string(call) + " failed: " + errnoText(errnum);
+  std::string reason = errnum == ENOENT  ? "no such file"
+                       : errnum == ELOOP ? "a symbolic link, which this reader does not follow"
+                                         : std::string(call) + " failed: " + errnoText(errnum);
   failWith(error, FileReadError(url, reason, &posix));
+  return std::nullopt;
+}
+
+std::optional<Data> tooLarge(Error* error, const URL& url, uint64_t size, size_t limit) {
+  failWith(error, FileReadError(url, "the file holds at least " + std::to_string(size) + " bytes, more than the " +
+                                         std::to_string(limit) + " this reader takes"));
   return std::nullopt;
 }
 
@@ -208,9 +216,15 @@ bool writeInPlace(const Data& data, const URL& url, Error* error) {
 }  // namespace
 
 std::optional<Data> readFileBytes(const URL& url, Error* error) {
-  // O_NONBLOCK keeps a FIFO from blocking the open; only regular files are
-  // read (a device could be endless).
-  UniqueFd fd(::open(url.fileSystemRepresentation(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  return readFileBytes(url, ReadOptions{}, error);
+}
+
+std::optional<Data> readFileBytes(const URL& url, const ReadOptions& options, Error* error) {
+  // O_NONBLOCK keeps a FIFO (or a link to one) from blocking the open; only
+  // regular files are read (a device could be endless).
+  int flags = O_RDONLY | O_CLOEXEC | O_NONBLOCK;
+  if (options.finalLink == FinalLink::Refuse) flags |= O_NOFOLLOW;
+  UniqueFd fd(::open(url.fileSystemRepresentation(), flags));
   if (!fd.valid()) return readFailure(error, url, "open", errno);
   struct stat st;
   if (::fstat(fd.get(), &st) != 0) return readFailure(error, url, "fstat", errno);
@@ -219,9 +233,14 @@ std::optional<Data> readFileBytes(const URL& url, Error* error) {
     failWith(error, FileReadError(url, "not a regular file"));
     return std::nullopt;
   }
+  // The size is only a hint (a sparse file claims what it likes, a file can
+  // grow while it is read): nothing is reserved beyond the limit, and reading
+  // stops as soon as the limit is passed.
+  const uint64_t claimed = static_cast<uint64_t>(st.st_size);
+  if (claimed > options.sizeLimit) return tooLarge(error, url, claimed, options.sizeLimit);
 
   Data bytes;
-  bytes.reserve(static_cast<size_t>(st.st_size) + kReadChunk);
+  bytes.reserve(static_cast<size_t>(claimed));
   for (;;) {
     size_t used = bytes.size();
     bytes.resize(used + kReadChunk);
@@ -233,6 +252,7 @@ std::optional<Data> readFileBytes(const URL& url, Error* error) {
     if (n < 0) return readFailure(error, url, "read", errno);
     bytes.resize(used + static_cast<size_t>(n));
     if (n == 0) return bytes;
+    if (bytes.size() > options.sizeLimit) return tooLarge(error, url, bytes.size(), options.sizeLimit);
   }
 }
 

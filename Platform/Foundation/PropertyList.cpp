@@ -387,7 +387,11 @@ std::optional<Value> parse(const void* bytes, size_t length, Error* error) {
 }
 
 std::optional<Value> readFile(const URL& url, Error* error) {
-  std::optional<Data> bytes = readFileBytes(url, error);
+  return readFile(url, ReadOptions{}, error);
+}
+
+std::optional<Value> readFile(const URL& url, const ReadOptions& options, Error* error) {
+  std::optional<Data> bytes = readFileBytes(url, options, error);
   if (!bytes) return std::nullopt;
   std::string problem;
   std::optional<Value> value =
@@ -397,7 +401,11 @@ std::optional<Value> readFile(const URL& url, Error* error) {
 }
 
 std::optional<Dictionary> readDictionary(const URL& url, Error* error) {
-  std::optional<Value> value = readFile(url, error);
+  return readDictionary(url, ReadOptions{}, error);
+}
+
+std::optional<Dictionary> readDictionary(const URL& url, const ReadOptions& options, Error* error) {
+  std::optional<Value> value = readFile(url, options, error);
   if (!value) return std::nullopt;
   if (Dictionary* dictionary = value->asDictionary()) return std::move(*dictionary);
   std::string_view type = value->typeName();

@@ -46,13 +46,30 @@ enum class Format { XML, Binary };
 // files that are read back and removed before anything depends on them.
 enum class Durability { Flushed, Scratch };
 
+// Files are read only when they are regular files no larger than a limit,
+// checked against the open file's status before anything is allocated; the
+// open never blocks (a FIFO or a device is refused, not waited on). The
+// limits are far above what a real file of each kind holds.
+inline constexpr size_t kPropertyListFileSizeLimit = size_t{32} << 20;
+inline constexpr size_t kIconFileSizeLimit = size_t{8} << 20;
+
+// Whether a symbolic link in the last component is followed or refused.
+enum class FinalLink { Follow, Refuse };
+
+struct ReadOptions {
+  size_t sizeLimit = kPropertyListFileSizeLimit;
+  FinalLink finalLink = FinalLink::Follow;
+};
+
 // Parses a property list from memory (either format).
 std::optional<Value> parse(const void* bytes, size_t length, Error* error = nullptr);
 // Reads and parses a whole file.
 std::optional<Value> readFile(const URL& url, Error* error = nullptr);
+std::optional<Value> readFile(const URL& url, const ReadOptions& options, Error* error = nullptr);
 // Reads a file whose root must be a dictionary; another root is an error
 // (kFileErrorDomain, 256, "... root is a <type>, not a dictionary").
 std::optional<Dictionary> readDictionary(const URL& url, Error* error = nullptr);
+std::optional<Dictionary> readDictionary(const URL& url, const ReadOptions& options, Error* error = nullptr);
 
 // Serialises a Value. Null Values, URLs and Errors cannot be serialised (an
 // error); a URL nested inside is written as its path string.
@@ -67,9 +84,13 @@ bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Forma
                             bool atomically = true, Error* error = nullptr,
                             Durability durability = Durability::Flushed);
 
-// Reads a whole file's bytes (no caching). Missing file: kFileErrorDomain 260
-// with the POSIX error underneath; other failures: kFileErrorDomain 256.
+// Reads a whole file's bytes (no caching), with the property-list limit
+// unless told otherwise. Missing file: kFileErrorDomain 260 with the POSIX
+// error underneath; other failures (a refused link: ELOOP underneath; not a
+// regular file; larger than the limit, also when it grows while being read):
+// kFileErrorDomain 256.
 std::optional<Data> readFileBytes(const URL& url, Error* error = nullptr);
+std::optional<Data> readFileBytes(const URL& url, const ReadOptions& options, Error* error = nullptr);
 // Writes bytes, atomically when asked (temporary file, fsync, rename).
 bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error = nullptr,
                     Durability durability = Durability::Flushed);

@@ -4,7 +4,9 @@
 
 #include "Platform/BundleReader.h"
 #include "Platform/Foundation/Format.h"
+#include "Platform/Foundation/PathContainment.h"
 #include "Platform/Registry/BundleInfo.h"
+#include "Platform/Registry/RegistryAreas.h"
 #include "Platform/Registry/RegistryFiles.h"
 #include "Platform/Registry/SQLiteRegistry.h"
 #include "Platform/SystemLog.h"
@@ -164,7 +166,12 @@ bool Installation::addBundle(const std::string& source, BundleInfo info, const c
   plan.container = *container;
   plan.bundlePath = path::join(plan.container, lastComponent(source));
   planCreation(plan.container);
-  if (existing) plan.replacedContainer = existing->bundleContainer;
+  if (existing) {
+    if (!checkContainerPath(existing->bundleContainer, state_.layout.bundleContainers, "bundle container", error)) {
+      return false;
+    }
+    plan.replacedContainer = existing->bundleContainer;
+  }
   if (!planDataContainer(&plan, existing, error)) return false;
   if (!placeholder && !planGroups(&plan, error)) return false;
   bundles_.push_back(std::move(plan));
@@ -181,6 +188,12 @@ bool Installation::planDataContainer(BundlePlan* plan, const std::optional<Store
     if (!loadSystemDataContainer(*state_.db, plan->info.identifier, &kept, error)) return false;
   }
   if (kept) {
+    // An identifier may have changed kind between installations: either data
+    // area is the registry's own.
+    if (!path::liesInside(*kept, state_.layout.pluginDataContainers) &&
+        !checkContainerPath(*kept, state_.layout.applicationDataContainers, "data container", error)) {
+      return false;
+    }
     plan->dataContainer = *kept;
     if (!isDirectory(*kept)) planCreation(*kept);
     return true;
@@ -206,6 +219,8 @@ bool Installation::planGroups(BundlePlan* plan, Error* error) {
       path = newContainerPath(state_.layout.groupContainers, error);
       if (!path) return false;
       newGroups_[group] = *path;
+    } else if (!checkContainerPath(*path, state_.layout.groupContainers, "group container", error)) {
+      return false;
     }
     if (!isDirectory(*path)) planCreation(*path);
     plan->groups[group] = *path;
@@ -331,7 +346,7 @@ bool Installation::commit(Error* error) {
 // emptied now, the next installation or opening finds it and undoes it again,
 // which finds nothing left to do.
 void Installation::rollBack() {
-  (void)undoJournal(journal_, function_, nullptr);  // failures are logged; the journal keeps them for later
+  (void)undoJournal(state_.layout, journal_, function_, nullptr);  // failures are logged; the journal keeps them for later
   std::lock_guard dbLock(state_.dbMutex);
   (void)clearJournal(*state_.db, nullptr);
 }
@@ -342,7 +357,7 @@ void Installation::rollBack() {
 // names and the package directory, which nothing recreates before that
 // recovery). The next immediate commit carries it to the disk.
 void Installation::cleanUp() {
-  (void)undoJournal(removals_, function_, nullptr);  // removal failures are logged and leave only garbage
+  (void)undoJournal(state_.layout, removals_, function_, nullptr);  // removal failures are logged and leave only garbage
   std::lock_guard dbLock(state_.dbMutex);
   // Failing here leaves removals the next recovery repeats harmlessly.
   auto transaction = Transaction::begin(*state_.db, nullptr, CommitDurability::WithNextFlush);
@@ -607,7 +622,8 @@ bool installPackageDirectory(RegistryState& state, const URL& package, const Dic
   reporter.status(kRegistryStatusVerifying, kPercentVerifying);
   Error failure;
   bool installed = underInstallLocks(state, kInstallPackageFunction, &failure, [&] {
-    return installPackageLocked(state, package.path(), options, reporter, &failure);
+    return checkPackagePath(state.layout, package.path(), &failure) &&
+           installPackageLocked(state, package.path(), options, reporter, &failure);
   });
   if (installed) return true;
   reporter.failure(failure);

@@ -1,7 +1,9 @@
 #include "Platform/Registry/RegistryState.h"
 
 #include "Platform/Foundation/Format.h"
+#include "Platform/Registry/RegistryAreas.h"
 #include "Platform/Registry/RegistryFiles.h"
+#include "Platform/Registry/SQLiteRegistry.h"
 #include "Platform/SystemLog.h"
 
 namespace platform::registry {
@@ -23,7 +25,8 @@ std::string under(const std::string& root, const char* relative) {
   return path::join(root.empty() ? "/" : root, relative);
 }
 
-bool undoEntry(const JournalEntry& entry, Error* error) {
+bool undoEntry(const RegistryLayout& layout, const JournalEntry& entry, Error* error) {
+  if (!checkJournalEntry(layout, entry, error)) return false;
   switch (entry.kind) {
     case JournalKind::Move:
       // Moved: move it back. Not moved yet (the source is still there): nothing
@@ -39,7 +42,8 @@ bool undoEntry(const JournalEntry& entry, Error* error) {
 }  // namespace
 
 RegistryLayout::RegistryLayout(const std::string& systemRoot)
-    : databaseDirectory(under(systemRoot, kDatabaseDirectory)),
+    : systemRoot(systemRoot.empty() ? "/" : systemRoot),
+      databaseDirectory(under(systemRoot, kDatabaseDirectory)),
       databasePath(path::join(databaseDirectory, kDatabaseFileName)),
       lockPath(path::join(databaseDirectory, kLockFileName)),
       bundleContainers(under(systemRoot, kBundleContainers)),
@@ -54,13 +58,14 @@ std::optional<std::string> newContainerPath(const std::string& parent, Error* er
   return path::join(parent, *uuid);
 }
 
-bool undoJournal(const std::vector<JournalEntry>& entries, const char* function, Error* error) {
+bool undoJournal(const RegistryLayout& layout, const std::vector<JournalEntry>& entries, const char* function,
+                 Error* error) {
   bool ok = true;
   for (auto it = entries.rbegin(); it != entries.rend(); ++it) {
     Error entryError;
-    if (undoEntry(*it, &entryError)) continue;
+    if (undoEntry(layout, *it, &entryError)) continue;
     SystemLogWrite(nullptr, kFailureLevel, function, "Could not undo or finish %s: %@", it->destination, entryError);
-    if (it->kind == JournalKind::Remove) continue;
+    if (it->kind == JournalKind::Remove && !entryError.is(kRegistryErrorDomain, kRegistryErrorOutsideAreas)) continue;
     if (ok && error) *error = entryError;
     ok = false;
   }
@@ -75,7 +80,7 @@ bool recoverJournalLocked(RegistryState& state, const char* function, Error* err
   }
   if (entries.empty()) return true;
   Error undoError;
-  if (!undoJournal(entries, function, &undoError)) {
+  if (!undoJournal(state.layout, entries, function, &undoError)) {
     SystemLogWrite(nullptr, kFailureLevel, function, "Could not recover interrupted installation in %s: %@",
                    state.layout.databasePath, undoError);
     if (error) *error = undoError;

@@ -23,6 +23,7 @@ namespace platform::registry {
 // Paths of the registry's layout under a system root (see SQLiteRegistry.h).
 struct RegistryLayout {
   explicit RegistryLayout(const std::string& systemRoot);
+  std::string systemRoot;  // "/" for the real one
   std::string databaseDirectory;
   std::string databasePath;
   std::string lockPath;
@@ -54,7 +55,11 @@ std::optional<std::string> newContainerPath(const std::string& parent, Error* er
 // creation could not be undone; a removal that fails is only logged (it
 // leaves garbage, never a record without its files). `function` names the
 // caller in the log.
-bool undoJournal(const std::vector<JournalEntry>& entries, const char* function, Error* error);
+// An entry that points outside the registry's areas (RegistryAreas.h) is not
+// acted on: it counts as one that could not be undone, so the journal keeps
+// it and every later installation refuses to start over it.
+bool undoJournal(const RegistryLayout& layout, const std::vector<JournalEntry>& entries, const char* function,
+                 Error* error);
 
 // Brings the files back in line with the records after an interrupted
 // installation, and empties the journal. REQUIRES: changeMutex and the install

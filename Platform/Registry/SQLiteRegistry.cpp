@@ -9,6 +9,7 @@
 
 #include "Platform/Foundation/Format.h"
 #include "Platform/Registry/Installation.h"
+#include "Platform/Registry/RegistryAreas.h"
 #include "Platform/Registry/RegistryFiles.h"
 #include "Platform/Registry/RegistryReader.h"
 #include "Platform/Registry/RegistryState.h"
@@ -44,7 +45,9 @@ std::optional<std::string> ensureContainer(RegistryState& state, const std::stri
     if (!load(*state.db, &recorded, error)) return std::nullopt;
   }
   if (recorded) {
-    if (!makeDirectories(*recorded, error)) return std::nullopt;
+    if (!checkContainerPath(*recorded, parent, "container", error) || !makeDirectories(*recorded, error)) {
+      return std::nullopt;
+    }
     return recorded;
   }
   std::optional<std::string> made = newContainerPath(parent, error);

@@ -20,7 +20,9 @@
 //
 // Installation (installPackage) runs on the registry's worker thread (started
 // with the first installation, kept until the registry goes away), which
-// delivers every progress report; the call returns after the last one. A package is its
+// delivers every progress report; the call returns after the last one. The
+// package must lie inside the system root, outside the registry's own
+// directories (else kRegistryErrorOutsideAreas). A package is its
 // "Payload" directory (exactly one *.app and at most one *.vpnplugin, or a
 // single *.vpnplugin alone) and store-metadata items beside "Payload", which
 // are kept beside the bundle in its new container. After a successful
@@ -64,6 +66,7 @@ inline constexpr int64_t kRegistryErrorAlreadyInstalled = 5;    // a built-in co
 inline constexpr int64_t kRegistryErrorFileOperation = 6;       // a container could not be made or filled
 inline constexpr int64_t kRegistryErrorInvalidOptions = 7;      // options the call does not support
 inline constexpr int64_t kRegistryErrorNotReplaceable = 8;      // a placeholder for an installed application
+inline constexpr int64_t kRegistryErrorOutsideAreas = 9;  // a recorded path outside the registry's own directories
 
 // Values of kRegistryProgressStatusKey, in the order an installation reports
 // them. "RegisteringApplication" comes after the files are in place and before

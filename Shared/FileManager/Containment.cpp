@@ -12,6 +12,7 @@
 #include <string_view>
 #include <vector>
 
+#include "Platform/Foundation/PathContainment.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
 #include "Shared/FileManager/SymlinkText.h"
@@ -174,6 +175,11 @@ std::optional<URL> QSFileManager::realPathForURL(const URL& url, const URL& ifCh
   // target out of the base.
   if (!realPathsNest(suspicious, base, suspiciousReal->path(), baseReal->path())) return std::nullopt;
   return suspiciousReal;
+}
+
+bool QSFileManager::urlLiesInsideURL(const URL& url, const URL& base, bool orIsBase) const {
+  return orIsBase ? platform::path::liesInsideOrAt(url.path(), base.path())
+                  : platform::path::liesInside(url.path(), base.path());
 }
 
 std::optional<URL> QSFileManager::_realPathForURL(const URL& url, bool allowNonExistentPathComponents) const {

@@ -132,6 +132,10 @@ class QSFileManager {
   // while it is under way.
   static bool isInterruptedMoveItemName(std::string_view name);
 
+  // --- Durability ---------------------------------------------------------------
+  // Flushes the entries of the directory at `url` (fsync), so that what was
+  // moved into or out of it survives a power cut. A link at the path fails.
+  bool synchronizeDirectoryAtURL(const platform::URL& url, platform::Error* error = nullptr) const;
   // --- Temporary directories ("temp.XXXXXX", mode 0700) ----------------------
   std::optional<platform::URL> createTemporaryDirectoryInDirectoryURL(const platform::URL& parent,
                                                                       platform::Error* error = nullptr) const;
@@ -179,6 +183,12 @@ class QSFileManager {
   std::optional<platform::URL> realPathForURL(const platform::URL& url, const platform::URL& ifChildOfURL) const;
   std::optional<platform::URL> _realPathForURL(const platform::URL& url, bool allowNonExistentPathComponents) const;
   std::optional<platform::URL> _realPathWhatExistsInPath(const std::string& path) const;
+  // Whether `url` lies strictly inside `base` (or is `base` itself, when
+  // `orIsBase`), judged by where every existing part of both leads, so that a
+  // link on the way out of the base is caught. Relative and empty paths and
+  // paths with a ".." component are refused. Nothing is logged: the caller
+  // says what the path was for.
+  bool urlLiesInsideURL(const platform::URL& url, const platform::URL& base, bool orIsBase = false) const;
   // A null path pointer stands for a missing path.
   bool _validateSymlink(const std::string* path, uint32_t withStartingDepth, uint32_t* andEndingDepth) const;
 

@@ -29,6 +29,9 @@ constexpr char kOldDataDirectoryRelativePath[] = "Library/Quillset";
 constexpr char kOldLoggingRelativePath[] = "Library/Logs/Quillset";
 constexpr char kOldArchiveRelativePath[] = "Media/ApplicationArchives";
 constexpr char kDataDirectoryRelativePath[] = "Library/Quillset";
+constexpr char kRecoveryDirectoryRelativePath[] = "Library/Quillset/Recovered";
+constexpr char kBundleContainersRelativePath[] = "private/var/containers";
+constexpr char kDataContainersRelativePath[] = "Containers";
 constexpr char kRoleUserMigrationMarkerName[] = "RoleUserMigration.plist";
 constexpr char kCachesRelativePath[] = "Library/Caches";
 constexpr char kStagingRootName[] = "com.vantrel.mobile.quilld.staging";
@@ -162,6 +165,18 @@ URL QSGlobalConfiguration::oldArchiveDirectory() const { return _mobilePath.appe
 
 URL QSGlobalConfiguration::dataDirectoryPath() const {
   return _quilldPath.appending(kDataDirectoryRelativePath, true);
+}
+
+URL QSGlobalConfiguration::recoveryDirectoryPath() const {
+  return _mobilePath.appending(kRecoveryDirectoryRelativePath, true);
+}
+
+URL QSGlobalConfiguration::bundleContainersPath() const {
+  return _rootPath.appending(kBundleContainersRelativePath, true);
+}
+
+URL QSGlobalConfiguration::dataContainersPath() const {
+  return _mobilePath.appending(kDataContainersRelativePath, true);
 }
 
 URL QSGlobalConfiguration::roleUserMigrationMarkerFilePath() const {

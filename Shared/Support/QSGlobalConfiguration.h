@@ -62,6 +62,15 @@ class QSGlobalConfiguration {
   platform::URL oldArchiveDirectory() const;
   platform::URL dataDirectoryPath() const;
   platform::URL roleUserMigrationMarkerFilePath() const;
+  // The system root as a directory URL.
+  platform::URL rootPath() const { return _rootPath; }
+  // Where the data of a container removed for holding no usable bundle is
+  // kept for a person to recover, one directory per container.
+  platform::URL recoveryDirectoryPath() const;
+  // The parents of the new layout's bundle containers and of its data, plug-in
+  // and group containers.
+  platform::URL bundleContainersPath() const;
+  platform::URL dataContainersPath() const;
 
   // Cached accessors; those that create their directory do so on every call
   // (intermediates, mode 0755, class 4 where stated) and return the URL

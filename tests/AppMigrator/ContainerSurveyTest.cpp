@@ -68,10 +68,11 @@ TEST_F(Introspection, SymbolicLinkedBundleOrMarkerLeavesContainerUntouched) {
 }
 
 TEST_F(Introspection, AValidMarkerWinsOverTheChildrenAnInvalidOneLeavesThemTheDecision) {
-  // Recorded elsewhere on purpose: the marker's paths are passed on unchanged.
+  // A marker describing its own container wins, extra keys and all.
   const std::string container = makeBundleContainer("marked", "com.example.main");
   const std::string markerPath = container + "/" + kMarkerName;
-  Dictionary marker = containerInfo("/elsewhere", "/elsewhere/Tunnel.vpnplugin", "com.example.other", "VPNBundle");
+  Dictionary marker =
+      containerInfo(container + "/", container + "/Staging/Payload/Tunnel.vpnplugin", "com.example.other", "VPNBundle");
   marker["Extra"] = Value(7);
   writePlist(markerPath, Value(marker));
   bool early = true;
@@ -93,8 +94,30 @@ TEST_F(Introspection, AValidMarkerWinsOverTheChildrenAnInvalidOneLeavesThemTheDe
   EXPECT_EQ(introspect(container), fromChildren);
   EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to get container bundle ID from migration marker file " + markerPath));
 
+  // Paths that leave the container make the marker invalid.
+  const struct {
+    const char* key;
+    std::string value;
+    std::string line;
+  } kEscapes[] = {
+      {"ContainerPath", "/elsewhere", "its container path /elsewhere is not the container it lies in"},
+      {"ContainerPath", "", "its container path  is not the container it lies in"},
+      {"BundlePath", "/Applications/Built.app", "its BundlePath /Applications/Built.app does not lie inside"},
+      {"BundlePath", container + "/../other/X.app", "its BundlePath " + container + "/../other/X.app does not"},
+      {"BundlePath", container, "its BundlePath " + container + " does not lie inside"},
+      {"SecondBundlePath", "/", "its SecondBundlePath / does not lie inside its container"},
+  };
+  for (const auto& escape : kEscapes) {
+    Dictionary bad = containerInfo(container, container + "/com.example.main.app", "com.example.main", "App");
+    bad[escape.key] = Value(escape.value);
+    writePlist(markerPath, Value(bad));
+    log_->clear();
+    EXPECT_EQ(introspect(container), fromChildren) << escape.key << "=" << escape.value;
+    EXPECT_TRUE(loggedOnce("QSAppMigrator: Migration marker " + markerPath + " is invalid: " + escape.line, true));
+  }
+
   // Unreadable, in a container whose application has no identifier (so no
-  // bundle): removed like any other, with its data.
+  // bundle): removed like any other, its data kept for recovery.
   const std::string garbage = makeContainer("garbage");
   ASSERT_TRUE(writeFile(garbage + "/" + kMarkerName, "garbage"));
   makeBundle(garbage + "/Main.app", "");
@@ -104,6 +127,37 @@ TEST_F(Introspection, AValidMarkerWinsOverTheChildrenAnInvalidOneLeavesThemTheDe
   // Once from the loader, once from introspection.
   EXPECT_EQ(log_->count(markerLoadFailedLine(garbage + "/" + kMarkerName)), 2u);
   EXPECT_TRUE(loggedOnce("QSAppMigrator: No app or vpn bundle found in container " + garbage + " ; removing it"));
+  const std::string recovered = QSGlobalConfiguration::sharedInstance().recoveryDirectoryPath().path() + "/garbage";
+  EXPECT_EQ(directoryNames(recovered), (std::vector<std::string>{"Documents", "Main.app"}));
+}
+
+TEST_F(Introspection, DataOfABundlelessContainerIsKeptForRecoveryOrTheContainerStays) {
+  const std::string recovery = QSGlobalConfiguration::sharedInstance().recoveryDirectoryPath().path();
+  auto makeLost = [&] {
+    const std::string lost = makeContainer("lost");
+    makeBundle(lost + "/Broken.app", "");
+    EXPECT_TRUE(makeDirs(lost + "/Documents") && makeDirs(lost + "/Library/Caches"));
+    EXPECT_TRUE(writeFile(lost + "/Documents/notes.txt", "mine"));
+    EXPECT_TRUE(makeDirs(lost + "/Unknown"));
+    return lost;
+  };
+  // Twice under one name: the second gets a directory of its own.
+  for (const std::string name : {"lost", "lost.1"}) {
+    const std::string lost = makeLost();
+    log_->clear();
+    EXPECT_FALSE(introspect(lost).has_value());
+    EXPECT_FALSE(pathExists(lost));
+    EXPECT_EQ(readFile(recovery + "/" + name + "/Documents/notes.txt"), "mine");
+    EXPECT_EQ(directoryNames(recovery + "/" + name), (std::vector<std::string>{"Broken.app", "Documents", "Library"}));
+    EXPECT_TRUE(loggedOnce("QSAppMigrator: Moved 3 items of " + lost + " to " + recovery + "/" + name + " for recovery"));
+  }
+  // Nowhere to keep them: the container stays whole.
+  makeImmutable(recovery);
+  const std::string lost = makeLost();
+  EXPECT_FALSE(introspect(lost).has_value());
+  EXPECT_EQ(readFile(lost + "/Documents/notes.txt"), "mine");
+  EXPECT_TRUE(pathExists(lost + "/Broken.app"));
+  EXPECT_TRUE(loggedOnce("QSAppMigrator: Failed to create a recovery directory for " + lost, true));
 }
 
 // The survey (what a dry run uses) finds what introspection finds and

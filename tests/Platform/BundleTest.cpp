@@ -1,5 +1,8 @@
 // Reading bundles and rendering their icons; the PNG encoder. Images are
 // checked by decoding what the system made.
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include "Platform/Imaging.h"
 #include "Platform/RegistryFixture.h"
 #include "support/ImageSupport.h"
@@ -72,8 +75,13 @@ TEST(IconRendering, IconIsScaledAndMaskedWithStraightAlphaFromAReadablePNGInside
   const std::string whole = readFile(dir / "AppIcon.png");
   ASSERT_TRUE(writeFile(dir / "Half.png", whole.substr(0, whole.size() / 2)) && writeFile(dir / "Junk.png", "junk"));
   const std::string escape = "../" + URL::fileURL(outside.path()).lastPathComponent() + "/Evil.png";
-  const std::pair<Value, std::optional<uint32_t>> cases[] = {{"AppIcon.png", kRed}, {7, kBlue},       {escape, {}},
-                                                             {"Absent.png", {}},    {"Junk.png", {}}, {"Half.png", {}}};
+  // Neither waited on nor decoded: a FIFO, a link to one, a device, an image
+  // wider than any icon.
+  ASSERT_TRUE(mkfifo((dir / "Pipe.png").c_str(), 0644) == 0 && symlink("Pipe.png", (dir / "Piped.png").c_str()) == 0);
+  ASSERT_TRUE(symlink("/dev/zero", (dir / "Zero.png").c_str()) == 0 && writeSolidPNG(dir / "Wide.png", 5000, 1, kRed));
+  const std::pair<Value, std::optional<uint32_t>> cases[] = {
+      {"AppIcon.png", kRed}, {7, kBlue},         {escape, {}},    {"Absent.png", {}}, {"Junk.png", {}},
+      {"Half.png", {}},      {"Pipe.png", {}},   {"Piped.png", {}}, {"Zero.png", {}},   {"Wide.png", {}}};
   for (const auto& [iconFile, atQuarter] : cases) {
     const std::optional<Image> icon = render(dir, {{kBundleIconFileKey, iconFile}});
     ASSERT_EQ(icon.has_value(), atQuarter.has_value()) << iconFile.description();
