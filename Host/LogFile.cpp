@@ -8,6 +8,8 @@
 #include <ctime>
 #include <filesystem>
 
+#include "Platform/Foundation/Text.h"
+
 namespace transvale {
 
 namespace {
@@ -16,34 +18,6 @@ constexpr char kStandardErrorPath[] = "-";
 constexpr char kHostSinkName[] = "host";
 constexpr char kSystemSinkName[] = "system";
 constexpr mode_t kLogDirectoryMode = 0755;
-
-// Length of the UTF-8 sequence starting at bytes[i] when it is valid (no
-// overlong forms, no surrogates, nothing above U+10FFFF), else 0.
-size_t validUTF8SequenceLength(std::string_view bytes, size_t i) {
-  const auto byte = [&](size_t k) { return static_cast<unsigned char>(bytes[k]); };
-  const unsigned char lead = byte(i);
-  size_t length = 0;
-  unsigned char low = 0x80, high = 0xBF;  // range of the second byte
-  if (lead >= 0xC2 && lead <= 0xDF) {
-    length = 2;
-  } else if (lead >= 0xE0 && lead <= 0xEF) {
-    length = 3;
-    if (lead == 0xE0) low = 0xA0;
-    if (lead == 0xED) high = 0x9F;
-  } else if (lead >= 0xF0 && lead <= 0xF4) {
-    length = 4;
-    if (lead == 0xF0) low = 0x90;
-    if (lead == 0xF4) high = 0x8F;
-  } else {
-    return 0;
-  }
-  if (i + length > bytes.size()) return 0;
-  if (byte(i + 1) < low || byte(i + 1) > high) return 0;
-  for (size_t k = 2; k < length; ++k) {
-    if (byte(i + k) < 0x80 || byte(i + k) > 0xBF) return 0;
-  }
-  return length;
-}
 
 void appendHexEscape(std::string& out, const char* prefix, unsigned char byte) {
   static constexpr char kHex[] = "0123456789abcdef";
@@ -84,7 +58,7 @@ std::string jsonQuoted(std::string_view bytes) {
       ++i;
       continue;
     }
-    const size_t length = validUTF8SequenceLength(bytes, i);
+    const size_t length = platform::utf8SequenceLength(bytes, i);
     if (length == 0) {
       appendHexEscape(out, "\\udc", c);
       ++i;

@@ -31,6 +31,10 @@ struct Image {
   std::vector<uint8_t> rgba;  // width * height * 4 bytes
 };
 
+// The PNG encoding of `image` (libpng), or none when its pixels do not match
+// its size or libpng fails.
+std::optional<Data> encodePNG(const Image& image);
+
 class IconRenderer {
  public:
   virtual ~IconRenderer() = default;

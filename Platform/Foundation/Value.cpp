@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/Text.h"
 
 namespace platform {
 
@@ -202,12 +203,8 @@ std::string Value::description() const {
                         [](const Boxed<Data>& boxedData) {
                           const Data& data = *boxedData;
                           std::string out = "{length = " + std::to_string(data.size()) + ", bytes = 0x";
-                          static const char kHex[] = "0123456789abcdef";
                           size_t shown = data.size() <= 24 ? data.size() : 8;
-                          for (size_t i = 0; i < shown; ++i) {
-                            out += kHex[data[i] >> 4];
-                            out += kHex[data[i] & 15];
-                          }
+                          out += hexString(data.data(), shown);
                           if (shown < data.size()) out += "...";
                           return out + "}";
                         },

@@ -90,12 +90,12 @@ std::optional<std::string> readLinkText(const std::string& path) {
   return text;
 }
 
-bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, Sha256Digest* digest, uint64_t* size,
+bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, platform::SHA256Digest* digest, uint64_t* size,
                   std::string* why) {
   UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
   if (!fd.valid()) return fail(why, "open", path, errno);
   if (buffer.size() < kReadChunk) buffer.resize(kReadChunk);
-  Sha256 hasher;
+  platform::SHA256 hasher;
   uint64_t total = 0;
   for (;;) {
     const ssize_t got = read(fd.get(), buffer.data(), buffer.size());

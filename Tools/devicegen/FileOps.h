@@ -16,7 +16,7 @@
 #include <string>
 #include <vector>
 
-#include "Tools/devicegen/Digest.h"
+#include "Platform/Digest.h"
 
 namespace devicegen {
 
@@ -54,7 +54,7 @@ ItemKind itemKind(const std::string& path, uint64_t* size = nullptr);
 std::optional<std::string> readLinkText(const std::string& path);
 // Reads the regular file at `path` through `buffer` (grown as needed and
 // reused across calls) and hashes it. Refuses to follow a symbolic link.
-bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, Sha256Digest* digest, uint64_t* size,
+bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, platform::SHA256Digest* digest, uint64_t* size,
                   std::string* why);
 // Names in the directory at `path` ("." and ".." excluded), or none when it
 // cannot be read.

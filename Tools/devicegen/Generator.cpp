@@ -535,7 +535,7 @@ class ImageWriter {
     if (!writeWholeFile(join(container, relative), bytes, size, kFileMode, why)) return false;
     ManifestItem& item = addItem(owner, ownerId, ManifestItem::Kind::File, relative);
     item.size = size;
-    item.digest = sha256(bytes, size);
+    item.digest = platform::sha256(bytes, size);
     return true;
   }
 

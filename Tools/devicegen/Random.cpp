@@ -3,6 +3,8 @@
 #include <cstring>
 #include <numeric>
 
+#include "Platform/Foundation/Text.h"
+
 namespace devicegen {
 namespace {
 
@@ -59,7 +61,6 @@ void DeterministicRandom::fill(uint8_t* bytes, size_t length) {
 }
 
 std::string DeterministicRandom::uuid() {
-  static constexpr char kHex[] = "0123456789ABCDEF";
   uint8_t bytes[16];
   fill(bytes, sizeof bytes);
   bytes[6] = static_cast<uint8_t>((bytes[6] & 0x0F) | 0x40);
@@ -68,8 +69,7 @@ std::string DeterministicRandom::uuid() {
   text.reserve(36);
   for (size_t i = 0; i < sizeof bytes; ++i) {
     if (i == 4 || i == 6 || i == 8 || i == 10) text += '-';
-    text += kHex[bytes[i] >> 4];
-    text += kHex[bytes[i] & 0x0F];
+    platform::appendHex(text, bytes[i], platform::HexCase::Upper);
   }
   return text;
 }
