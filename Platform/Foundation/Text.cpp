@@ -54,4 +54,17 @@ std::string hexString(const void* bytes, size_t length) {
   return text;
 }
 
+std::string uuidString(std::span<const uint8_t, 16> random) {
+  static constexpr uint8_t kVersionMask = 0x0F, kVersion4 = 0x40, kVariantMask = 0x3F, kVariantRFC4122 = 0x80;
+  std::string text;
+  for (size_t i = 0; i < random.size(); ++i) {
+    if (i == 4 || i == 6 || i == 8 || i == 10) text += '-';
+    uint8_t byte = random[i];
+    if (i == 6) byte = static_cast<uint8_t>((byte & kVersionMask) | kVersion4);
+    if (i == 8) byte = static_cast<uint8_t>((byte & kVariantMask) | kVariantRFC4122);
+    appendHex(text, byte, HexCase::Upper);
+  }
+  return text;
+}
+
 }  // namespace platform

@@ -8,6 +8,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -28,5 +29,9 @@ void appendHex(std::string& out, uint8_t byte, HexCase letters = HexCase::Lower)
 
 // Two lower-case hexadecimal digits per byte.
 std::string hexString(const void* bytes, size_t length);
+
+// A version-4 UUID ("0F1E2D3C-4B5A-4978-8695-A4B3C2D1E0F0", upper case) made
+// of 16 random bytes.
+std::string uuidString(std::span<const uint8_t, 16> random);
 
 }  // namespace platform

@@ -12,7 +12,9 @@
 #include <string>
 #include <vector>
 
+#include "Platform/FileSystem.h"
 #include "Platform/Foundation/Error.h"
+#include "Platform/PosixHandles.h"
 
 namespace platform::registry {
 
@@ -22,7 +24,7 @@ Error posixFailure(int64_t code, const std::string& what, const std::string& pat
 // A registry error without an underlying error.
 Error registryError(int64_t code, const std::string& message);
 
-bool isDirectory(const std::string& path);
+// isDirectory is the platform's (FileSystem.h).
 // A directory itself, not a symbolic link to one.
 bool isDirectoryNoFollow(const std::string& path);
 bool exists(const std::string& path);  // without following a final symbolic link
@@ -62,14 +64,10 @@ class FileLock {
  public:
   // Blocks until the lock is held; none when the lock file cannot be opened.
   static std::optional<FileLock> acquire(const std::string& path, Error* error);
-  FileLock(FileLock&& other) noexcept : fd_(other.fd_) { other.fd_ = -1; }
-  FileLock& operator=(FileLock&&) = delete;
-  FileLock(const FileLock&) = delete;
-  ~FileLock();
 
  private:
-  explicit FileLock(int fd) : fd_(fd) {}
-  int fd_;
+  explicit FileLock(ScopedFD fd) : fd_(std::move(fd)) {}
+  ScopedFD fd_;  // closing it releases the lock
 };
 
 }  // namespace platform::registry

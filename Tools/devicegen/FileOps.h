@@ -17,24 +17,11 @@
 #include <vector>
 
 #include "Platform/Digest.h"
+#include "Platform/PosixHandles.h"
 
 namespace devicegen {
 
-// An owned file descriptor, closed when the object goes away.
-class UniqueFd {
- public:
-  explicit UniqueFd(int fd = -1) : fd_(fd) {}
-  ~UniqueFd();
-  UniqueFd(UniqueFd&& other) noexcept : fd_(other.fd_) { other.fd_ = -1; }
-  UniqueFd& operator=(UniqueFd&&) = delete;
-  UniqueFd(const UniqueFd&) = delete;
-  UniqueFd& operator=(const UniqueFd&) = delete;
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-
- private:
-  int fd_;
-};
+using UniqueFd = platform::ScopedFD;
 
 inline constexpr mode_t kDirectoryMode = 0755;
 inline constexpr mode_t kFileMode = 0644;
