@@ -21,8 +21,8 @@ constexpr char kIntrospectFunction[] = "-[QSAppMigrator _introspectContainer:ord
 constexpr char kLoadMarkerFunction[] = "-[QSAppMigrator _loadAndValidateMigrationMarkerAtURL:]";
 
 // Bundle kinds, by exact (case-sensitive) path extension.
-constexpr char kApplicationBundleExtension[] = "app";
-constexpr char kVPNPluginBundleExtension[] = "vpnplugin";
+using platform::kApplicationBundleExtension;
+using platform::kVPNPluginBundleExtension;
 
 // The bundles found so far among a container's children.
 struct FoundBundles {

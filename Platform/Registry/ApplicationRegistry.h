@@ -27,6 +27,9 @@ inline constexpr char kRegistryPackageTypeKey[] = "PackageType";
 inline constexpr char kRegistryPackageTypeCustomer[] = "Customer";
 inline constexpr char kRegistryPackageTypePlaceholder[] = "Placeholder";
 inline constexpr char kRegistryStoreMetadataKey[] = "StoreMetadata";
+// The store-metadata file beside "Payload" in a package, in an installed
+// bundle's container and in an application's old container.
+inline constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
 // Progress-report keys.
 inline constexpr char kRegistryProgressErrorKey[] = "Error";
 inline constexpr char kRegistryProgressErrorDescriptionKey[] = "ErrorDescription";
