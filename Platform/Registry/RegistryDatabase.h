@@ -26,7 +26,9 @@ class Statement;
 class Database {
  public:
   // Opens (creating when needed) the database at `path` in WAL mode with
-  // synchronous=FULL and creates the schema. Null on failure.
+  // synchronous=FULL and creates the schema, recording its version. Null on
+  // failure; a database of a newer schema version fails with
+  // kRegistryErrorNewerDatabase and is not changed.
   static std::unique_ptr<Database> open(const std::string& path, Error* error);
   ~Database();
   Database(const Database&) = delete;
@@ -41,6 +43,7 @@ class Database {
 
  private:
   Database(sqlite3* handle, std::string path) : handle_(handle), path_(std::move(path)) {}
+  bool createSchema(Error* error);
   friend class Statement;
   sqlite3* handle_;
   std::string path_;

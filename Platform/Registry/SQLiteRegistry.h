@@ -63,6 +63,7 @@ inline constexpr int64_t kRegistryErrorAlreadyInstalled = 5;    // a built-in co
 inline constexpr int64_t kRegistryErrorFileOperation = 6;       // a container could not be made or filled
 inline constexpr int64_t kRegistryErrorInvalidOptions = 7;      // options the call does not support
 inline constexpr int64_t kRegistryErrorNotReplaceable = 8;      // a placeholder for an installed application
+inline constexpr int64_t kRegistryErrorNewerDatabase = 9;       // the database was made by a newer version
 
 // Values of kRegistryProgressStatusKey, in the order an installation reports
 // them. "RegisteringApplication" comes after the files are in place and before
