@@ -47,7 +47,7 @@ class ImageEncoder {
   virtual ~ImageEncoder() = default;
   virtual void addImage(const Image& image) = 0;
   // True when the encoded data has been written into the buffer.
-  virtual bool finalize() = 0;
+  [[nodiscard]] virtual bool finalize() = 0;
 };
 
 class ImageEncoding {

@@ -77,10 +77,10 @@ class ApplicationRegistry {
   // Installs the package directory at `package` ("Payload/*.app", optional
   // "*.vpnplugin", store metadata beside "Payload"). `progress` may be empty.
   // Returns only after the last report has been delivered.
-  virtual bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
+  [[nodiscard]] virtual bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
                               Error* error) = 0;
   // Installs a placeholder bundle directory; no progress reports.
-  virtual bool installBundle(const URL& bundle, const Dictionary& options, Error* error) = 0;
+  [[nodiscard]] virtual bool installBundle(const URL& bundle, const Dictionary& options, Error* error) = 0;
 };
 
 }  // namespace platform

@@ -35,7 +35,7 @@ class Database {
   Database& operator=(const Database&) = delete;
 
   // Runs one or more statements without results.
-  bool execute(const char* sql, Error* error);
+  [[nodiscard]] bool execute(const char* sql, Error* error);
   std::optional<Statement> prepare(const char* sql, Error* error);
   const std::string& path() const { return path_; }
   // The record for the connection's last failure while `what`.
@@ -43,7 +43,7 @@ class Database {
 
  private:
   Database(sqlite3* handle, std::string path) : handle_(handle), path_(std::move(path)) {}
-  bool createSchema(Error* error);
+  [[nodiscard]] bool createSchema(Error* error);
   friend class Statement;
   sqlite3* handle_;
   std::string path_;
@@ -63,10 +63,10 @@ class Statement {
 
   // Advances: true with a row, false at the end; on failure false with *error.
   // `failed` distinguishes the end from a failure.
-  bool step(bool* failed, Error* error);
+  [[nodiscard]] bool step(bool* failed, Error* error);
   // Runs a statement that returns no rows, then resets it so that it can be
   // bound and run again.
-  bool run(Error* error);
+  [[nodiscard]] bool run(Error* error);
 
   std::string text(int column) const;
   std::optional<std::string> optionalText(int column) const;
@@ -88,7 +88,7 @@ class Transaction {
   Transaction& operator=(Transaction&&) = delete;
   Transaction(const Transaction&) = delete;
   ~Transaction();
-  bool commit(Error* error);
+  [[nodiscard]] bool commit(Error* error);
 
  private:
   explicit Transaction(Database* db) : db_(db) {}

@@ -34,25 +34,25 @@ bool exists(const std::string& path);  // without following a final symbolic lin
 std::optional<std::vector<std::string>> listDirectory(const std::string& path, Error* error);
 
 // mkdir -p with mode 0755; an existing directory is success.
-bool makeDirectories(const std::string& path, Error* error);
+[[nodiscard]] bool makeDirectories(const std::string& path, Error* error);
 // Makes the missing parents of `path` and then `path` itself, which must not
 // exist yet (so that undoing it can never remove something older).
-bool createNewDirectory(const std::string& path, Error* error);
+[[nodiscard]] bool createNewDirectory(const std::string& path, Error* error);
 // Removes the item at `path` and everything under it; nothing there is success.
-bool removeTree(const std::string& path, Error* error);
+[[nodiscard]] bool removeTree(const std::string& path, Error* error);
 // Copies the tree at `source` to `destination` (which must not exist):
 // directories, regular files (with their modes) and symbolic links.
-bool copyTree(const std::string& source, const std::string& destination, Error* error);
+[[nodiscard]] bool copyTree(const std::string& source, const std::string& destination, Error* error);
 // Renames `source` to `destination`. Only a rename can be undone after a crash,
 // so there is no copying fallback: across file systems this fails (EXDEV).
-bool moveItem(const std::string& source, const std::string& destination, Error* error);
+[[nodiscard]] bool moveItem(const std::string& source, const std::string& destination, Error* error);
 // Flushes a directory's entries (fsync on the directory), so that the renames
 // and creations in it survive a power loss.
-bool syncDirectory(const std::string& path, Error* error);
+[[nodiscard]] bool syncDirectory(const std::string& path, Error* error);
 // Writes `bytes` to a new file at `path` and flushes it.
-bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error);
+[[nodiscard]] bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error);
 // Sets the data-protection class attribute of the directory at `path`.
-bool setProtectionClass(const std::string& path, int32_t protectionClass, Error* error);
+[[nodiscard]] bool setProtectionClass(const std::string& path, int32_t protectionClass, Error* error);
 
 // A random UUID in upper-case 8-4-4-4-12 form (version 4).
 std::optional<std::string> newUUID(Error* error);

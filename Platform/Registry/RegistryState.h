@@ -54,11 +54,11 @@ std::optional<std::string> newContainerPath(const std::string& parent, Error* er
 // creation could not be undone; a removal that fails is only logged (it
 // leaves garbage, never a record without its files). `function` names the
 // caller in the log.
-bool undoJournal(const std::vector<JournalEntry>& entries, const char* function, Error* error);
+[[nodiscard]] bool undoJournal(const std::vector<JournalEntry>& entries, const char* function, Error* error);
 
 // Brings the files back in line with the records after an interrupted
 // installation, and empties the journal. REQUIRES: changeMutex and the install
 // lock held. False (the journal kept) when something could not be undone.
-bool recoverJournalLocked(RegistryState& state, const char* function, Error* error);
+[[nodiscard]] bool recoverJournalLocked(RegistryState& state, const char* function, Error* error);
 
 }  // namespace platform::registry

@@ -100,13 +100,13 @@ class SQLiteApplicationRegistry final : public ApplicationRegistry, public Insta
 
   bool isInstalled(const std::string& identifier) override;
   std::optional<BundleRecord> recordForIdentifier(const std::string& identifier) override;
-  bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
+  [[nodiscard]] bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
                       Error* error) override;
-  bool installBundle(const URL& bundle, const Dictionary& options, Error* error) override;
+  [[nodiscard]] bool installBundle(const URL& bundle, const Dictionary& options, Error* error) override;
 
   bool QuillsetRegisterSafeHarborForContainerType(const std::string& path, const std::string& identifier,
                                                   int containerType, const Value* options) override;
-  bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const Dictionary& options) override;
+  [[nodiscard]] bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const Dictionary& options) override;
 
   // Inspection (tools and tests): every record, built-in applications
   // included, ordered by identifier; every registered safe harbor, ordered by

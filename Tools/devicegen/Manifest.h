@@ -84,7 +84,7 @@ platform::Value manifestToValue(const Manifest& manifest);
 // None with *why when the value is not a manifest this version understands.
 std::optional<Manifest> manifestFromValue(const platform::Value& value, std::string* why);
 
-bool writeManifest(const Manifest& manifest, const std::string& path, std::string* why);
+[[nodiscard]] bool writeManifest(const Manifest& manifest, const std::string& path, std::string* why);
 std::optional<Manifest> readManifest(const std::string& path, std::string* why);
 
 }  // namespace devicegen
