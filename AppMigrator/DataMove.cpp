@@ -34,6 +34,7 @@ bool isBookkeepingItem(const std::string& name) {
 
 bool QSAppMigrator::_migrateDataContainerForIdentifier(const std::string& identifier, const URL& fromURL,
                                                        const URL& toURL) {
+  if (!_dataFitsInContainer(identifier, fromURL, toURL)) return false;
   const QSFileManager& fileManager = QSFileManager::defaultManager();
   for (const std::string& name : QSGlobalConfiguration::sharedInstance().appUserDataItemNames()) {
     const URL source = fromURL.appending(name, true);

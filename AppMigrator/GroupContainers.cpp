@@ -60,6 +60,7 @@ bool QSAppMigrator::_migrateGroupContainersForIdentifier(const std::string& iden
     QSAM_LOG(kQSLogLevelNotice, kMigrateFunction, "QSAppMigrator: No group containers to migrate for %@", identifier);
     return true;
   }
+  if (!_groupContainersFitForIdentifier(identifier, *record->groupContainerURLs)) return false;
   // The record's dictionary is walked while the map loses entries.
   for (const auto& [group, newContainer] : *record->groupContainerURLs) {
     _migrateGroupContainer(identifier, group, newContainer);

@@ -40,7 +40,15 @@ constexpr char kReturningFailedLine[] =
 // --- Creation -------------------------------------------------------------------
 
 std::unique_ptr<QSAppMigrator> QSAppMigrator::create(const QSMigratorServices& services) {
-  std::unique_ptr<QSAppMigrator> migrator(new QSAppMigrator(services));
+  return _create(services, false);
+}
+
+std::unique_ptr<QSAppMigrator> QSAppMigrator::createForPlanning(const QSMigratorServices& services) {
+  return _create(services, true);
+}
+
+std::unique_ptr<QSAppMigrator> QSAppMigrator::_create(const QSMigratorServices& services, bool planning) {
+  std::unique_ptr<QSAppMigrator> migrator(new QSAppMigrator(services, planning));
   if (!migrator->_loadItemsToMigrate()) return nullptr;
   migrator->_loadHarborMap();
   migrator->_loadLastSystemVersion();
@@ -60,6 +68,7 @@ bool QSAppMigrator::_loadItemsToMigrate() {
     return false;
   }
   if (items->empty()) {
+    if (planning_) return true;
     // Nothing to migrate: the empty directory goes now; the install map is
     // left for a run that finds something.
     if (!fileManager.removeItemAtURL(oldContainer)) {
@@ -100,7 +109,10 @@ void QSAppMigrator::_loadHarborMap() {
 }
 
 void QSAppMigrator::_loadLastSystemVersion() {
-  const URL recordURL = QSGlobalConfiguration::sharedInstance().dataDirectory().appending(kQSLastSystemVersionFileName);
+  QSGlobalConfiguration& configuration = QSGlobalConfiguration::sharedInstance();
+  // A dry run makes no directory, so it reads where the directory would be.
+  const URL recordURL = (planning_ ? configuration.dataDirectoryPath() : configuration.dataDirectory())
+                            .appending(kQSLastSystemVersionFileName);
   std::optional<Dictionary> record = platform::plist::readDictionary(recordURL);
   if (!record) return;
   // Kept for diagnosis only, whatever its type: nothing branches on it.
@@ -110,7 +122,9 @@ void QSAppMigrator::_loadLastSystemVersion() {
 }
 
 URL QSAppMigrator::_safeHarborMapURL() const {
-  return QSGlobalConfiguration::sharedInstance().dataDirectory().appending(kQSSafeHarborMapFileName);
+  QSGlobalConfiguration& configuration = QSGlobalConfiguration::sharedInstance();
+  return (planning_ ? configuration.dataDirectoryPath() : configuration.dataDirectory())
+      .appending(kQSSafeHarborMapFileName);
 }
 
 // --- The host's queries ---------------------------------------------------------
@@ -172,11 +186,14 @@ std::deque<Dictionary> QSAppMigrator::_introspectItemsToMigrate() {
     QSAM_LOG(kQSLogLevelNotice, kPerformMigrationFunction, "QSAppMigrator: Introspecting %@", entry.path());
     if (entry.lastPathComponent() == kQSOldApplicationsNoteFileName) {
       // Not a container; whether it goes is decided by the final re-listing.
+      if (services_.observer) services_.observer->entryStarted("", entry.path());
       (void)fileManager.removeItemAtURL(entry);
+      _reportEntry(platform::EntryOutcome::Removed, "the previous release's note file");
       ++_countItemsMigrated;
       continue;
     }
     bool orderResultEarly = false;
+    if (services_.observer) services_.observer->entryStarted("", entry.path());
     std::optional<Dictionary> info = _introspectContainer(entry, &orderResultEarly);
     if (!info) {
       ++_countItemsMigrated;
@@ -186,6 +203,21 @@ std::deque<Dictionary> QSAppMigrator::_introspectItemsToMigrate() {
       workList.push_back(std::move(*info));
     }
   }
+  if (services_.observer) {
+    uint64_t bytes = 0;
+    for (const Dictionary& info : workList) {
+      if (const std::string* container = QSStringForKey(info, kQSContainerPathKey)) {
+        bytes += _measureUserData(URL::fileURL(*container, true)).bytes;
+      }
+    }
+    if (_groupContainerMap) {
+      for (const auto& [group, entry] : *_groupContainerMap) {
+        const Value* path = entry.get(kQSGroupContainerPathKey);
+        if (path && path->isString()) bytes += _measureItem(URL::fileURL(*path->asString(), true)).bytes;
+      }
+    }
+    services_.observer->migrationPlanned(workList.size(), bytes);
+  }
   return workList;
 }
 
@@ -194,11 +226,24 @@ bool QSAppMigrator::_migrateWorkList(const std::deque<Dictionary>& workList) {
   for (const Dictionary& info : workList) {
     const Value* identifier = QSValueForKey(info, kQSBundleIdentifierKey);
     const Value* bundlePath = QSValueForKey(info, kQSBundlePathKey);
+    const std::string* container = QSStringForKey(info, kQSContainerPathKey);
+    if (services_.observer) {
+      services_.observer->entryStarted(identifier ? identifier->description() : "", container ? *container : "");
+    }
     QSAM_LOG(kQSLogLevelNotice, kPerformMigrationFunction, "QSAppMigrator: Migrating %@ at %@", identifier, bundlePath);
-    if (!_migrateContainerWithInfo(info)) {
+    const bool migrated = _migrateContainerWithInfo(info);
+    if (!migrated) {
       QSAM_LOG(kQSLogLevelError, kPerformMigrationFunction, "QSAppMigrator: Migration of %@ at %@ failed", identifier,
                bundlePath);
       result = false;
+    }
+    if (services_.observer) {
+      // A failed container that is still there is kept for the next run; one
+      // that is gone failed after its data had moved.
+      const bool kept = container && QSFileManager::defaultManager().itemExistsAtURL(URL::fileURL(*container, true));
+      _reportEntry(migrated ? platform::EntryOutcome::Migrated
+                            : kept ? platform::EntryOutcome::Kept : platform::EntryOutcome::Failed,
+                   "");
     }
     ++_countItemsMigrated;
   }

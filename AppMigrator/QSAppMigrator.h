@@ -15,6 +15,7 @@
 #include <atomic>
 #include <cstdint>
 #include <deque>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -25,6 +26,7 @@
 #include "Platform/Foundation/URL.h"
 #include "Platform/Foundation/Value.h"
 #include "Platform/Host/DataClassMigrator.h"
+#include "Platform/Host/MigrationPlan.h"
 #include "Platform/Imaging.h"
 #include "Platform/Registry/ApplicationRegistry.h"
 #include "Platform/Registry/InstallationDaemon.h"
@@ -42,6 +44,44 @@ struct QSMigratorServices {
   platform::SystemVersionSource* systemVersion = nullptr;
   // The process's temporary directory ($TMPDIR, else "/tmp").
   platform::URL temporaryDirectory;
+  // Dry runs only: the registry's answers about what it has not made yet.
+  platform::RegistryForecast* forecast = nullptr;
+  // Told about each entry as the run goes; may be null.
+  platform::MigrationObserver* observer = nullptr;
+};
+
+// What introspection found in one entry of the old applications directory,
+// before anything is done about it. Working it out changes nothing.
+struct QSEntrySurvey {
+  enum class Finding {
+    Container,   // to be migrated: `info` describes it
+    StrayFile,   // a file where a container should be: removed
+    NoBundle,    // a container without an identifiable bundle: removed with its items
+    Vanished,    // gone since the run listed it
+    Unreadable,  // cannot be looked into: stays
+    Unsafe,      // a bundle or marker is a symbolic link: stays untouched
+  };
+  Finding finding = Finding::Unreadable;
+  std::optional<platform::Dictionary> info;
+  bool orderEarly = false;  // an application container: migrated before the VPN-only ones
+  bool fromMarker = false;  // described by the marker of an earlier attempt
+  std::string reason;       // Unreadable, Unsafe: why it stays
+};
+
+// A container information dictionary with its paths as URLs.
+struct QSContainerInfo {
+  platform::URL container;
+  platform::URL bundle;
+  std::optional<platform::URL> secondBundle;
+  std::string identifier;
+  std::string type;
+};
+
+// What the per-container sequence will do, decided before anything changes.
+struct QSContainerSteps {
+  bool bundleIsPlaceholder = false;  // the old bundle carries the placeholder mark: data only
+  bool needsPlaceholder = false;     // an application not installed yet: a placeholder first
+  bool installsBundle() const { return !bundleIsPlaceholder; }
 };
 
 class QSAppMigrator final : public platform::DataClassMigrator {
@@ -49,6 +89,13 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   // The initialiser: loads the run's state. Null when the old applications
   // directory exists but cannot be listed.
   static std::unique_ptr<QSAppMigrator> create(const QSMigratorServices& services);
+  // A migrator for dry runs: creating it and planning change nothing on disk
+  // (the registry in `services` must be a read-only one with a forecast).
+  static std::unique_ptr<QSAppMigrator> createForPlanning(const QSMigratorServices& services);
+
+  // The dry run: what performMigration would do, worked out with the same
+  // decisions and without any change.
+  platform::MigrationPlan planMigration();
 
   std::string dataClassName() override;
   float estimatedDuration() override;
@@ -59,9 +106,15 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   std::optional<platform::Dictionary> _introspectContainer(const platform::URL& entry, bool* orderResultEarly);
   std::optional<platform::Dictionary> _loadAndValidateMigrationMarkerAtURL(const platform::URL& marker);
   std::optional<std::string> _bundleIdentifierForBundle(const platform::URL& bundle);
+  // Introspection's findings without its removals.
+  QSEntrySurvey _surveyEntry(const platform::URL& entry);
 
   // --- Per-container migration ----------------------------------------------
   bool _migrateContainerWithInfo(const platform::Dictionary& info);
+  // Its steps. _readContainerInfo logs and yields none when a required entry
+  // is not a string; _decideContainerSteps only asks.
+  static std::optional<QSContainerInfo> _readContainerInfo(const platform::Dictionary& info);
+  QSContainerSteps _decideContainerSteps(const QSContainerInfo& in);
 
   // --- Safe harbors ------------------------------------------------------------
   bool _migrateSafeHarbors();
@@ -70,6 +123,17 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   bool _migrateDataContainerForIdentifier(const std::string& identifier, const platform::URL& fromURL,
                                           const platform::URL& toURL);
   bool _containerHasMissedItems(const platform::URL& container, const std::string& withIdentifier);
+
+  // --- Room on the destination ---------------------------------------------------
+  // Before items move to another file system: true when the destination has
+  // room for them plus kQSSpaceMargin; otherwise one level-3 line with the
+  // bytes needed and free, and false (nothing is moved). Items on the
+  // destination's own file system need no room and pass.
+  bool _destinationHasRoomForItems(const std::vector<platform::URL>& items, const platform::URL& destination,
+                                   const std::string& identifier);
+  bool _dataFitsInContainer(const std::string& identifier, const platform::URL& fromURL, const platform::URL& toURL);
+  bool _groupContainersFitForIdentifier(const std::string& identifier,
+                                        const std::map<std::string, platform::URL>& newContainers);
 
   // --- Staging and installation ------------------------------------------------
   bool _stageAndInstallBundleAtURL(const platform::URL& bundle, const std::string& withIdentifier,
@@ -93,7 +157,30 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   const std::optional<std::string>& lastSystemBuildVersion() const { return _lastSystemBuildVersion; }
 
  private:
-  explicit QSAppMigrator(const QSMigratorServices& services) : services_(services) {}
+  QSAppMigrator(const QSMigratorServices& services, bool planning) : services_(services), planning_(planning) {}
+  static std::unique_ptr<QSAppMigrator> _create(const QSMigratorServices& services, bool planning);
+
+  // The per-container steps that act, in the order the run takes them.
+  void _writeContainerMarker(const platform::Dictionary& info, const QSContainerInfo& in);
+  bool _ensureRecordForContainer(const QSContainerInfo& in, const QSContainerSteps& steps);
+  std::optional<platform::URL> _dataContainerForIdentifier(const std::string& identifier);
+  enum class InstallOutcome { Installed, FailedAfterDataMoved, KeepContainer };
+  InstallOutcome _installBundleAndGroups(const QSContainerInfo& in);
+  void _removeOldContainer(const QSContainerInfo& in);
+
+  // Introspection's removals and the observer's view of the entries.
+  std::optional<platform::Dictionary> _actOnSurvey(const platform::URL& entry, QSEntrySurvey survey,
+                                                   bool* orderResultEarly);
+  void _reportEntry(platform::EntryOutcome outcome, const std::string& reason);
+  platform::PlanSize _measureUserData(const platform::URL& container);
+  static platform::PlanSize _measureItem(const platform::URL& item);
+  // The old group containers that `identifier`'s record names and the map
+  // still holds, with their sizes.
+  std::map<std::string, platform::PlanSize> _measureGroupsForIdentifier(const std::string& identifier);
+
+  // Dry-run pieces (Plan.cpp).
+  platform::PlannedContainer _planContainer(const platform::Dictionary& info, bool fromMarker,
+                                            struct QSPlanState& state);
 
   // Initialisation steps. _loadItemsToMigrate is false when the old
   // applications directory exists but cannot be listed.
@@ -114,6 +201,7 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   platform::URL _safeHarborMapURL() const;
 
   QSMigratorServices services_;
+  const bool planning_ = false;
 
   // Placeholder installation once the staged directory's URL is known; the
   // caller removes the staged directory afterwards.
@@ -163,5 +251,11 @@ inline const std::string* QSStringForKey(const platform::Dictionary& dictionary,
 inline constexpr uint64_t kQSMigratorInstallType = 6;
 inline constexpr char kQSInstallOptionSkipBlacklist[] = "SkipBlacklist";
 inline constexpr char kQSInstallOptionVerifyForMigrator[] = "VerifyForMigrator";
+// Room kept free on a destination file system beyond what a move across file
+// systems needs: a fixed part plus a share of the items' size.
+inline constexpr uint64_t kQSSpaceMarginBytes = 1u << 20;
+inline constexpr uint64_t kQSSpaceMarginDivisor = 50;  // 2 %
+// The room a move across file systems of `bytes` asks for, margin included.
+uint64_t QSNeededRoomWithMargin(uint64_t bytes);
 // Mode of the directories the migrator creates.
 inline constexpr unsigned kQSNewDirectoryMode = 0755;

@@ -7,10 +7,13 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <vector>
 
-#include "Platform/Foundation/Text.h"
+#include "Platform/Foundation/Json.h"
 
 namespace transvale {
+
+using platform::jsonQuoted;
 
 namespace {
 
@@ -19,57 +22,12 @@ constexpr char kHostSinkName[] = "host";
 constexpr char kSystemSinkName[] = "system";
 constexpr mode_t kLogDirectoryMode = 0755;
 
-void appendHexEscape(std::string& out, const char* prefix, unsigned char byte) {
-  static constexpr char kHex[] = "0123456789abcdef";
-  out += prefix;
-  out += kHex[byte >> 4];
-  out += kHex[byte & 0xF];
-}
-
 std::string baseName(const std::string& path) {
   const size_t slash = path.rfind('/');
   return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
 }  // namespace
-
-std::string jsonQuoted(std::string_view bytes) {
-  std::string out;
-  out.reserve(bytes.size() + 2);
-  out += '"';
-  for (size_t i = 0; i < bytes.size();) {
-    const unsigned char c = static_cast<unsigned char>(bytes[i]);
-    if (c < 0x80) {
-      switch (c) {
-        case '"': out += "\\\""; break;
-        case '\\': out += "\\\\"; break;
-        case '\n': out += "\\n"; break;
-        case '\r': out += "\\r"; break;
-        case '\t': out += "\\t"; break;
-        case '\b': out += "\\b"; break;
-        case '\f': out += "\\f"; break;
-        default:
-          if (c < 0x20 || c == 0x7F) {
-            appendHexEscape(out, "\\u00", c);
-          } else {
-            out += static_cast<char>(c);
-          }
-      }
-      ++i;
-      continue;
-    }
-    const size_t length = platform::utf8SequenceLength(bytes, i);
-    if (length == 0) {
-      appendHexEscape(out, "\\udc", c);
-      ++i;
-      continue;
-    }
-    out.append(bytes.substr(i, length));
-    i += length;
-  }
-  out += '"';
-  return out;
-}
 
 std::string timestampNow() {
   using namespace std::chrono;
@@ -107,13 +65,21 @@ std::unique_ptr<LogFile> LogFile::open(const std::string& path, LogFormat format
 
   const std::filesystem::path parent = std::filesystem::path(path).parent_path();
   if (!parent.empty()) {
+    // Only the directories made here get the log directories' mode; one that
+    // was there already (say /tmp) keeps its own.
     std::error_code ec;
+    std::vector<std::filesystem::path> made;
+    for (std::filesystem::path at = parent; !at.empty() && !std::filesystem::exists(std::filesystem::symlink_status(at, ec));
+         at = at.parent_path()) {
+      made.push_back(at);
+      if (at == at.parent_path()) break;
+    }
     std::filesystem::create_directories(parent, ec);
     if (ec) {
       *error = "cannot create the log directory " + parent.string() + ": " + ec.message();
       return nullptr;
     }
-    ::chmod(parent.c_str(), kLogDirectoryMode);
+    for (const std::filesystem::path& directory : made) ::chmod(directory.c_str(), kLogDirectoryMode);
   }
   std::FILE* stream = std::fopen(path.c_str(), "ae");
   if (!stream) {
@@ -121,6 +87,10 @@ std::unique_ptr<LogFile> LogFile::open(const std::string& path, LogFormat format
     return nullptr;
   }
   return std::unique_ptr<LogFile>(new LogFile(stream, true, format));
+}
+
+std::unique_ptr<LogFile> LogFile::discarding(LogFormat format) {
+  return std::unique_ptr<LogFile>(new LogFile(nullptr, false, format));
 }
 
 LogFile::~LogFile() {
@@ -134,8 +104,11 @@ LogFile::~LogFile() {
 void LogFile::write(const LogRecord& record) {
   const std::string line = formatRecord(record, format_, timestampNow()) + "\n";
   std::lock_guard<std::mutex> lock(mutex_);
-  std::fwrite(line.data(), 1, line.size(), stream_);
-  std::fflush(stream_);
+  if (stream_) {
+    std::fwrite(line.data(), 1, line.size(), stream_);
+    std::fflush(stream_);
+  }
+  if (listener_) listener_(record);
 }
 
 void LogFile::installSinks() {

@@ -7,6 +7,7 @@
 #pragma once
 
 #include <cstdio>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -37,11 +38,17 @@ class LogFile {
   // Opens `path` for appending, making missing parent directories; "-" means
   // standard error. Null with a message in *error when it cannot be opened.
   static std::unique_ptr<LogFile> open(const std::string& path, LogFormat format, std::string* error);
+  // A log that keeps no line (a dry run writes nothing); lines still reach
+  // the listener.
+  static std::unique_ptr<LogFile> discarding(LogFormat format);
   ~LogFile();
   LogFile(const LogFile&) = delete;
   LogFile& operator=(const LogFile&) = delete;
 
   void write(const LogRecord& record);
+  // Also hands every record to `listener` (on the writing thread), until
+  // replaced. Set it before the sinks are installed.
+  void setListener(std::function<void(const LogRecord&)> listener) { listener_ = std::move(listener); }
   // Routes both sinks of the process here until the object is destroyed, when
   // the previous sinks are put back.
   void installSinks();
@@ -50,19 +57,14 @@ class LogFile {
   LogFile(std::FILE* stream, bool owned, LogFormat format) : stream_(stream), owned_(owned), format_(format) {}
 
   std::mutex mutex_;  // guards stream_ and serialises lines
-  std::FILE* stream_;
+  std::FILE* stream_;  // null: lines are not kept
   const bool owned_;
   const LogFormat format_;
   bool sinksInstalled_ = false;
+  std::function<void(const LogRecord&)> listener_;
   platform::HostLogSink previousHostSink_;
   platform::SystemLogSink previousSystemSink_;
 };
-
-// A JSON string literal (quotes included) for any bytes: valid UTF-8 passes
-// through, control characters are escaped, and each byte that is not part of
-// valid UTF-8 becomes the lone surrogate escape \udcXX, so that the original
-// bytes can be recovered (Python's "surrogateescape" convention).
-std::string jsonQuoted(std::string_view bytes);
 
 // The current time as "YYYY-MM-DDTHH:MM:SS.mmmZ".
 std::string timestampNow();

@@ -23,6 +23,9 @@ struct Options {
   LogFormat logFormat = LogFormat::Text;
   std::optional<int> systemLogLevel;
   ProgressMode progress = ProgressMode::Auto;
+  bool plan = false;                  // --plan: a dry run
+  bool json = false;                  // --json: the plan as one JSON document
+  std::optional<std::string> report;  // --report FILE
 };
 
 // Parses argv. On --help or --version prints what was asked and sets *exitCode

@@ -5,6 +5,7 @@
 #include <string>
 
 #include "Platform/Host/DataClassMigrator.h"
+#include "Platform/Host/MigrationPlan.h"
 
 namespace transvale {
 
@@ -13,13 +14,18 @@ namespace transvale {
 struct LoadedPlugin {
   std::string path;
   QSCreateDataClassMigratorFunction create = nullptr;
+  // The dry run and the observer setter; null when the plug-in has none.
+  QSPlanDataClassMigrationFunction plan = nullptr;
+  QSSetMigrationObserverFunction setObserver = nullptr;
 };
 
 // Loads the plug-in at `path` and resolves its entry point; none with a
 // message in *error when either fails.
 std::optional<LoadedPlugin> loadPlugin(const std::string& path, std::string* error);
 
-// The plug-in built beside this program: <dir of the executable>/../lib/QSAppMigrator.so.
+// The plug-in beside this program: <dir of the executable>/../lib/QSAppMigrator.so
+// in a build tree, else the installed <dir>/../<libdir>/quillset/QSAppMigrator.so
+// when it exists.
 std::string defaultPluginPath();
 
 }  // namespace transvale

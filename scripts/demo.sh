@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
 # The demonstration: builds everything, makes a device image of 200
-# applications in the old layout, migrates it with transvale while showing
-# progress, verifies every file against the image's manifest and prints a
-# summary. Exits non-zero when any step fails.
+# applications in the old layout, shows transvale's plan for it (which changes
+# nothing), migrates it while showing progress, shows the outcome report,
+# verifies every file against the image's manifest and prints a summary.
+# Exits non-zero when any step fails.
 #
 #   scripts/demo.sh                 image under a fresh temporary directory
 #   QS_DEMO_ROOT=DIR scripts/demo.sh   image in DIR (must not hold one yet)
@@ -45,11 +46,20 @@ step "Device image: $apps applications"
 "$bin/devicegen" create --root "$image" --apps "$apps" --vpn-only "$vpn" --groups "$groups" \
   --harbors "$harbors" --placeholders "$placeholders" --builtin-older "$older" --seed 2026
 
+step "Plan (a dry run: nothing on disk changes)"
+plan="$root/plan.txt"
+"$bin/transvale" --root "$image" --plan > "$plan"
+head -n 20 "$plan"
+echo "  ... ($(wc -l < "$plan") lines in $plan)"
+sed -n '/^Discarded for good/,$p' "$plan"
+"$bin/transvale" --root "$image" --plan --json > "$root/plan.json"
+
 step "Migration"
 log="$root/transvale.log"
+report="$root/report.json"
 start=$(date +%s.%N)
 set +e
-"$bin/transvale" --root "$image" --log "$log" --progress always
+"$bin/transvale" --root "$image" --log "$log" --progress always --report "$report"
 status=$?
 set -e
 end=$(date +%s.%N)
@@ -58,6 +68,18 @@ if [ "$status" -ne 0 ]; then
   printf 'demo: transvale exited with %d; the last lines of %s:\n' "$status" "$log" >&2
   tail -n 20 "$log" >&2
   exit 1
+fi
+
+step "Outcome report ($report)"
+sed -n '1,/"entries": \[/p' "$report" | head -n 20
+if command -v python3 >/dev/null; then
+  python3 - "$report" <<'PY'
+import json, sys
+report = json.load(open(sys.argv[1]))
+for entry in report["entries"]:
+    if entry["outcome"] != "migrated":
+        print(f'  {entry["outcome"]:8} {entry["identifier"] or entry["path"]}: {entry["reason"]}')
+PY
 fi
 
 step "Verification"

@@ -2,7 +2,7 @@
 # Installs the Debian packages the build needs, and nothing when all are there.
 set -euo pipefail
 packages=(cmake ninja-build g++ pkg-config libplist-dev libexpat1-dev libpng-dev libcairo2-dev libssl-dev libsqlite3-dev
-          libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev)
+          libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev xfsprogs help2man)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q 'install ok installed' || missing+=("$p")

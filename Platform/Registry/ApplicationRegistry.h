@@ -62,6 +62,9 @@ struct BundleRecord {
   bool isPlaceholder = false;
   std::string version;
   std::string displayName;
+  // Read-only views (RegistryReader): the data container is made on the
+  // record's first real lookup and does not exist yet.
+  bool dataContainerToBeMade = false;
 };
 
 // Called with one progress report (a dictionary) at a time.
@@ -81,6 +84,23 @@ class ApplicationRegistry {
                               Error* error) = 0;
   // Installs a placeholder bundle directory; no progress reports.
   [[nodiscard]] virtual bool installBundle(const URL& bundle, const Dictionary& options, Error* error) = 0;
+};
+
+// What a dry run asks of a registry beyond lookups: where the containers it
+// has not made yet will be made, and whether it would refuse a bundle.
+class RegistryForecast {
+ public:
+  virtual ~RegistryForecast() = default;
+  // The directory in which a new data container of an application (or of a
+  // VPN plug-in) is made.
+  virtual URL newDataContainerDirectory(bool vpnPlugin) = 0;
+  // The directory in which a new group container is made.
+  virtual URL newGroupContainerDirectory() = 0;
+  // The container recorded for `group`, or none when it is not made yet.
+  virtual std::optional<URL> groupContainerForGroup(const std::string& group) = 0;
+  // True when installing `version` of `identifier` would be refused because
+  // a built-in copy has an equal or newer version.
+  virtual bool refusesAsNotNewerThanBuiltIn(const std::string& identifier, const std::string& version) = 0;
 };
 
 }  // namespace platform

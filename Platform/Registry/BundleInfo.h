@@ -33,4 +33,10 @@ std::optional<BundleInfo> readBundleInfo(const std::string& bundlePath, Error* e
 // ("1.10" > "1.9", "2" == "2.0"). Negative, zero or positive like strcmp.
 int compareBundleVersions(std::string_view a, std::string_view b);
 
+// True when a built-in copy at `builtInVersion` keeps a bundle at `version`
+// from being installed (the built-in copy is equal or newer).
+inline bool builtInSupersedes(std::string_view builtInVersion, std::string_view version) {
+  return compareBundleVersions(builtInVersion, version) >= 0;
+}
+
 }  // namespace platform::registry

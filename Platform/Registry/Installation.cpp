@@ -434,7 +434,7 @@ bool requireIdentifier(const BundleInfo& info, const std::optional<std::string>&
 // Refuses a bundle that is not newer than the built-in copy of its identifier.
 bool requireNewerThanBuiltIn(RegistryState& state, const BundleInfo& info, Error* error) {
   std::optional<BuiltInApplication> builtIn = state.builtIns.find(info.identifier);
-  if (!builtIn || compareBundleVersions(builtIn->info.version, info.version) < 0) return true;
+  if (!builtIn || !builtInSupersedes(builtIn->info.version, info.version)) return true;
   return failWith(error, kRegistryErrorAlreadyInstalled,
                   Format("%s version %s is not newer than the built-in application at %s (version %s)", info.identifier,
                          info.version, builtIn->bundlePath, builtIn->info.version));

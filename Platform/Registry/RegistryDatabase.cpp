@@ -1,5 +1,12 @@
 #include "Platform/Registry/RegistryDatabase.h"
 
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+
 #include "Platform/Foundation/Format.h"
 #include "Platform/Registry/SQLiteRegistry.h"
 
@@ -55,6 +62,34 @@ constexpr char kSchema[] =
     "  kind TEXT NOT NULL,"
     "  source TEXT NOT NULL,"
     "  destination TEXT NOT NULL);";
+
+// Read-only opening: the suffix of the write-ahead log, and the URI
+// parameters of a database without one ("immutable" keeps SQLite from making
+// a log or index file).
+constexpr char kWriteAheadLogSuffix[] = "-wal";
+constexpr char kReadOnlyImmutable[] = "?mode=ro&immutable=1";
+// The private copy of a database with a log: <temporary directory>/<pattern>/<name>.
+constexpr char kTemporaryDirectoryVariable[] = "TMPDIR";
+constexpr char kDefaultTemporaryDirectory[] = "/tmp";
+constexpr char kPrivateCopyPattern[] = "/registry-read.XXXXXX";
+constexpr char kPrivateCopyName[] = "/registry.sqlite";
+
+// A path as the path part of a file: URI ('?', '#' and '%' would end or
+// change it).
+std::string uriEscaped(const std::string& path) {
+  static constexpr char kHex[] = "0123456789ABCDEF";
+  std::string out;
+  for (const char c : path) {
+    if (c == '?' || c == '#' || c == '%') {
+      out += '%';
+      out += kHex[static_cast<unsigned char>(c) >> 4];
+      out += kHex[static_cast<unsigned char>(c) & 0xF];
+    } else {
+      out += c;
+    }
+  }
+  return out;
+}
 
 Error sqliteFailure(const std::string& path, const std::string& what, int resultCode, const char* message) {
   Dictionary info{
@@ -121,8 +156,63 @@ bool Database::createSchema(Error* error) {
   return transaction->commit(error);
 }
 
+std::unique_ptr<Database> Database::openReadOnly(const std::string& path, Error* error) {
+  struct stat status;
+  const bool hasLog = ::stat((path + kWriteAheadLogSuffix).c_str(), &status) == 0;
+  std::string privateCopy, opened = path;
+  if (hasLog) {
+    const char* temporary = std::getenv(kTemporaryDirectoryVariable);
+    std::string pattern = std::string(temporary && *temporary ? temporary : kDefaultTemporaryDirectory) +
+                          kPrivateCopyPattern;
+    if (!::mkdtemp(pattern.data())) {
+      if (error) *error = sqliteFailure(path, "make a private copy in " + pattern, SQLITE_CANTOPEN, std::strerror(errno));
+      return nullptr;
+    }
+    privateCopy = pattern;
+    opened = privateCopy + kPrivateCopyName;
+    std::error_code ec;
+    for (const char* suffix : {"", kWriteAheadLogSuffix}) {
+      std::filesystem::copy_file(path + suffix, opened + suffix, ec);
+      if (ec) break;
+    }
+    if (ec) {
+      if (error) *error = sqliteFailure(path, "copy to " + privateCopy, SQLITE_CANTOPEN, ec.message().c_str());
+      std::filesystem::remove_all(privateCopy, ec);
+      return nullptr;
+    }
+  }
+  // The private copy is ours to open for writing (SQLite builds the log's
+  // index beside it); the original is only ever read.
+  const std::string uri = "file:" + uriEscaped(opened) + (hasLog ? "" : kReadOnlyImmutable);
+  const int flags = (hasLog ? SQLITE_OPEN_READWRITE : SQLITE_OPEN_READONLY) | SQLITE_OPEN_URI | SQLITE_OPEN_FULLMUTEX;
+  sqlite3* handle = nullptr;
+  int rc = sqlite3_open_v2(uri.c_str(), &handle, flags, nullptr);
+  std::unique_ptr<Database> db;
+  if (rc == SQLITE_OK) {
+    db.reset(new Database(handle, path));
+    db->privateCopy_ = privateCopy;
+  } else {
+    if (error) *error = sqliteFailure(path, "open for reading", rc, handle ? sqlite3_errmsg(handle) : sqlite3_errstr(rc));
+    sqlite3_close(handle);
+    std::error_code ec;
+    if (!privateCopy.empty()) std::filesystem::remove_all(privateCopy, ec);
+    return nullptr;
+  }
+  sqlite3_extended_result_codes(handle, 1);
+  sqlite3_busy_timeout(handle, kBusyTimeoutMilliseconds);
+  // Reading a table proves the file is a database of ours.
+  auto check = db->prepare("SELECT count(*) FROM records;", error);
+  bool failed = false;
+  if (!check || (!check->step(&failed, error) && failed)) return nullptr;
+  return db;
+}
+
 Database::~Database() {
   sqlite3_close_v2(handle_);
+  if (!privateCopy_.empty()) {
+    std::error_code ec;
+    std::filesystem::remove_all(privateCopy_, ec);  // a copy left behind is only litter in the temporary directory
+  }
 }
 
 bool Database::execute(const char* sql, Error* error) {

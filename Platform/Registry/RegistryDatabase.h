@@ -30,6 +30,15 @@ class Database {
   // failure; a database of a newer schema version fails with
   // kRegistryErrorNewerDatabase and is not changed.
   static std::unique_ptr<Database> open(const std::string& path, Error* error);
+  // Opens an existing database for reading only, changing nothing on disk
+  // (not even the change time of a file: SQLite gives the files it opens to
+  // the database's owner when it runs as root). Without a write-ahead log the
+  // file is opened as immutable, so that no log or index file is made; with
+  // one, the database and its log are read from a private copy in the
+  // process's temporary directory, removed when the database is closed (a
+  // writer working at that moment may leave the copy unreadable: the open
+  // then fails). Null on failure, also when there is no database at `path`.
+  static std::unique_ptr<Database> openReadOnly(const std::string& path, Error* error);
   ~Database();
   Database(const Database&) = delete;
   Database& operator=(const Database&) = delete;
@@ -47,6 +56,7 @@ class Database {
   friend class Statement;
   sqlite3* handle_;
   std::string path_;
+  std::string privateCopy_;  // directory of the private copy, "" when there is none
 };
 
 // A prepared statement; parameters are bound by position (1-based).

@@ -7,6 +7,7 @@
 #include "Platform/Foundation/Format.h"
 #include "Platform/Registry/Installation.h"
 #include "Platform/Registry/RegistryFiles.h"
+#include "Platform/Registry/RegistryReader.h"
 #include "Platform/Registry/RegistryState.h"
 #include "Platform/Registry/RegistryTables.h"
 #include "Platform/SystemLog.h"
@@ -26,24 +27,6 @@ constexpr int kFailureLevel = 3;
 
 URL directoryURL(const std::string& path) {
   return URL::fileURL(path, true);
-}
-
-BundleRecord toBundleRecord(const StoredRecord& stored) {
-  BundleRecord record;
-  record.identifier = stored.identifier;
-  record.bundleType = stored.bundleType;
-  record.bundleURL = directoryURL(stored.bundlePath);
-  record.bundleContainerURL = directoryURL(stored.bundleContainer);
-  if (stored.dataContainer) record.dataContainerURL = directoryURL(*stored.dataContainer);
-  if (stored.hasGroupDictionary) {
-    record.groupContainerURLs.emplace();
-    for (const auto& [group, path] : stored.groups) (*record.groupContainerURLs)[group] = directoryURL(path);
-  }
-  record.foundBackingBundle = isDirectory(stored.bundlePath);
-  record.isPlaceholder = stored.isPlaceholder;
-  record.version = stored.version;
-  record.displayName = stored.displayName;
-  return record;
 }
 
 // The container recorded for `key` by `load`, made (and recorded through
@@ -187,7 +170,7 @@ std::optional<BundleRecord> SQLiteApplicationRegistry::recordForIdentifier(const
       return std::nullopt;
     }
   }
-  if (stored) return toBundleRecord(*stored);
+  if (stored) return bundleRecordFromStored(*stored);
   std::optional<BuiltInApplication> builtIn = impl_->builtIns.find(identifier);
   if (!builtIn) return std::nullopt;
   std::optional<BundleRecord> record = systemRecord(*impl_, *builtIn, &error);
@@ -262,7 +245,7 @@ std::vector<BundleRecord> SQLiteApplicationRegistry::allRecords() {
     if (!loadAllRecords(*impl_->db, &stored, &error)) logFailure(kLookupFunction, "Could not list", "records", error);
   }
   std::vector<BundleRecord> records;
-  for (const StoredRecord& record : stored) records.push_back(toBundleRecord(record));
+  for (const StoredRecord& record : stored) records.push_back(bundleRecordFromStored(record));
   for (const BuiltInApplication& application : impl_->builtIns.all()) {
     bool shadowed = std::any_of(stored.begin(), stored.end(),
                                 [&](const StoredRecord& r) { return r.identifier == application.info.identifier; });

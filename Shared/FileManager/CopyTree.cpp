@@ -1,13 +1,19 @@
 #include "Shared/FileManager/CopyTree.h"
 
 #include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/sendfile.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <map>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "Shared/FileManager/PosixHandles.h"
@@ -26,7 +32,6 @@ constexpr int kCreateFileFlags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CL
 constexpr mode_t kPrivateFileMode = 0600;
 constexpr mode_t kPrivateDirectoryMode = 0700;
 constexpr mode_t kPermissionBits = 07777;
-constexpr size_t kCopyChunkSize = 1 << 20;
 constexpr size_t kReadWriteBufferSize = 128 * 1024;
 constexpr char kProcessDescriptorDirectory[] = "/proc/self/fd/";
 
@@ -93,37 +98,128 @@ int copyExtendedAttributes(const AttributeTarget& from, const AttributeTarget& t
 
 // ---- Data ---------------------------------------------------------------
 
-int copyDataByReadWrite(int in, int out) {
-  std::vector<char> buffer(kReadWriteBufferSize);
-  for (;;) {
-    ssize_t got = read(in, buffer.data(), buffer.size());
-    if (got < 0 && errno == EINTR) continue;
-    if (got < 0) return errno;
-    if (got == 0) return 0;
-    for (ssize_t written = 0; written < got;) {
-      ssize_t n = write(out, buffer.data() + written, static_cast<size_t>(got - written));
-      if (n < 0 && errno == EINTR) continue;
-      if (n < 0) return errno;
-      written += n;
-    }
-  }
+// How data can move between the file systems of two devices, learnt during
+// one copy: a way the file systems refuse as such (not for one file) is not
+// tried again for every further file.
+struct DataRoute {
+  dev_t from = 0;
+  dev_t to = 0;
+  bool cloneRefused = false;      // FICLONE
+  bool rangeCopyRefused = false;  // copy_file_range
+  bool sendRefused = false;       // sendfile
+};
+
+// Errors by which a file system refuses a clone or kernel copy between two
+// files, as opposed to failing at it.
+bool refusesForEveryFile(int errnum) {
+  return errnum == EOPNOTSUPP || errnum == ENOTTY || errnum == EXDEV || errnum == ENOSYS;
 }
 
-// Copies from the current offsets to the end. The kernel copy is tried first;
-// where it cannot work (another file system, no support) the copy goes on
-// from where it stopped with read and write.
-int copyData(int in, int out) {
-  for (;;) {
-    ssize_t n = copy_file_range(in, nullptr, out, nullptr, kCopyChunkSize, 0);
-    if (n > 0) continue;
-    if (n == 0) return 0;
-    if (errno == EINTR) continue;
-    if (errno == EXDEV || errno == ENOSYS || errno == EINVAL || errno == EOPNOTSUPP) {
-      return copyDataByReadWrite(in, out);
+// Copies the data of one open file to a new empty one, keeping its holes.
+class FileData {
+ public:
+  FileData(int in, int out, DataRoute& route, std::vector<char>& buffer)
+      : in_(in), out_(out), route_(route), buffer_(buffer) {}
+
+  // `status` is that of `in`. A file with fewer blocks than its size needs
+  // has holes: only its data extents are copied and the size set at the
+  // end, so a hole stays a hole (trailing ones included). Other files are
+  // copied to their end whatever their size was.
+  int copy(const struct stat& status) {
+    if (status.st_size > 0 && !route_.cloneRefused) {
+      if (ioctl(out_, FICLONE, in_) == 0) return 0;
+      if (refusesForEveryFile(errno)) {
+        route_.cloneRefused = true;
+      } else if (ftruncate(out_, 0) != 0) {  // whatever a failed clone may have left
+        return errno;
+      }
     }
-    return errno;
+    if (status.st_blocks * kStatBlockSize >= status.st_size) return copyRange(0, kToEndOfFile);
+    for (off_t offset = 0; offset < status.st_size;) {
+      off_t data = lseek(in_, offset, SEEK_DATA);
+      if (data < 0 && errno == ENXIO) break;  // nothing but a hole up to the end
+      if (data < 0) return errno;
+      if (data >= status.st_size) break;
+      off_t hole = lseek(in_, data, SEEK_HOLE);
+      if (hole < 0) return errno;
+      hole = std::min(hole, status.st_size);
+      if (int errnum = copyRange(data, hole); errnum != 0) return errnum;
+      offset = hole;
+    }
+    return ftruncate(out_, status.st_size) == 0 ? 0 : errno;
   }
-}
+
+ private:
+  static constexpr off_t kToEndOfFile = -1;
+  static constexpr off_t kStatBlockSize = 512;  // the unit of st_blocks
+  // Large enough that a big file takes few calls; the kernel copies it in
+  // pieces of its own and checks for signals between them.
+  static constexpr size_t kCopyChunkSize = 8 << 20;
+
+  // Copies bytes [offset, end) to the same offsets (end kToEndOfFile: up to
+  // the end of the file). Each way is tried in turn, from where the previous
+  // one stopped: the kernel copy (which can share blocks), sendfile (one
+  // copy in the kernel, across any two file systems), read and write.
+  int copyRange(off_t offset, off_t end) {
+    bool rangeCopy = !route_.rangeCopyRefused;
+    bool send = !route_.sendRefused;
+    while (end == kToEndOfFile || offset < end) {
+      const size_t size =
+          end == kToEndOfFile ? kCopyChunkSize : static_cast<size_t>(std::min<off_t>(end - offset, kCopyChunkSize));
+      ssize_t n;
+      if (rangeCopy) {
+        off_t inOffset = offset, outOffset = offset;
+        n = copy_file_range(in_, &inOffset, out_, &outOffset, size, 0);
+        if (n < 0 && (refusesForEveryFile(errno) || errno == EINVAL)) {
+          if (errno != EINVAL) route_.rangeCopyRefused = true;  // EINVAL may be this file's alone
+          rangeCopy = false;
+          continue;
+        }
+      } else if (send) {
+        if (outPosition_ != offset) {
+          if (lseek(out_, offset, SEEK_SET) < 0) return errno;
+          outPosition_ = offset;
+        }
+        off_t inOffset = offset;
+        n = sendfile(out_, in_, &inOffset, size);
+        if (n < 0 && (errno == EINVAL || errno == ENOSYS)) {
+          route_.sendRefused = true;
+          send = false;
+          continue;
+        }
+        if (n > 0) outPosition_ += n;
+      } else {
+        n = copyByReadWrite(offset, std::min(size, kReadWriteBufferSize));
+      }
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) return errno;
+      if (n == 0) return 0;  // the end of the file, sooner than it was if it shrank
+      offset += n;
+    }
+    return 0;
+  }
+
+  // One read of at most `size` bytes at `offset`, written whole at the same
+  // offset. The bytes read, 0 at the end, or -1 with errno set.
+  ssize_t copyByReadWrite(off_t offset, size_t size) {
+    buffer_.resize(kReadWriteBufferSize);
+    ssize_t got = pread(in_, buffer_.data(), size, offset);
+    if (got <= 0) return got;
+    for (ssize_t written = 0; written < got;) {
+      ssize_t n = pwrite(out_, buffer_.data() + written, static_cast<size_t>(got - written), offset + written);
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) return -1;
+      written += n;
+    }
+    return got;
+  }
+
+  const int in_;
+  const int out_;
+  DataRoute& route_;
+  std::vector<char>& buffer_;
+  off_t outPosition_ = 0;  // of `out_`, which only sendfile moves
+};
 
 // ---- Status -------------------------------------------------------------
 
@@ -154,20 +250,6 @@ struct Location {
   int directoryFD;   // AT_FDCWD for the top item
   std::string name;  // the whole path for the top item
 };
-
-int copyRegularFile(const Location& from, const Location& to, const struct stat& expected) {
-  ScopedFD in(openat(from.directoryFD, from.name.c_str(), kOpenSourceFileFlags));
-  if (!in.valid()) return errno;
-  struct stat status {};
-  if (fstat(in.get(), &status) != 0) return errno;
-  // Replaced by another kind of item since it was examined.
-  if ((status.st_mode & S_IFMT) != (expected.st_mode & S_IFMT)) return EAGAIN;
-  ScopedFD out(openat(to.directoryFD, to.name.c_str(), kCreateFileFlags, kPrivateFileMode));
-  if (!out.valid()) return errno;
-  if (int errnum = copyData(in.get(), out.get()); errnum != 0) return errnum;
-  if (int errnum = copyExtendedAttributes({in.get(), {}}, {out.get(), {}}); errnum != 0) return errnum;
-  return applyStatus(out.get(), status);
-}
 
 int copySymbolicLink(const Location& from, const Location& to, const struct stat& status) {
   std::string target(static_cast<size_t>(status.st_size) + 1, '\0');
@@ -200,6 +282,7 @@ int copyNode(const Location& from, const Location& to, const struct stat& status
 // ---- The walk -----------------------------------------------------------
 
 struct Frame {
+  std::string name;  // in its parent; the whole path for the top directory
   ScopedFD source;
   ScopedFD destination;
   struct stat status {};             // of the source directory
@@ -208,17 +291,29 @@ struct Frame {
   size_t next = 0;
 };
 
+// The copy of an item with several names, met under one of them: its further
+// names in the tree are made links to it.
+struct LinkedCopy {
+  std::vector<std::string> path;  // names from the top directory down to the copy's own
+  dev_t device = 0;               // of the copy
+  ino_t inode = 0;
+  nlink_t namesLeft = 0;  // names of the source not met yet
+};
+
 class TreeCopier {
  public:
   int run(const char* source, const char* destination) {
     struct stat status {};
     if (fstatat(AT_FDCWD, source, &status, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+    destinationPath_ = destination;
     int errnum = copyItem({AT_FDCWD, source}, {AT_FDCWD, destination}, status);
     while (errnum == 0 && !frames_.empty()) errnum = step();
     return errnum;
   }
 
  private:
+  using ItemKey = std::pair<dev_t, ino_t>;
+
   int step() {
     Frame& top = frames_.back();
     if (top.next == top.entries.size()) return leaveDirectory();
@@ -230,9 +325,19 @@ class TreeCopier {
     if (S_ISDIR(status.st_mode) && status.st_dev == copyRoot_.st_dev && status.st_ino == copyRoot_.st_ino) {
       return EINVAL;  // the copy's own destination, inside its source
     }
-    int sourceFD = top.source.get();
-    int destinationFD = top.destination.get();
-    return copyItem({sourceFD, name}, {destinationFD, name}, status);
+    const Location from{top.source.get(), name}, to{top.destination.get(), name};
+    if (S_ISDIR(status.st_mode) || status.st_nlink < 2) return copyItem(from, to, status);
+    const ItemKey key{status.st_dev, status.st_ino};
+    if (auto found = linkedCopies_.find(key); found != linkedCopies_.end()) {
+      if (linkToCopy(found->second, to) == 0) {
+        if (--found->second.namesLeft == 0) linkedCopies_.erase(found);
+        return 0;
+      }
+      return copyItem(from, to, status);  // a copy of its own, like the first
+    }
+    if (int errnum = copyItem(from, to, status); errnum != 0) return errnum;
+    rememberCopy(key, to, status.st_nlink - 1);
+    return 0;
   }
 
   int copyItem(const Location& from, const Location& to, const struct stat& status) {
@@ -248,8 +353,89 @@ class TreeCopier {
     }
   }
 
+  int copyRegularFile(const Location& from, const Location& to, const struct stat& expected) {
+    ScopedFD in(openat(from.directoryFD, from.name.c_str(), kOpenSourceFileFlags));
+    if (!in.valid()) return errno;
+    struct stat status {};
+    if (fstat(in.get(), &status) != 0) return errno;
+    // Replaced by another kind of item since it was examined.
+    if ((status.st_mode & S_IFMT) != (expected.st_mode & S_IFMT)) return EAGAIN;
+    ScopedFD out(openat(to.directoryFD, to.name.c_str(), kCreateFileFlags, kPrivateFileMode));
+    if (!out.valid()) return errno;
+    dev_t destinationDevice = 0;
+    if (!frames_.empty()) {
+      destinationDevice = frames_.back().destinationStatus.st_dev;
+    } else if (struct stat created{}; fstat(out.get(), &created) == 0) {
+      destinationDevice = created.st_dev;
+    } else {
+      return errno;
+    }
+    FileData data(in.get(), out.get(), routeBetween(status.st_dev, destinationDevice), buffer_);
+    if (int errnum = data.copy(status); errnum != 0) return errnum;
+    if (int errnum = copyExtendedAttributes({in.get(), {}}, {out.get(), {}}); errnum != 0) return errnum;
+    return applyStatus(out.get(), status);
+  }
+
+  DataRoute& routeBetween(dev_t from, dev_t to) {
+    for (DataRoute& route : routes_) {
+      if (route.from == from && route.to == to) return route;
+    }
+    return routes_.emplace_back(DataRoute{from, to});
+  }
+
+  // Records the copy just made at `to` (an entry of the top directory) as the
+  // one further names of its source are linked to.
+  void rememberCopy(const ItemKey& key, const Location& to, nlink_t namesLeft) {
+    struct stat copy {};
+    if (fstatat(to.directoryFD, to.name.c_str(), &copy, AT_SYMLINK_NOFOLLOW) != 0) return;  // no links to it then
+    LinkedCopy& linked = linkedCopies_[key];
+    for (size_t level = 1; level < frames_.size(); ++level) linked.path.push_back(frames_[level].name);
+    linked.path.push_back(to.name);
+    linked.device = copy.st_dev;
+    linked.inode = copy.st_ino;
+    linked.namesLeft = namesLeft;
+  }
+
+  // Makes `to` another name of `copy`. Its directory is reached from the
+  // deepest directory of the walk still open on both paths, else from the
+  // top one by its path, one name at a time: no path longer than a name is
+  // ever used, however deep the tree. 0, or an error number when the link
+  // could not be made (nothing was made then).
+  int linkToCopy(const LinkedCopy& copy, const Location& to) {
+    size_t level = 0;  // of the deepest directory on both paths
+    while (level + 1 < frames_.size() && level + 1 < copy.path.size() && frames_[level + 1].name == copy.path[level]) {
+      ++level;
+    }
+    ScopedFD opened;
+    int directoryFD = frames_[level].destination.get();
+    if (!frames_[level].destination.valid()) {
+      opened.reset(open(destinationPath_.c_str(), kOpenDirectoryFlags));
+      if (!opened.valid()) return errno;
+      if (!isSameItem(opened.get(), copyRoot_.st_dev, copyRoot_.st_ino)) return EAGAIN;
+      directoryFD = opened.get();
+      level = 0;
+    }
+    for (; level + 1 < copy.path.size(); ++level) {
+      opened.reset(openat(directoryFD, copy.path[level].c_str(), kOpenDirectoryFlags));
+      if (!opened.valid()) return errno;
+      directoryFD = opened.get();
+    }
+    if (linkat(directoryFD, copy.path.back().c_str(), to.directoryFD, to.name.c_str(), 0) != 0) return errno;
+    // The copy's directories could have been renamed meanwhile: the new name
+    // must be the copy, or it goes again.
+    struct stat linked {};
+    if (fstatat(to.directoryFD, to.name.c_str(), &linked, AT_SYMLINK_NOFOLLOW) == 0 && linked.st_dev == copy.device &&
+        linked.st_ino == copy.inode) {
+      return 0;
+    }
+    // Not removable: the copy that follows fails on the name (EEXIST).
+    (void)unlinkat(to.directoryFD, to.name.c_str(), 0);
+    return EAGAIN;
+  }
+
   int enterDirectory(const Location& from, const Location& to, const struct stat& expected) {
     Frame frame;
+    frame.name = to.name;
     frame.source.reset(openat(from.directoryFD, from.name.c_str(), kOpenDirectoryFlags));
     if (!frame.source.valid()) return errno;
     if (fstat(frame.source.get(), &frame.status) != 0) return errno;
@@ -296,6 +482,10 @@ class TreeCopier {
 
   std::vector<Frame> frames_;
   struct stat copyRoot_ {};  // the destination's top directory
+  std::string destinationPath_;
+  std::map<ItemKey, LinkedCopy> linkedCopies_;  // by the source's device and inode
+  std::vector<DataRoute> routes_;
+  std::vector<char> buffer_;  // of the read and write copies
 };
 
 }  // namespace

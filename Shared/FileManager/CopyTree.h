@@ -6,6 +6,13 @@
 // extended attributes of every namespace that can be read (access-control
 // lists included), its mode, owner, group and access and modification times.
 //
+// Copies are faithful beyond that: a regular file shares its blocks with the
+// source where the file system can (a clone), otherwise only its data extents
+// are copied, so its holes stay holes; and items with several names in the
+// tree (hard links) are copied once, their further names linked to that copy.
+// Where a link cannot be made, the item is copied again instead. Names
+// outside the tree, or in another call's tree, are not looked for.
+//
 // Nothing is merged or replaced: an existing item at `destination` fails the
 // copy with EEXIST. The copy stops at the first failure and leaves what it
 // had copied so far. Entries of the source that vanish while the copy runs

@@ -36,6 +36,30 @@ struct QSTraversalEntry {
   struct stat status {};    // lstat of the item (for DirectoryPost: the one taken at DirectoryPre)
 };
 
+// What a tree holds, as counted by sizeOfItemAtURL: regular files and their
+// bytes, directories, and every other item (links included).
+struct QSItemSize {
+  uint64_t files = 0;
+  uint64_t bytes = 0;
+  uint64_t directories = 0;
+  uint64_t otherItems = 0;
+  QSItemSize& operator+=(const QSItemSize& other) {
+    files += other.files;
+    bytes += other.bytes;
+    directories += other.directories;
+    otherItems += other.otherItems;
+    return *this;
+  }
+};
+
+// The file system that holds (or would hold) a path, and its room.
+struct QSFileSystemSpace {
+  uint64_t device = 0;        // st_dev of the nearest existing item
+  std::string existingPath;   // that item: the path itself or its nearest existing ancestor
+  uint64_t freeBytes = 0;     // bytes an unprivileged writer may still use
+  uint64_t blockSize = 0;     // the unit in which files take room
+};
+
 // Per-entry step of a walk: return true to go on, false to stop (optionally
 // writing *error).
 using QSTraversalBlock = std::function<bool(const QSTraversalEntry& entry, platform::Error* error)>;
@@ -119,6 +143,16 @@ class QSFileManager {
   // The link's text (at most 1024 bytes) as an unresolved URL.
   [[nodiscard]] std::optional<platform::URL> destinationOfSymbolicLinkAtURL(const platform::URL& url,
                                                               platform::Error* error = nullptr) const;
+
+  // --- Sizes and room (read only) -----------------------------------------------
+  // Counts the tree at `url` (a file counts itself; a missing item is empty),
+  // not following links and not leaving its file system. Fails with a POSIX
+  // record when part of the tree cannot be read.
+  bool sizeOfItemAtURL(const platform::URL& url, QSItemSize* size, platform::Error* error = nullptr) const;
+  // The file system of `url`, or of its nearest existing ancestor when it
+  // does not exist yet, with its free room.
+  bool fileSystemSpaceForURL(const platform::URL& url, QSFileSystemSpace* space,
+                             platform::Error* error = nullptr) const;
 
   // --- Path containment ---------------------------------------------------------
   // The real path of `url` when it lies inside `ifChildOfURL` (links resolved,

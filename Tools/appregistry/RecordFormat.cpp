@@ -2,13 +2,14 @@
 
 #include <algorithm>
 
+#include "Platform/Foundation/Json.h"
 #include "Tools/UTF8.h"
-#include "Tools/appregistry/Json.h"
 
 namespace appregistry {
 namespace {
 
 using platform::BundleRecord;
+using platform::JsonWriter;
 using platform::SafeHarborRecord;
 
 constexpr char kNone[] = "-";

@@ -1,6 +1,6 @@
 // How appregistry shows registry records and safe harbors: an aligned text
 // table (list), a block of labelled lines (show), or JSON (--json, see
-// Json.h for how bytes that are not UTF-8 are written).
+// Platform/Foundation/Json.h for how bytes that are not UTF-8 are written).
 //
 // Every name printed as text goes through tools::printable, so a file name
 // with control characters or invalid bytes cannot disturb the terminal.

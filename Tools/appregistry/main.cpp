@@ -3,8 +3,11 @@
 //   appregistry list --root DIR [--json]
 //   appregistry show ID --root DIR [--json]
 //
-// Exit status: 0 success, 1 when the registry cannot be opened or `show`
-// finds no record, 64 usage error.
+// The registry is opened for reading only: nothing under DIR changes, and a
+// root without a registry database is refused rather than given one.
+//
+// Exit status: 0 success, 1 when there is no registry, it cannot be opened or
+// `show` finds no record, 64 usage error.
 #include <stdlib.h>
 #include <sys/stat.h>
 
@@ -14,7 +17,8 @@
 
 #include <CLI/CLI.hpp>
 
-#include "Platform/Registry/SQLiteRegistry.h"
+#include "Platform/Registry/RegistryReader.h"
+#include "Tools/ToolVersion.h"
 #include "Tools/UTF8.h"
 #include "Tools/appregistry/RecordFormat.h"
 
@@ -36,7 +40,10 @@ void print(const std::string& text) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  CLI::App app{"Shows the records and safe harbors of the application registry."};
+  CLI::App app{"Shows the records and safe harbors of the application registry of a system root, without changing "
+               "anything there.",
+               "appregistry"};
+  app.set_version_flag("--version", tools::versionText("appregistry"));
   app.require_subcommand(1);
   std::string root;
   bool json = false;
@@ -56,16 +63,17 @@ int main(int argc, char** argv) {
     return status == 0 ? kExitSuccess : kExitUsage;
   }
 
-  // Opening creates a registry where there is none; never under a root
-  // that does not exist. The records hold absolute paths, so the root is
-  // made absolute too.
+  // The records hold absolute paths, so the root is made absolute too.
   std::unique_ptr<char, decltype(&free)> resolved(realpath(root.c_str(), nullptr), &free);
   struct stat st;
   if (!resolved || stat(resolved.get(), &st) != 0 || !S_ISDIR(st.st_mode)) return fail(root + " is not a directory");
   root = resolved.get();
   platform::Error error;
-  std::unique_ptr<platform::SQLiteApplicationRegistry> registry =
-      platform::SQLiteApplicationRegistry::open(root, &error);
+  std::unique_ptr<platform::RegistryReader> registry = platform::RegistryReader::open(root, false, &error);
+  if (!registry && error.code() == platform::kRegistryErrorNoDatabase) {
+    return fail(root + " holds no application registry (no " + platform::registry::RegistryLayout(root).databasePath +
+                ")");
+  }
   if (!registry) return fail("cannot open the registry under " + root + ": " + error.description());
 
   if (list->parsed()) {

@@ -1,5 +1,7 @@
 #include "Tools/devicegen/Verifier.h"
 
+#include "Platform/Foundation/Json.h"
+
 #include <map>
 #include <optional>
 #include <set>
@@ -321,6 +323,38 @@ void printVerifyResult(const std::string& root, const VerifyResult& result, FILE
             static_cast<unsigned long long>(result.problemCount() - result.listed.size()));
   }
   fprintf(out, "FAILED\n");
+}
+
+std::string verifyResultJSON(const std::string& root, const VerifyResult& result) {
+  const VerifySummary& s = result.summary;
+  platform::JsonWriter json;
+  json.beginObject();
+  json.key("root").string(root);
+  json.key("ok").boolean(result.ok());
+  json.key("fatal").optionalString(result.fatal.empty() ? std::nullopt : std::optional(result.fatal));
+  json.key("summary").beginObject();
+  const std::pair<const char*, uint64_t> figures[] = {
+      {"applications", s.applications}, {"placeholders", s.placeholders},
+      {"builtInRefusals", s.builtInRefusals}, {"vpnOnlyContainers", s.vpnOnlyContainers},
+      {"groups", s.groups}, {"safeHarbors", s.harbors}, {"files", s.files}, {"bytes", s.bytes},
+      {"directories", s.directories}, {"links", s.links}};
+  for (const auto& [name, value] : figures) json.key(name).number(value);
+  json.endObject();
+  json.key("problemCounts").beginObject();
+  for (size_t k = 0; k < static_cast<size_t>(ProblemKind::Count); ++k) {
+    json.key(kProblemKindNames[k]).number(result.counts[k]);
+  }
+  json.endObject();
+  json.key("problems").beginArray();
+  for (const Problem& p : result.listed) {
+    json.beginObject();
+    json.key("kind").string(kProblemKindNames[static_cast<size_t>(p.kind)]);
+    json.key("text").string(p.text);
+    json.endObject();
+  }
+  json.endArray();
+  json.endObject();
+  return json.text() + "\n";
 }
 
 }  // namespace devicegen

@@ -60,5 +60,7 @@ VerifyResult verifyImage(const std::string& root);
 
 // The report: summary, problem counts, the listed problems, a verdict line.
 void printVerifyResult(const std::string& root, const VerifyResult& result, FILE* out);
+// The same as one JSON document (verify --json).
+std::string verifyResultJSON(const std::string& root, const VerifyResult& result);
 
 }  // namespace devicegen

@@ -3,7 +3,7 @@
 //   devicegen create --root DIR --apps N [--vpn-only K] [--groups G]
 //       [--files-per-app F] [--bytes-per-file B] [--harbors H]
 //       [--placeholders P] [--builtin-older K2] [--seed S]
-//   devicegen verify --root DIR
+//   devicegen verify --root DIR [--json]
 //
 // Exit status: 0 success, 1 failure (create could not write the image, or
 // verify found problems), 64 usage error.
@@ -13,6 +13,7 @@
 
 #include <CLI/CLI.hpp>
 
+#include "Tools/ToolVersion.h"
 #include "Tools/UTF8.h"
 #include "Tools/devicegen/FileOps.h"
 #include "Tools/devicegen/Generator.h"
@@ -63,19 +64,27 @@ int runCreate(devicegen::ImageOptions options) {
   return kExitSuccess;
 }
 
-int runVerify(const std::string& rootArgument) {
+int runVerify(const std::string& rootArgument, bool json) {
   std::string why;
   const std::optional<std::string> root = devicegen::canonicalDirectory(rootArgument, &why);
   if (!root) return fail(why);
   const devicegen::VerifyResult result = devicegen::verifyImage(*root);
-  devicegen::printVerifyResult(*root, result, stdout);
+  if (json) {
+    const std::string text = devicegen::verifyResultJSON(*root, result);
+    fwrite(text.data(), 1, text.size(), stdout);
+  } else {
+    devicegen::printVerifyResult(*root, result, stdout);
+  }
   return result.ok() ? kExitSuccess : kExitFailure;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  CLI::App app{"Makes old-layout device images and verifies migrated ones."};
+  CLI::App app{"Makes old-layout device images and verifies migrated ones.", "devicegen"};
+  app.set_version_flag("--version", tools::versionText("devicegen"));
+  app.footer("Exit status: 0 success, 1 failure (create could not write the image, or verify found problems), 64 "
+             "usage error.");
   app.require_subcommand(1);
 
   devicegen::ImageOptions options;
@@ -95,6 +104,8 @@ int main(int argc, char** argv) {
   std::string verifyRoot;
   CLI::App* verify = app.add_subcommand("verify", "Check a migrated image against its manifest");
   verify->add_option("--root", verifyRoot, "Directory of the image")->required();
+  bool verifyJSON = false;
+  verify->add_flag("--json", verifyJSON, "Write the result as one JSON document");
 
   try {
     app.parse(argc, argv);
@@ -103,5 +114,5 @@ int main(int argc, char** argv) {
     return status == 0 ? kExitSuccess : kExitUsage;
   }
   if (create->parsed()) return runCreate(options);
-  return runVerify(verifyRoot);
+  return runVerify(verifyRoot, verifyJSON);
 }

@@ -106,5 +106,46 @@ TEST_F(Introspection, AValidMarkerWinsOverTheChildrenAnInvalidOneLeavesThemTheDe
   EXPECT_TRUE(loggedOnce("QSAppMigrator: No app or vpn bundle found in container " + garbage + " ; removing it"));
 }
 
+// The survey (what a dry run uses) finds what introspection finds and
+// removes nothing; introspection then acts on it.
+TEST_F(Introspection, SurveyFindsWithoutRemovingWhatIntrospectionRemoves) {
+  using Finding = QSEntrySurvey::Finding;
+  const std::string stray = oldApplicationsPath() + "/stray";
+  ASSERT_TRUE(writeFile(stray, "x"));
+  const std::string empty = makeContainer("empty");
+  ASSERT_TRUE(makeDirs(empty + "/Documents"));
+  const std::string both = makeBundleContainer("both", "com.example.app");
+  makeBundle(both + "/Tunnel.vpnplugin", "com.example.app.tunnel");
+  const std::string vpn = makeContainer("vpn");
+  makeBundle(vpn + "/Tunnel.vpnplugin", "com.example.other.tunnel");
+  const struct {
+    std::string path;
+    Finding finding;
+    bool early;
+    bool removed;
+  } cases[] = {
+      {stray, Finding::StrayFile, false, true},
+      {empty, Finding::NoBundle, false, true},
+      {both, Finding::Container, true, false},
+      {vpn, Finding::Container, false, false},
+      {oldApplicationsPath() + "/vanished", Finding::Vanished, false, false},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.path);
+    const QSEntrySurvey survey = migrator_->_surveyEntry(URL::fileURL(c.path, true));
+    EXPECT_EQ(survey.finding, c.finding);
+    EXPECT_EQ(survey.orderEarly, c.early);
+    EXPECT_EQ(pathExists(c.path), c.path.find("vanished") == std::string::npos) << "the survey removed it";
+    bool early = false;
+    const auto info = introspect(c.path, &early, !c.early);
+    EXPECT_EQ(info.has_value(), c.finding == Finding::Container);
+    if (info) {
+      EXPECT_EQ(*info, *survey.info);
+      EXPECT_EQ(early, c.early) << "the flag is set from the survey";
+    }
+    EXPECT_EQ(pathExists(c.path), !c.removed && c.path.find("vanished") == std::string::npos);
+  }
+}
+
 }  // namespace
 }  // namespace qstest

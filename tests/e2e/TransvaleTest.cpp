@@ -2,6 +2,8 @@
 // made by devicegen (checked afterwards by devicegen verify), and on small
 // hand-made roots for its exit codes, output and log modes.
 #include <signal.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -10,6 +12,7 @@
 #include <filesystem>
 #include <fstream>
 #include <iostream>
+#include <map>
 #include <random>
 #include <regex>
 #include <thread>
@@ -102,7 +105,11 @@ class EndToEnd : public testing::Test {
     std::cerr << "--- stdout ---\n"
               << out() << "--- stderr ---\n"
               << err() << "--- log (tail) ---\n"
-              << log.substr(log.size() > 6000 ? log.size() - 6000 : 0);
+              << log.substr(log.size() > 6000 ? log.size() - 6000 : 0) << "--- failure lines of the log ---\n";
+    std::istringstream lines(log);
+    for (std::string line; std::getline(lines, line);) {
+      if (line.find(" <3> ") != std::string::npos) std::cerr << line << "\n";
+    }
   }
 
   int run(const std::vector<std::string>& argv) { return Process(argv, dir_.path()).wait(); }
@@ -118,7 +125,7 @@ class EndToEnd : public testing::Test {
 
 enum class Layout { Empty, OddEntries, ApplicationsIsAFile, NoRoot };
 // Where a text must be found, or must not.
-enum Where { InOutput, NotInOutput, InError, InLog, NotInLog };  // InLog: the default log
+enum Where { InOutput, NotInOutput, InError, NotInError, InLog, NotInLog };  // InLog: the default log
 
 struct HostCase {
   const char* name;
@@ -179,13 +186,27 @@ TEST_F(Transvale, ExitCodesOutputAndLogModes) {
       {"no migrator", ApplicationsIsAFile, {}, kExitPluginUnusable,
        {{InError, "could not create its migrator"}, {InLog, "QSAppMigrator: Failed to get items at file://" + apps}}},
       {"nothing to migrate", Empty, {"--progress", "never"}, kExitSuccess,
-       {{InOutput, "Data class: QSAppMigrator\nEstimated duration: 20\n"}, {InOutput, "transvale: migration succeeded"},
+       {{InOutput, "Data class: QSAppMigrator\nEstimated duration: 20 s\n"},
+        {InOutput, "transvale: no old application layout under {root}"}, {InOutput, "transvale: migration succeeded"},
         {NotInOutput, "progress"}, {InLog, "QSAppMigrator: Recorded current system version as 21A100"},
         {InLog, "host <5> [Transvaler] -[QSAppMigrator performMigration] (QSAppMigrator.cpp:"}}},
-      {"progress bar", Empty, {"--progress", "always"}, kExitSuccess, {{InOutput, "\r["}, {InOutput, "0/0 entries"}}},
+      {"progress bar", Empty, {"--progress", "always"}, kExitSuccess,
+       {{InError, "\r["}, {NotInError, "0/0 entries"}, {NotInOutput, "\r["}}},
+      {"progress lines of nothing", Empty, {"--progress", "auto"}, kExitSuccess,
+       {{InError, "progress: nothing to migrate\n"}, {NotInError, "50%"}}},
+      {"plan of nothing", Empty, {"--plan"}, kExitSuccess,
+       {{InOutput, "No old application layout: {root}" + std::string(kOldApplications) + " is missing or empty"}}},
+      {"plan of odd entries", OddEntries, {"--plan"}, kExitSuccess,
+       {{InOutput, "(unknown): kept\n      container: " + apps + "/A\n"
+                   "      kept because its application bundle is a symbolic link\n"},
+        {InOutput, apps + "/WhereDidMyApplicationsGo.txt: the previous release's note file, 1 files, 1 bytes\n"},
+        {InOutput, "stray file in the old applications directory, 1 files, 1 bytes"}}},
+      {"JSON plan", OddEntries, {"--plan", "--json"}, kExitSuccess,
+       {{InOutput, "\"action\": \"kept\""}, {InOutput, "\"reason\": \"its application bundle is a symbolic link\""}}},
+      {"JSON without a plan", Empty, {"--json"}, kExitUsage, {{InError, "--json requires --plan"}}},
       {"entries left, progress lines, log on stderr", OddEntries, {"--log", "-"}, kExitRunFailed,
-       {{InOutput, "Estimated duration: 26.75\n"}, {InOutput, "progress: 100% (3/3 entries)\n"},
-        {InOutput, "transvale: migration failed, 3 of 3 entries finished"},
+       {{InOutput, "Estimated duration: 26.75 s\n"}, {InError, "progress: 100% (3/3 entries)\n"},
+        {InOutput, "transvale: migration failed: 0 migrated, 1 kept, 0 failed, 2 removed of 3 entries"},
         {InError, "QSAppMigrator: Skipping container with app symlink at " + apps + "/A/Main.app"},
         {InError, "system <5> -[QSFileManager urlsForItemsInDirectoryAtURL:ignoringSymlinks:error:]: "
                   "Ignoring symlink at " + apps + "/Link"},
@@ -213,8 +234,16 @@ TEST_F(Transvale, ExitCodesOutputAndLogModes) {
     EXPECT_EQ(run(argv), c.exitCode);
     const std::string output = out(), error = err(), log = readFile(image_ + kDefaultLog);
     for (const auto& [where, text] : c.texts) {
-      const std::string& in = where <= NotInOutput ? output : where == InError ? error : log;
-      EXPECT_EQ(in.find(expand(text)) != std::string::npos, where != NotInOutput && where != NotInLog) << text;
+      const std::string& in = where <= NotInOutput ? output : where <= NotInError ? error : log;
+      EXPECT_EQ(in.find(expand(text)) != std::string::npos, where % 2 == 0) << text;
+    }
+    // The bar never runs past the terminal (80 columns when standard error is
+    // not one).
+    for (size_t at = 0; (at = error.find('\r', at)) != std::string::npos; ++at) {
+      EXPECT_LT(error.find("\033[K", at) - at - 1, 80u) << error.substr(at, 120);
+    }
+    if (!c.arguments.empty() && c.arguments[0] == "--plan") {
+      EXPECT_FALSE(pathExists(image_ + kDefaultLog)) << "a plan writes no log";
     }
     EXPECT_TRUE(c.layout != OddEntries || fs::is_symlink(oldApplications() + "/A/Main.app"));
     if (c.arguments.size() == 2 && c.arguments[1] == "jsonl") {
@@ -222,6 +251,24 @@ TEST_F(Transvale, ExitCodesOutputAndLogModes) {
       for (std::string line; std::getline(lines, line);) EXPECT_TRUE(std::regex_match(line, jsonLine)) << line;
     }
   }
+}
+
+// A log in a directory that exists leaves that directory's mode alone (a log
+// in /tmp must not take its sticky, world-writable mode away); directories
+// made for a log get 0755.
+TEST_F(Transvale, LogDirectoriesGetTheirModeOnlyWhenMadeForTheLog) {
+  makeLayout(Layout::Empty);
+  const std::string shared = dir_ / "shared";
+  ASSERT_TRUE(makeDirs(shared));
+  ASSERT_EQ(chmod(shared.c_str(), 01777), 0);
+  for (const char* log : {"/x.log", "/made/x.log"}) {
+    ASSERT_EQ(run({"transvale", "--root", image_, "--progress", "never", "--log", shared + log}), kExitSuccess);
+  }
+  struct stat st {};
+  ASSERT_EQ(stat(shared.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 01777u);
+  ASSERT_EQ(stat((shared + "/made").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0755u);
 }
 
 // --- Migrations of device images -------------------------------------------------------------
@@ -389,6 +436,195 @@ TEST_F(Migration, RunKilledAtRandomPointsFinishesWhenRestarted) {
   if (status != kExitSuccess) status = migrate();
   ASSERT_EQ(status, kExitSuccess);
   expectMigratedAndVerified(true);
+}
+
+// --- Plan, report and room on the destination ----------------------------------------------
+
+// Every item below `root`, by relative path: type, mode, size, modification
+// and change times, and the bytes of files and link texts. Directory entries
+// show as their paths.
+std::map<std::string, std::string> treeState(const std::string& root) {
+  std::map<std::string, std::string> state;
+  for (auto it = fs::recursive_directory_iterator(root); it != fs::recursive_directory_iterator(); ++it) {
+    struct stat st {};
+    lstat(it->path().c_str(), &st);
+    std::string item = std::to_string(st.st_mode) + " " + std::to_string(st.st_size) + " " +
+                       std::to_string(st.st_mtim.tv_sec) + "." + std::to_string(st.st_mtim.tv_nsec) + " " +
+                       std::to_string(st.st_ctim.tv_sec) + "." + std::to_string(st.st_ctim.tv_nsec);
+    if (S_ISREG(st.st_mode)) item += " " + readFile(it->path());
+    if (S_ISLNK(st.st_mode)) item += " " + fs::read_symlink(it->path()).string();
+    state[it->path().string().substr(root.size())] = item;
+  }
+  return state;
+}
+
+// The number after `"key": ` in JSON text (first occurrence after `from`).
+long long jsonNumber(const std::string& json, const std::string& key, const std::string& from = "") {
+  const size_t start = from.empty() ? 0 : json.find(from);
+  const size_t at = json.find("\"" + key + "\": ", start == std::string::npos ? 0 : start);
+  return at == std::string::npos ? -1 : std::atoll(json.c_str() + at + key.size() + 4);
+}
+
+long long manifestTotal(const std::string& image, const char* key) {
+  const auto manifest = platform::plist::readDictionary(URL::fileURL(image + "/devicegen-manifest.plist"));
+  const Value* totals = manifest ? QSValueForKey(*manifest, "Totals") : nullptr;
+  const Value* value = totals && totals->isDictionary() ? QSValueForKey(*totals->asDictionary(), key) : nullptr;
+  return value ? value->int64Value(-1) : -1;
+}
+
+TEST_F(Migration, PlanChangesNothingAndForetellsWhatTheReportThenConfirms) {
+  createImage({"--apps", "10", "--vpn-only", "2", "--groups", "3", "--harbors", "2", "--placeholders", "1",
+               "--builtin-older", "2", "--files-per-app", "4", "--bytes-per-file", "1500", "--seed", "9"});
+  // What the run discards: a stray file, and a container without a bundle.
+  ASSERT_TRUE(writeFile(oldApplications() + "/stray.bin", std::string(700, 'x')));
+  ASSERT_TRUE(makeDirs(oldApplications() + "/NOBUNDLE/Documents"));
+  ASSERT_TRUE(writeFile(oldApplications() + "/NOBUNDLE/Documents/notes.txt", std::string(300, 'y')));
+  // An earlier attempt on one container: its marker, and its placeholder in
+  // the registry, whose database is open (write-ahead log present) for the
+  // first plan and closed for the second.
+  // An ordinary application: neither a placeholder nor one with a built-in
+  // copy, and without a VPN plug-in (a marker without it would strand the
+  // plug-in's container, as the plan rightly says).
+  const auto manifest = platform::plist::readDictionary(URL::fileURL(image_ + "/devicegen-manifest.plist"));
+  ASSERT_TRUE(manifest);
+  std::string container, bundle, identifier;
+  for (const Value& entry : *QSValueForKey(*manifest, "Containers")->asArray()) {
+    const Dictionary& c = *entry.asDictionary();
+    if (*QSStringForKey(c, "Kind") != "App" || c.at("Placeholder").boolValue(true) ||
+        c.at("BuiltInRefusal").boolValue(true) || c.count("VPNPluginIdentifier")) {
+      continue;
+    }
+    container = image_ + "/" + *QSStringForKey(c, "Container");
+    bundle = container + "/" + *QSStringForKey(c, "Bundle");
+    identifier = *QSStringForKey(c, "Identifier");
+    break;
+  }
+  ASSERT_FALSE(identifier.empty());
+  ASSERT_TRUE(platform::plist::writeFile(
+      Value(Dictionary{{kQSContainerPathKey, Value(container)}, {kQSBundlePathKey, Value(bundle)},
+                       {kQSBundleIdentifierKey, Value(identifier)}, {kQSContainerTypeKey, Value(kQSContainerTypeApp)}}),
+      URL::fileURL(container + "/" + kQSMigrationMarkerFileName)));
+  const std::string placeholder = dir_ / "tmp/placeholder/" + identifier + ".app";
+  ASSERT_TRUE(makeDirs(placeholder));
+  ASSERT_TRUE(platform::plist::writeFile(Value(Dictionary{{platform::kBundleIdentifierKey, Value(identifier)}}),
+                                         URL::fileURL(placeholder + "/Info.plist")));
+  platform::Error error;
+  auto registry = platform::SQLiteApplicationRegistry::open(image_, &error);
+  ASSERT_TRUE(registry) << error.description();
+  ASSERT_TRUE(registry->installBundle(
+      URL::fileURL(placeholder, true),
+      {{platform::kRegistryInstallTypeKey, Value(kQSMigratorInstallType)},
+       {platform::kRegistryPackageTypeKey, Value(platform::kRegistryPackageTypePlaceholder)},
+       {platform::kBundleIdentifierKey, Value(identifier)}},
+      &error));
+  const std::string database = image_ + "/private/var/db/appregistry/registry.sqlite";
+
+  std::string plan;
+  for (const bool databaseOpen : {true, false}) {
+    SCOPED_TRACE(databaseOpen ? "registry open" : "registry closed");
+    if (!databaseOpen) registry.reset();
+    EXPECT_EQ(pathExists(database + "-wal"), databaseOpen);
+    const auto before = treeState(image_);
+    ASSERT_EQ(run({"transvale", "--root", image_, "--plan"}), kExitSuccess) << err();
+    EXPECT_NE(out().find("com.example."), std::string::npos);
+    ASSERT_EQ(run({"transvale", "--root", image_, "--plan", "--json"}), kExitSuccess) << err();
+    plan = out();
+    const auto after = treeState(image_);
+    for (const auto& [path, state] : before) {
+      EXPECT_TRUE(after.count(path) && after.at(path) == state) << "the plan changed or removed " << path;
+    }
+    for (const auto& [path, state] : after) EXPECT_TRUE(before.count(path)) << "the plan made " << path;
+  }
+
+  // What the image holds, as the plan tells it: 10 applications (1 placeholder,
+  // 2 with a built-in copy, the one with a marker already installed) and 2
+  // VPN-only containers; every byte of the manifest (data and groups) to
+  // move; the three discards with their sizes; the harbors.
+  const std::pair<const char*, long long> counts[] = {
+      {"placeholder then install", 6}, {"placeholder only (the old bundle is a placeholder)", 1},
+      {"already installed", 1}, {"refused: an equal or newer built-in copy exists", 2},
+      {"VPN plug-in only", 2}, {"kept", 0}, {"discarded", 3}};
+  for (const auto& [action, count] : counts) EXPECT_EQ(jsonNumber(plan, action, "\"totals\""), count) << action;
+  EXPECT_EQ(jsonNumber(plan, "bytes", "\"toMove\""), manifestTotal(image_, "Bytes"));
+  EXPECT_EQ(jsonNumber(plan, "files", "\"toMove\""), manifestTotal(image_, "Files"));
+  EXPECT_EQ(jsonNumber(plan, "bytes", "/stray.bin\""), 700);
+  EXPECT_EQ(jsonNumber(plan, "bytes", "/NOBUNDLE\""), 300);
+  EXPECT_NE(plan.find("\"resumedFromMarker\": true"), std::string::npos);
+  EXPECT_NE(plan.find("\"enough\": true"), std::string::npos);
+  EXPECT_EQ(plan.find("\"problem\": \""), std::string::npos) << "harbors the registry takes have no problem";
+
+  const std::string report = dir_ / "report.json";
+  ASSERT_EQ(run({"transvale", "--root", image_, "--report", report}), kExitSuccess) << err();
+  // Progress lines (standard error is no terminal): entries, then bytes of
+  // the data to move, all of them at the end.
+  char all[32];
+  std::snprintf(all, sizeof all, "%.1f kB", static_cast<double>(manifestTotal(image_, "Bytes")) / 1000);
+  EXPECT_NE(err().find("progress: 100% (15/15 entries, " + std::string(all) + " of " + all + ")\n"), std::string::npos) << err();
+  const std::string json = readFile(report);
+  const std::pair<const char*, long long> outcomes[] = {
+      {"migrated", 12}, {"kept", 0}, {"failed", 0}, {"removed", 3}};
+  for (const auto& [key, count] : outcomes) EXPECT_EQ(jsonNumber(json, key, "\"totals\""), count) << key;
+  EXPECT_EQ(jsonNumber(json, "exitStatus"), 0);
+  EXPECT_EQ(jsonNumber(json, "bytesMoved", "\"totals\""), manifestTotal(image_, "Bytes"));
+  EXPECT_EQ(jsonNumber(json, "filesMoved", "\"totals\""), manifestTotal(image_, "Files"));
+  EXPECT_NE(json.find("\"reason\": \"no application or VPN plug-in bundle\""), std::string::npos);
+  EXPECT_NE(out().find("transvale: migration succeeded: 12 migrated, 0 kept, 0 failed, 3 removed"),
+            std::string::npos) << out();
+  expectMigratedAndVerified();
+}
+
+// A tmpfs mounted over the new containers, too small for one application's data.
+class SmallDestination {
+ public:
+  SmallDestination(const std::string& path, const char* size) : path_(path) {
+    EXPECT_TRUE(makeDirs(path));
+    mounted_ = mount("tmpfs", path.c_str(), "tmpfs", 0, (std::string("size=") + size).c_str()) == 0;
+  }
+  ~SmallDestination() {
+    if (mounted_) {
+      EXPECT_EQ(umount2(path_.c_str(), MNT_DETACH), 0);
+    }
+  }
+  bool mounted() const { return mounted_; }
+
+ private:
+  std::string path_;
+  bool mounted_ = false;
+};
+
+TEST_F(Migration, DataThatDoesNotFitOnAnotherFileSystemKeepsItsContainer) {
+  createImage({"--apps", "3", "--groups", "1", "--files-per-app", "2", "--bytes-per-file", "1000", "--seed", "4"});
+  std::string big;
+  for (const std::string& path : entriesOf(oldApplications())) {
+    if (fs::is_directory(path + "/Documents")) big = path;
+  }
+  ASSERT_FALSE(big.empty());
+  constexpr size_t kBigFile = 6u << 20;
+  ASSERT_TRUE(writeFile(big + "/Documents/big.bin", std::string(kBigFile, 'z')));
+  SmallDestination destination(image_ + "/private/var/mobile/Containers", "4m");
+  if (!destination.mounted()) GTEST_SKIP() << "cannot mount a tmpfs here";
+
+  ASSERT_EQ(run({"transvale", "--root", image_, "--plan"}), kExitSuccess) << err();
+  EXPECT_NE(out().find("another file system: copied, then removed"), std::string::npos) << out();
+  EXPECT_NE(out().find(": NOT ENOUGH"), std::string::npos) << out();
+
+  const std::string report = dir_ / "report.json";
+  EXPECT_EQ(run({"transvale", "--root", image_, "--progress", "never", "--report", report}), kExitRunFailed);
+  const std::string log = readFile(image_ + kDefaultLog);
+  EXPECT_NE(log.find("QSAppMigrator: Not enough room at " + image_ + "/private/var/mobile/Containers/Data/Application/"),
+            std::string::npos);
+  EXPECT_NE(log.find("bytes needed (with margin), "), std::string::npos);
+  // The container stays whole; no partial copy was started; the others moved.
+  EXPECT_EQ(entriesOf(oldApplications()), std::vector<std::string>{big});
+  EXPECT_EQ(fs::file_size(big + "/Documents/big.bin"), kBigFile);
+  for (auto it = fs::recursive_directory_iterator(image_ + "/private/var/mobile/Containers");
+       it != fs::recursive_directory_iterator(); ++it) {
+    EXPECT_NE(it->path().filename(), "big.bin") << it->path();
+  }
+  const std::string json = readFile(report);
+  EXPECT_EQ(jsonNumber(json, "kept", "\"totals\""), 1);
+  EXPECT_EQ(jsonNumber(json, "migrated", "\"totals\""), 2);
+  EXPECT_NE(json.find("\"reason\": \"QSAppMigrator: Not enough room at "), std::string::npos) << json;
 }
 
 }  // namespace
