@@ -42,8 +42,8 @@ constexpr ChildRule kChildRules[] = {
      "QSAppMigrator: Migration marker was symlink; skipping container %@", true,
      "its migration marker is a symbolic link"},
 };
-constexpr char kApplicationBundleExtension[] = "app";
-constexpr char kVPNPluginBundleExtension[] = "vpnplugin";
+using platform::kApplicationBundleExtension;
+using platform::kVPNPluginBundleExtension;
 
 const ChildRule* ruleForChild(const URL& child) {
   const std::string extension = child.pathExtension();

@@ -101,7 +101,7 @@ bool QSAppMigrator::_migrateGroupContainer(const std::string& identifier, const 
     return true;
   }
   const URL oldContainer = URL::fileURL(*path->asString(), true);
-  if (!_groupContainerPathIsAcceptable(oldContainer, group)) return;
+  if (!_groupContainerPathIsAcceptable(oldContainer, group)) return true;  // left where it is, logged
   const QSFileManager& fm = QSFileManager::defaultManager();
   if (!fm.itemExistsAtURL(oldContainer)) {
     QSAM_LOG(kQSLogLevelError, kMigrateFunction, "QSAppMigrator: Missing source group container at %@",

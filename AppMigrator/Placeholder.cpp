@@ -21,8 +21,8 @@ constexpr char kPlaceholderFunction[] =
     "-[QSAppMigrator _stageAndInstallPlaceholderForBundleAtURL:withIdentifier:inContainerURL:]";
 constexpr char kIconFunction[] = "-[QSAppMigrator _writeIconForBundle:toURL:]";
 constexpr char kStagedPlaceholdersDirectoryName[] = "com.vantrel.quill.set.migrator";
-constexpr char kBundleExtension[] = "app";
-constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
+using platform::kStoreMetadataFileName;
+constexpr const char* kBundleExtension = platform::kApplicationBundleExtension;
 constexpr size_t kSingleImage = 1;
 // The staged bundle's files are written whole (atomically) but not flushed:
 // the registry copies them, flushing its copy before it records it, and the

@@ -32,6 +32,7 @@
 #include "Platform/Registry/ApplicationRegistry.h"
 #include "Platform/Registry/InstallationDaemon.h"
 #include "Platform/SystemVersion.h"
+#include "Shared/Support/QSLayoutNames.h"
 
 // What the migrator needs of the operating system. The pointers are not owned
 // and must outlive the migrator.
@@ -259,16 +260,7 @@ inline constexpr char kQSContainerTypeKey[] = "ContainerType";
 inline constexpr char kQSSecondBundlePathKey[] = "SecondBundlePath";
 inline constexpr char kQSContainerTypeApp[] = "App";
 inline constexpr char kQSContainerTypeVPNBundle[] = "VPNBundle";
-inline constexpr char kQSMigrationMarkerFileName[] = "com.vantrel.quill.set.container_migrator.plist";
-inline constexpr char kQSSafeHarborMapFileName[] = "SafeHarbor.plist";
-// The old layout's install map, its group-container entries, and the safe-harbor entries.
-inline constexpr char kQSInstallMapGroupContainersKey[] = "GroupContainers";
-inline constexpr char kQSGroupContainerPathKey[] = "Container";
-inline constexpr char kQSHarborPathKey[] = "HarborPathKey";
-// The last-system-version record in the data directory.
-inline constexpr char kQSLastSystemVersionFileName[] = "AppMigratorLastSystemVersion.plist";
-// A note the previous release may leave among the containers; not a container.
-inline constexpr char kQSOldApplicationsNoteFileName[] = "WhereDidMyApplicationsGo.txt";
+// The layout's file names and keys are in Shared/Support/QSLayoutNames.h.
 
 // Writes one HostLog line of the migrator: category "Transvaler", the calling
 // file and line, and `function` (the operation's full name).

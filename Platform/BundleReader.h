@@ -30,6 +30,9 @@ inline constexpr char kNoDataContainerKey[] = "RkNoDataContainer";
 // Added by the reader to the info dictionary: the Info.plist's own URL.
 inline constexpr char kBundleInfoPlistURLKey[] = "RkBundleInfoPlistURL";
 inline constexpr char kInfoPlistFileName[] = "Info.plist";
+// Path extensions of application bundles and VPN plug-in bundles.
+inline constexpr char kApplicationBundleExtension[] = "app";
+inline constexpr char kVPNPluginBundleExtension[] = "vpnplugin";
 
 // An open bundle: its location and its info dictionary as read at opening
 // (none when the Info.plist could not be read as a dictionary).

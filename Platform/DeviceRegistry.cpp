@@ -8,6 +8,8 @@
 #include <cstdlib>
 #include <memory>
 
+#include "Platform/FileSystem.h"
+#include "Platform/PosixHandles.h"
 #include "Platform/ReadOnlyFile.h"
 
 namespace platform {
@@ -26,16 +28,6 @@ constexpr char kMountInfoSeparator[] = "-";
 constexpr size_t kMountInfoMountPointField = 4;
 constexpr size_t kMountInfoFirstOptionalField = 6;
 constexpr size_t kMountTableReadChunk = 16384;
-
-struct DirCloser {
-  void operator()(DIR* d) const { closedir(d); }
-};
-using DirHandle = std::unique_ptr<DIR, DirCloser>;
-
-bool isDirectory(const std::string& path) {
-  struct stat status {};
-  return stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
-}
 
 bool exists(const std::string& path) {
   struct stat status {};
@@ -57,8 +49,8 @@ std::optional<unsigned long> numberAfter(std::string_view name, std::string_view
 // Names in `directory` of the form prefix + number, ordered by number; none
 // with errno when the directory cannot be read.
 std::optional<std::vector<std::string>> numberedEntries(const std::string& directory, const std::string& prefix) {
-  DirHandle dir(opendir(directory.c_str()));
-  if (!dir) return std::nullopt;
+  ScopedDIR dir(opendir(directory.c_str()));
+  if (!dir.valid()) return std::nullopt;
   std::vector<std::pair<unsigned long, std::string>> found;
   errno = 0;
   while (dirent* entry = readdir(dir.get())) {

@@ -3,7 +3,6 @@
 #include <cairo.h>
 #include <png.h>
 
-#include <csetjmp>
 #include <cstring>
 #include <numbers>
 
@@ -16,14 +15,10 @@ namespace {
 // Corner radius of the home-screen mask, as a fraction of the icon's side.
 constexpr double kIconCornerRadiusFraction = 0.225;
 constexpr int kBytesPerPixel = 4;
-constexpr int kBitsPerChannel = 8;
+// libpng's fast compression (no filters, a low zlib level): icons are small
+// and made by the thousand.
+constexpr png_uint_32 kPNGCompressionFlags = PNG_IMAGE_FLAG_FAST;
 constexpr uint8_t kOpaqueAlpha = 255;
-// A home-screen icon is a few tens of kilobytes of pixels, encoded once and
-// read rarely: the fastest zlib level and one fixed row filter (Paeth suits
-// drawn images) cost a fraction of the default search over every filter at
-// level 6, for a file a little larger.
-constexpr int kPNGCompressionLevel = 1;
-constexpr int kPNGRowFilters = PNG_FILTER_PAETH;
 // Largest side of an icon image that is decoded (an icon is shown at 120).
 constexpr uint32_t kIconDimensionLimit = 4096;
 
@@ -160,58 +155,6 @@ Image toStraightRGBA(cairo_surface_t* surface) {
   return image;
 }
 
-// --- libpng --------------------------------------------------------------------
-
-// The write structure and its info structure, destroyed together.
-class PNGWriter {
- public:
-  PNGWriter() {
-    png_ = png_create_write_struct(PNG_LIBPNG_VER_STRING, nullptr, &PNGWriter::onError, &PNGWriter::onWarning);
-    if (png_) info_ = png_create_info_struct(png_);
-  }
-  ~PNGWriter() {
-    if (png_) png_destroy_write_struct(&png_, info_ ? &info_ : nullptr);
-  }
-  PNGWriter(const PNGWriter&) = delete;
-  PNGWriter& operator=(const PNGWriter&) = delete;
-
-  bool valid() const { return png_ && info_; }
-  png_structp png() const { return png_; }
-  png_infop info() const { return info_; }
-
- private:
-  // libpng must not return from its error handler: go back to the setjmp of
-  // writeRows.
-  static void onError(png_structp png, png_const_charp) { png_longjmp(png, 1); }
-  static void onWarning(png_structp, png_const_charp) {}
-
-  png_structp png_ = nullptr;
-  png_infop info_ = nullptr;
-};
-
-void appendToBuffer(png_structp png, png_bytep bytes, png_size_t length) {
-  auto* buffer = static_cast<Data*>(png_get_io_ptr(png));
-  buffer->insert(buffer->end(), bytes, bytes + length);
-}
-
-void flushNothing(png_structp) {}
-
-// Encodes the image; every object with a destructor lives in the caller, so
-// that a longjmp from libpng skips none.
-bool writeRows(PNGWriter& writer, const Image& image, png_bytep* rows, Data& buffer) {
-  if (setjmp(png_jmpbuf(writer.png()))) return false;
-  png_set_write_fn(writer.png(), &buffer, &appendToBuffer, &flushNothing);
-  png_set_compression_level(writer.png(), kPNGCompressionLevel);
-  png_set_filter(writer.png(), PNG_FILTER_TYPE_BASE, kPNGRowFilters);
-  png_set_IHDR(writer.png(), writer.info(), static_cast<png_uint_32>(image.width),
-               static_cast<png_uint_32>(image.height), kBitsPerChannel, PNG_COLOR_TYPE_RGB_ALPHA, PNG_INTERLACE_NONE,
-               PNG_COMPRESSION_TYPE_DEFAULT, PNG_FILTER_TYPE_DEFAULT);
-  png_write_info(writer.png(), writer.info());
-  png_write_image(writer.png(), rows);
-  png_write_end(writer.png(), writer.info());
-  return true;
-}
-
 class PNGImageEncoder final : public ImageEncoder {
  public:
   explicit PNGImageEncoder(Data& buffer) : buffer_(buffer) {}
@@ -221,21 +164,9 @@ class PNGImageEncoder final : public ImageEncoder {
   bool finalize() override {
     if (images_.size() != 1) return false;
     const Image& image = images_.front();
-    if (image.width <= 0 || image.height <= 0 ||
-        image.rgba.size() != static_cast<size_t>(image.width) * image.height * kBytesPerPixel) {
-      return false;
-    }
-    std::vector<png_bytep> rows(static_cast<size_t>(image.height));
-    const size_t rowBytes = static_cast<size_t>(image.width) * kBytesPerPixel;
-    for (size_t y = 0; y < rows.size(); ++y) {
-      // libpng takes non-const rows but only reads them when writing.
-      rows[y] = const_cast<png_bytep>(image.rgba.data() + y * rowBytes);
-    }
-    PNGWriter writer;
-    if (!writer.valid()) return false;
-    Data encoded;
-    if (!writeRows(writer, image, rows.data(), encoded)) return false;
-    buffer_.insert(buffer_.end(), encoded.begin(), encoded.end());
+    std::optional<Data> encoded = encodePNG(image);
+    if (!encoded) return false;
+    buffer_.insert(buffer_.end(), encoded->begin(), encoded->end());
     return true;
   }
 
@@ -245,6 +176,28 @@ class PNGImageEncoder final : public ImageEncoder {
 };
 
 }  // namespace
+
+std::optional<Data> encodePNG(const Image& image) {
+  if (image.width <= 0 || image.height <= 0 ||
+      image.rgba.size() != static_cast<size_t>(image.width) * static_cast<size_t>(image.height) * kBytesPerPixel) {
+    return std::nullopt;
+  }
+  png_image description{};
+  description.version = PNG_IMAGE_VERSION;
+  description.width = static_cast<png_uint_32>(image.width);
+  description.height = static_cast<png_uint_32>(image.height);
+  description.format = PNG_FORMAT_RGBA;
+  description.flags = kPNGCompressionFlags;
+  // The largest encoding there can be, so that libpng compresses once.
+  Data encoded(PNG_IMAGE_PNG_SIZE_MAX(description));
+  png_alloc_size_t size = encoded.size();
+  const bool written = png_image_write_to_memory(&description, encoded.data(), &size, 0, image.rgba.data(),
+                                                 0 /* rows are packed */, nullptr) != 0;
+  png_image_free(&description);
+  if (!written) return std::nullopt;
+  encoded.resize(size);
+  return encoded;
+}
 
 std::optional<Image> CairoIconRenderer::homeScreenIconForBundle(const Bundle& bundle) {
   const std::optional<std::string> name = iconFileName(bundle);

@@ -31,6 +31,10 @@ struct Image {
   std::vector<uint8_t> rgba;  // width * height * 4 bytes
 };
 
+// The PNG encoding of `image` (libpng), or none when its pixels do not match
+// its size or libpng fails.
+std::optional<Data> encodePNG(const Image& image);
+
 class IconRenderer {
  public:
   virtual ~IconRenderer() = default;
@@ -43,7 +47,7 @@ class ImageEncoder {
   virtual ~ImageEncoder() = default;
   virtual void addImage(const Image& image) = 0;
   // True when the encoded data has been written into the buffer.
-  virtual bool finalize() = 0;
+  [[nodiscard]] virtual bool finalize() = 0;
 };
 
 class ImageEncoding {

@@ -24,7 +24,7 @@ class ReadOnlyFile {
   bool isOpen() const { return fd_ >= 0; }
 
   // The open file's size in bytes (fstat); false with errno on failure.
-  bool size(int64_t* bytes) const;
+  [[nodiscard]] bool size(int64_t* bytes) const;
 
   // read(2): the number of bytes read, 0 at the end of the file, -1 with
   // errno on failure. Interrupted reads are retried.

@@ -12,6 +12,7 @@
 
 #include "Platform/Foundation/FileErrors.h"
 #include "Platform/Foundation/PropertyList.h"
+#include "Platform/PosixHandles.h"
 
 namespace platform::plist {
 
@@ -26,28 +27,8 @@ constexpr size_t kReadChunk = 64 * 1024;
 constexpr size_t kTempNameStemLimit = 200;
 constexpr char kTempSuffix[] = ".XXXXXX";
 
-// An owned descriptor, closed on destruction (the close error of a write
-// must be checked: use close()).
-class UniqueFd {
- public:
-  explicit UniqueFd(int fd = -1) : fd_(fd) {}
-  ~UniqueFd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  UniqueFd(const UniqueFd&) = delete;
-  UniqueFd& operator=(const UniqueFd&) = delete;
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-  // Closes now; false with errno set when close reports an error.
-  bool close() {
-    int fd = fd_;
-    fd_ = -1;
-    return ::close(fd) == 0;
-  }
-
- private:
-  int fd_;
-};
+// The close error of a write must be checked: use close().
+using UniqueFd = ScopedFD;
 
 // A file that is unlinked when the object goes away, unless kept.
 class TempFileGuard {

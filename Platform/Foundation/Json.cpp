@@ -3,49 +3,22 @@
 #include <cmath>
 #include <cstdio>
 
+#include "Platform/Foundation/Text.h"
+
 namespace platform {
 
 namespace {
 
-constexpr char kHex[] = "0123456789abcdef";
 // First code unit of the escapes that stand for bytes that are not UTF-8.
 constexpr unsigned kSurrogateEscapeBase = 0xDC00;
 constexpr unsigned char kDelete = 0x7F;
 constexpr unsigned char kFirstPrintable = 0x20;
 constexpr int kIndentWidth = 2;
 
-// Length of the well-formed UTF-8 sequence starting at bytes[i] (no overlong
-// forms, no surrogates, nothing above U+10FFFF), else 0.
-size_t validUTF8SequenceLength(std::string_view bytes, size_t i) {
-  const auto byte = [&](size_t k) { return static_cast<unsigned char>(bytes[k]); };
-  const unsigned char lead = byte(i);
-  if (lead < 0x80) return 1;
-  size_t length = 0;
-  unsigned char low = 0x80, high = 0xBF;  // range of the second byte
-  if (lead >= 0xC2 && lead <= 0xDF) {
-    length = 2;
-  } else if (lead >= 0xE0 && lead <= 0xEF) {
-    length = 3;
-    if (lead == 0xE0) low = 0xA0;
-    if (lead == 0xED) high = 0x9F;
-  } else if (lead >= 0xF0 && lead <= 0xF4) {
-    length = 4;
-    if (lead == 0xF0) low = 0x90;
-    if (lead == 0xF4) high = 0x8F;
-  } else {
-    return 0;
-  }
-  if (i + length > bytes.size()) return 0;
-  if (byte(i + 1) < low || byte(i + 1) > high) return 0;
-  for (size_t k = 2; k < length; ++k) {
-    if (byte(i + k) < 0x80 || byte(i + k) > 0xBF) return 0;
-  }
-  return length;
-}
-
 void appendUnicodeEscape(std::string& out, unsigned value) {
   out += "\\u";
-  for (int shift = 12; shift >= 0; shift -= 4) out += kHex[(value >> shift) & 0xF];
+  appendHex(out, static_cast<uint8_t>(value >> 8));
+  appendHex(out, static_cast<uint8_t>(value));
 }
 
 }  // namespace
@@ -56,7 +29,7 @@ std::string jsonQuoted(std::string_view bytes) {
   out += '"';
   for (size_t i = 0; i < bytes.size();) {
     const auto c = static_cast<unsigned char>(bytes[i]);
-    const size_t length = validUTF8SequenceLength(bytes, i);
+    const size_t length = utf8SequenceLength(bytes, i);
     if (length == 0) {
       appendUnicodeEscape(out, kSurrogateEscapeBase + c);
       ++i;

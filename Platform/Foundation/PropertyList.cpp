@@ -20,6 +20,7 @@
 
 #include "Platform/Foundation/FileErrors.h"
 #include "Platform/Foundation/PropertyListCheck.h"
+#include "Platform/Foundation/Text.h"
 
 namespace platform::plist {
 
@@ -55,28 +56,6 @@ struct BinaryFree {
 };
 
 std::string_view formatName(Format format) { return format == Format::XML ? "XML" : "binary"; }
-
-// Whether `s` is well-formed UTF-8 (no overlong forms, no surrogates, nothing
-// beyond U+10FFFF): binary property lists store text as ASCII or UTF-16 and
-// cannot keep other bytes.
-bool isValidUTF8(std::string_view s) {
-  size_t i = 0;
-  while (i < s.size()) {
-    unsigned char c = static_cast<unsigned char>(s[i]);
-    size_t extra = c < 0x80 ? 0 : (c >> 5) == 0x6 ? 1 : (c >> 4) == 0xE ? 2 : (c >> 3) == 0x1E ? 3 : 4;
-    if (extra == 4 || s.size() - i <= extra) return false;
-    uint32_t code = extra == 0 ? c : c & (0x3F >> extra);
-    for (size_t k = 1; k <= extra; ++k) {
-      unsigned char next = static_cast<unsigned char>(s[i + k]);
-      if ((next & 0xC0) != 0x80) return false;
-      code = (code << 6) | (next & 0x3F);
-    }
-    static constexpr uint32_t kSmallest[] = {0, 0x80, 0x800, 0x10000};
-    if (code < kSmallest[extra] || code > 0x10FFFF || (code >= 0xD800 && code <= 0xDFFF)) return false;
-    i += extra + 1;
-  }
-  return true;
-}
 
 // ---- libplist nodes to Values ----
 

@@ -74,13 +74,13 @@ std::optional<Dictionary> readDictionary(const URL& url, const ReadOptions& opti
 // Serialises a Value. Null Values, URLs and Errors cannot be serialised (an
 // error); a URL nested inside is written as its path string.
 std::optional<Data> serialize(const Value& value, Format format, Error* error = nullptr);
-bool writeFile(const Value& value, const URL& url, Format format = Format::XML, bool atomically = true,
+[[nodiscard]] bool writeFile(const Value& value, const URL& url, Format format = Format::XML, bool atomically = true,
                Error* error = nullptr);
 
 // A dictionary whose entries are written in the order given (a Dictionary is
 // ordered by key). Later duplicates of a key replace earlier ones in place.
 using OrderedEntries = std::vector<std::pair<std::string, Value>>;
-bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Format format = Format::XML,
+[[nodiscard]] bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Format format = Format::XML,
                             bool atomically = true, Error* error = nullptr,
                             Durability durability = Durability::Flushed);
 
@@ -92,7 +92,7 @@ bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Forma
 std::optional<Data> readFileBytes(const URL& url, Error* error = nullptr);
 std::optional<Data> readFileBytes(const URL& url, const ReadOptions& options, Error* error = nullptr);
 // Writes bytes, atomically when asked (temporary file, fsync, rename).
-bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error = nullptr,
+[[nodiscard]] bool writeFileBytes(const Data& data, const URL& url, bool atomically, Error* error = nullptr,
                     Durability durability = Durability::Flushed);
 
 }  // namespace platform::plist

@@ -3,13 +3,15 @@
 // libplist's XML reader lets malformed documents through: an integer element
 // whose text is not a number reads as 0, a dictionary key without a value is
 // dropped, text after the root and a missing "</plist>" are ignored. This
-// check runs before libplist sees the text and refuses such documents. It
-// accepts everything a well-formed property list may hold: an XML declaration,
-// a document type declaration (with an internal subset), comments, processing
-// instructions, CDATA sections, character and the predefined entity
-// references, attributes, empty-element tags, and a root value with or
-// without the enclosing <plist> element. A NUL character, which XML does not
-// allow, is refused too.
+// check runs before libplist sees the text and refuses such documents. expat
+// reads the XML, so everything well-formed XML may hold is accepted: an XML
+// declaration, a document type declaration (with an internal subset),
+// comments, processing instructions, CDATA sections, character and the
+// predefined entity references, attributes, empty-element tags, and a root
+// value with or without the enclosing <plist> element. Entities are neither
+// expanded nor fetched: a reference to any but the predefined ones is
+// refused. Bytes that are not UTF-8 are kept as they are, as libplist reads
+// them; a NUL character, which XML does not allow, is refused.
 //
 // libplist's binary reader aborts the process (a failed assertion) when
 // asked for a dictionary key that holds a NUL character (and cuts other
@@ -39,10 +41,11 @@ struct XMLCheck {
   // wrong and where ("integer element holds \"abc\", which is not valid
   // (byte 120)").
   std::optional<std::string> problem;
-  // The text libplist is to read when it differs from the document: decimal
-  // integers written with leading zeros, which libplist would take for octal
-  // ("010" as 8, "08" as 0), rewritten without them. Empty when the document
-  // itself will do.
+  // The text libplist is to read when it differs from the document: the text
+  // of numbers, dates and data that holds references, comments or CDATA
+  // sections, rewritten as this check read it, and decimal integers written
+  // with leading zeros, which libplist would take for octal ("010" as 8, "08"
+  // as 0), rewritten without them. Empty when the document itself will do.
   std::string rewritten;
 };
 

@@ -1,9 +1,14 @@
-// The XML half of PropertyListCheck.h: a recursive-descent reader of the
-// property-list subset of XML.
+// The XML half of PropertyListCheck.h: expat reads the XML, the handlers
+// below hold what it reports to the property-list subset.
 #include "Platform/Foundation/PropertyListCheck.h"
 
+#include <expat.h>
+
+#include <algorithm>
 #include <charconv>
+#include <climits>
 #include <cstdint>
+#include <memory>
 #include <system_error>
 #include <vector>
 
@@ -11,23 +16,29 @@ namespace platform::plist::detail {
 
 namespace {
 
-constexpr std::string_view kCommentOpen = "<!--";
-constexpr std::string_view kCommentClose = "-->";
-constexpr std::string_view kInstructionOpen = "<?";
-constexpr std::string_view kInstructionClose = "?>";
-constexpr std::string_view kCDATAOpen = "<![CDATA[";
-constexpr std::string_view kCDATAClose = "]]>";
-constexpr std::string_view kDoctypeOpen = "<!DOCTYPE";
 constexpr std::string_view kWhitespace = " \t\r\n";
 constexpr std::string_view kBase64Characters =
     "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/= \t\r\n";
 
-bool isSpace(char c) { return kWhitespace.find(c) != std::string_view::npos; }
-bool isDigit(char c) { return c >= '0' && c <= '9'; }
-bool isHexDigit(char c) { return isDigit(c) || (c >= 'a' && c <= 'f') || (c >= 'A' && c <= 'F'); }
-bool isNameChar(char c) {
-  return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || isDigit(c) || c == '_' || c == ':' || c == '.' ||
-         c == '-' || static_cast<unsigned char>(c) >= 0x80;
+// libplist reads the bytes of a document as they are, whatever encoding it
+// declares, and the XML writer keeps strings that are not UTF-8 as they are.
+// So expat is told that the document is in an encoding of our own, in which
+// ASCII is itself and every other byte (and every control byte, which XML
+// does not allow) is one character of a private-use block; the text handlers
+// turn those characters back into the bytes they stand for.
+constexpr char kByteEncoding[] = "x-quillset-bytes";
+constexpr uint32_t kRawByteBase = 0xF700;  // byte b reads as U+F700 + b
+// expat takes at most INT_MAX bytes a call.
+constexpr size_t kParseChunk = size_t{1} << 30;
+
+bool isSpace(char c) {
+  return kWhitespace.find(c) != std::string_view::npos;
+}
+bool isDigit(char c) {
+  return c >= '0' && c <= '9';
+}
+bool isHexDigit(char c) {
+  return isDigit(c) || (c >= 'a' && c <= 'f') || (c >= 'A' && c <= 'F');
 }
 
 std::string_view trim(std::string_view s) {
@@ -125,16 +136,63 @@ bool isDateText(std::string_view t) {
   return pos == t.size();
 }
 
-bool isBase64Text(std::string_view t) { return t.find_first_not_of(kBase64Characters) == std::string_view::npos; }
+bool isBase64Text(std::string_view t) {
+  return t.find_first_not_of(kBase64Characters) == std::string_view::npos;
+}
 
-struct Tag {
-  std::string_view name;
-  bool closing = false;
-  bool empty = false;  // <name/>
+enum class Element { Plist, Dict, Array, Key, True, False, String, Integer, Real, Date, Data };
+
+constexpr std::pair<std::string_view, Element> kElements[] = {
+    {"plist", Element::Plist}, {"dict", Element::Dict},   {"array", Element::Array},   {"key", Element::Key},
+    {"true", Element::True},   {"false", Element::False}, {"string", Element::String}, {"integer", Element::Integer},
+    {"real", Element::Real},   {"date", Element::Date},   {"data", Element::Data},
 };
 
-// A recursive-descent reader of the property-list subset of XML that records
-// the first problem it meets.
+std::optional<Element> elementNamed(std::string_view name) {
+  for (const auto& [elementName, element] : kElements) {
+    if (elementName == name) return element;
+  }
+  return std::nullopt;
+}
+
+bool isContainer(Element e) {
+  return e == Element::Plist || e == Element::Dict || e == Element::Array;
+}
+
+int XMLCALL byteEncoding(void*, const XML_Char* name, XML_Encoding* info) {
+  if (std::string_view(name) != kByteEncoding) return XML_STATUS_ERROR;
+  for (int b = 0; b < 256; ++b) {
+    const bool xmlCharacter = (b >= 0x20 && b < 0x80) || b == '\t' || b == '\n' || b == '\r';
+    info->map[b] = xmlCharacter ? b : static_cast<int>(kRawByteBase) + b;
+  }
+  info->data = nullptr;
+  info->convert = nullptr;
+  info->release = nullptr;
+  return XML_STATUS_OK;
+}
+
+// Appends UTF-8 `text` that expat reported to *out; with `restoreBytes`, the
+// characters that stand for document bytes become those bytes again (a
+// character reference means the character it names, even one of that block).
+void appendText(std::string_view text, bool restoreBytes, std::string* out) {
+  for (size_t i = 0; i < text.size();) {
+    // U+F700 to U+F7FF are EF 9C 80 to EF 9F BF.
+    const auto lead = static_cast<unsigned char>(text[i]);
+    if (restoreBytes && lead == 0xEF && i + 2 < text.size()) {
+      const uint32_t c = ((lead & 0x0Fu) << 12) | ((static_cast<unsigned char>(text[i + 1]) & 0x3Fu) << 6) |
+                         (static_cast<unsigned char>(text[i + 2]) & 0x3Fu);
+      if (c >= kRawByteBase && c <= kRawByteBase + 0xFF) {
+        *out += static_cast<char>(c - kRawByteBase);
+        i += 3;
+        continue;
+      }
+    }
+    *out += text[i++];
+  }
+}
+
+// Holds expat's events to the property-list subset and records the first
+// problem it meets, after which the parser is stopped.
 class Checker {
  public:
   explicit Checker(std::string_view text) : s_(text) {}
@@ -144,304 +202,220 @@ class Checker {
     if (size_t nul = s_.find('\0'); nul != std::string_view::npos) {
       return {"a NUL character (byte " + std::to_string(nul) + ")", {}};
     }
-    if (skipMisc() && skipDoctype() && skipMisc() && document() && skipMisc()) {
-      if (pos_ == s_.size()) return {std::nullopt, rewritten()};
-      fail("content after the end of the property list");
+    std::unique_ptr<XML_ParserStruct, decltype(&XML_ParserFree)> parser(XML_ParserCreate(kByteEncoding),
+                                                                        XML_ParserFree);
+    if (!parser) return {std::string("out of memory for the XML reader"), {}};
+    parser_ = parser.get();
+    XML_SetUnknownEncodingHandler(parser_, byteEncoding, nullptr);
+    XML_SetUserData(parser_, this);
+    XML_SetElementHandler(parser_, &Checker::onStart, &Checker::onEnd);
+    XML_SetCharacterDataHandler(parser_, &Checker::onText);
+    XML_SetCdataSectionHandler(parser_, &Checker::onCDATAStart, &Checker::onCDATAEnd);
+    // A default handler turns off the expansion of internal entities; their
+    // references, and those of undeclared entities, reach the skipped-entity
+    // handler, which refuses them. External entities are never read.
+    XML_SetDefaultHandler(parser_, [](void*, const XML_Char*, int) {});
+    XML_SetSkippedEntityHandler(parser_, &Checker::onSkippedEntity);
+    XML_SetExternalEntityRefHandler(parser_, &Checker::onExternalEntity);
+    XML_SetParamEntityParsing(parser_, XML_PARAM_ENTITY_PARSING_NEVER);
+
+    XML_Status status = XML_STATUS_OK;
+    for (size_t done = 0; status == XML_STATUS_OK && done < s_.size();) {
+      const size_t length = std::min(kParseChunk, s_.size() - done);
+      status = XML_Parse(parser_, s_.data() + done, static_cast<int>(length), done + length == s_.size());
+      done += length;
     }
+    if (status != XML_STATUS_OK && problem_.empty()) parseError();
+    if (problem_.empty()) return {std::nullopt, rewritten()};
     return {problem_ + " (byte " + std::to_string(problemOffset_) + ")", {}};
   }
 
  private:
-  bool fail(std::string message) {
-    if (problem_.empty()) {
-      problem_ = std::move(message);
-      problemOffset_ = pos_;
-    }
-    return false;
+  struct Frame {
+    Element element;
+    std::string text;         // a leaf's text; a dictionary's key that waits for its value
+    bool holdsValue = false;  // <plist>: its value has begun; a dictionary: a key waits for its value
+    size_t contentStart = 0;  // byte offset just past the start tag
+  };
+
+  static Checker& self(void* data) { return *static_cast<Checker*>(data); }
+  size_t offset() const {
+    const XML_Index index = XML_GetCurrentByteIndex(parser_);
+    return index < 0 ? s_.size() : static_cast<size_t>(index);
   }
 
-  bool atEnd() const { return pos_ >= s_.size(); }
-  bool startsWith(std::string_view prefix) const { return s_.substr(pos_).starts_with(prefix); }
-  void skipSpace() {
-    while (!atEnd() && isSpace(s_[pos_])) ++pos_;
+  void fail(std::string message, std::optional<size_t> at = std::nullopt) {
+    if (!problem_.empty()) return;
+    problem_ = std::move(message);
+    problemOffset_ = at ? *at : offset();
+    (void)XML_StopParser(parser_, XML_FALSE);  // fails only when parsing already ended
   }
 
-  // Moves past `terminator`, which must follow.
-  bool skipPast(std::string_view terminator, const char* what) {
-    size_t end = s_.find(terminator, pos_);
-    if (end == std::string_view::npos) {
-      pos_ = s_.size();
-      return fail(std::string("unterminated ") + what);
-    }
-    pos_ = end + terminator.size();
-    return true;
-  }
-
-  // Whitespace, comments and processing instructions (the XML declaration is
-  // one of them).
-  bool skipMisc() {
-    for (;;) {
-      skipSpace();
-      if (startsWith(kCommentOpen)) {
-        pos_ += kCommentOpen.size();
-        if (!skipPast(kCommentClose, "comment")) return false;
-      } else if (startsWith(kInstructionOpen)) {
-        pos_ += kInstructionOpen.size();
-        if (!skipPast(kInstructionClose, "processing instruction")) return false;
-      } else {
-        return true;
+  // What expat itself refused, in the words the handlers use where they apply.
+  void parseError() {
+    const size_t at = offset();
+    switch (XML_GetErrorCode(parser_)) {
+      case XML_ERROR_NO_ELEMENTS:
+      case XML_ERROR_UNCLOSED_TOKEN:
+      case XML_ERROR_PARTIAL_CHAR:
+      case XML_ERROR_UNCLOSED_CDATA_SECTION:
+        if (stack_.size() == 1 && stack_[0].element == Element::Plist && stack_[0].holdsValue) {
+          return fail("missing </plist>", s_.size());
+        }
+        return fail("unexpected end of the document", s_.size());
+      case XML_ERROR_JUNK_AFTER_DOC_ELEMENT:
+        return fail("content after the end of the property list", at);
+      case XML_ERROR_UNDEFINED_ENTITY: {
+        static constexpr size_t kNameLimit = 40;
+        const size_t semicolon = s_.find(';', at);
+        const size_t length = semicolon == std::string_view::npos ? kNameLimit : semicolon - at - 1;
+        return fail(entityProblem(s_.substr(at + 1, std::min(length, kNameLimit))), at);
       }
+      default:
+        return fail(std::string("malformed XML: ") + XML_ErrorString(XML_GetErrorCode(parser_)), at);
     }
   }
 
-  // <!DOCTYPE ...>, with quoted literals and an internal subset in brackets.
-  bool skipDoctype() {
-    if (!startsWith(kDoctypeOpen)) return true;
-    pos_ += kDoctypeOpen.size();
-    int brackets = 0;
-    while (!atEnd()) {
-      char c = s_[pos_++];
-      if (c == '"' || c == '\'') {
-        size_t end = s_.find(c, pos_);
-        if (end == std::string_view::npos) break;
-        pos_ = end + 1;
-      } else if (c == '[') {
-        ++brackets;
-      } else if (c == ']') {
-        --brackets;
-      } else if (c == '>' && brackets <= 0) {
-        return true;
+  static std::string entityProblem(std::string_view name) {
+    return "entity reference &" + std::string(name) + "; (only the predefined entities are read)";
+  }
+
+  static void XMLCALL onSkippedEntity(void* data, const XML_Char* name, int isParameterEntity) {
+    if (!isParameterEntity) self(data).fail(entityProblem(name));
+  }
+
+  static int XMLCALL onExternalEntity(XML_Parser parser, const XML_Char*, const XML_Char*, const XML_Char*,
+                                      const XML_Char*) {
+    self(XML_GetUserData(parser)).fail("a reference to an external entity");
+    return XML_STATUS_ERROR;
+  }
+
+  static void XMLCALL onStart(void* data, const XML_Char* name, const XML_Char**) { self(data).start(name); }
+  static void XMLCALL onEnd(void* data, const XML_Char*) { self(data).end(); }
+  static void XMLCALL onText(void* data, const XML_Char* text, int length) {
+    self(data).text(std::string_view(text, static_cast<size_t>(length)));
+  }
+  static void XMLCALL onCDATAStart(void* data) { self(data).cdataStart(); }
+  static void XMLCALL onCDATAEnd(void* data) { self(data).inCDATA_ = false; }
+
+  // expat may report an event or two after the parser was stopped; they are
+  // ignored.
+  void start(std::string_view name) {
+    if (!problem_.empty()) return;
+    const std::optional<Element> element = elementNamed(name);
+    const std::string tag = "<" + std::string(name) + ">";
+    if (!element || (*element == Element::Plist && !stack_.empty())) return fail("unknown element " + tag);
+    if (!stack_.empty()) {
+      Frame& parent = stack_.back();
+      if (!isContainer(parent.element)) {
+        return fail(tag + " where </" + std::string(nameOf(parent.element)) + "> was expected");
       }
-    }
-    return fail("unterminated document type declaration");
-  }
-
-  bool readName(std::string_view* name) {
-    size_t start = pos_;
-    while (!atEnd() && isNameChar(s_[pos_])) ++pos_;
-    if (pos_ == start) return fail("malformed tag");
-    *name = s_.substr(start, pos_ - start);
-    return true;
-  }
-
-  bool readAttributes() {
-    for (;;) {
-      skipSpace();
-      if (atEnd()) return fail("unterminated tag");
-      if (s_[pos_] == '>' || s_[pos_] == '/') return true;
-      std::string_view attribute;
-      if (!readName(&attribute)) return false;
-      skipSpace();
-      if (!expectChar(s_, pos_, '=')) return fail("attribute without a value");
-      skipSpace();
-      if (atEnd() || (s_[pos_] != '"' && s_[pos_] != '\'')) return fail("unquoted attribute value");
-      char quote = s_[pos_++];
-      size_t end = s_.find(quote, pos_);
-      if (end == std::string_view::npos) return fail("unterminated attribute value");
-      pos_ = end + 1;
-    }
-  }
-
-  bool readTag(Tag* tag) {
-    if (atEnd()) return fail("unexpected end of the document");
-    if (s_[pos_] != '<') return fail("text where an element was expected");
-    ++pos_;
-    *tag = Tag{};
-    if (!atEnd() && s_[pos_] == '/') {
-      tag->closing = true;
-      ++pos_;
-    }
-    if (!readName(&tag->name)) return false;
-    if (tag->closing) {
-      skipSpace();
-    } else if (!readAttributes()) {
-      return false;
-    }
-    if (!tag->closing && startsWith("/>")) {
-      tag->empty = true;
-      pos_ += 2;
-      return true;
-    }
-    if (!expectChar(s_, pos_, '>')) return fail("malformed tag <" + std::string(tag->name) + ">");
-    return true;
-  }
-
-  bool expectClosing(std::string_view name) {
-    Tag tag;
-    if (!readTag(&tag)) return false;
-    if (!tag.closing || tag.name != name) {
-      return fail(std::string(tag.closing ? "</" : "<") + std::string(tag.name) + "> where </" + std::string(name) +
-                  "> was expected");
-    }
-    return true;
-  }
-
-  // An entity or character reference after '&'; appends what it stands for
-  // (characters beyond ASCII as '?': only numbers and dates are inspected).
-  bool readReference(std::string* out) {
-    size_t end = s_.find(';', pos_);
-    if (end == std::string_view::npos || end - pos_ > 10) return fail("'&' that starts no entity reference");
-    std::string_view ref = s_.substr(pos_, end - pos_);
-    static constexpr std::pair<std::string_view, char> kEntities[] = {
-        {"amp", '&'}, {"lt", '<'}, {"gt", '>'}, {"quot", '"'}, {"apos", '\''}};
-    for (const auto& [name, c] : kEntities) {
-      if (ref == name) {
-        *out += c;
-        pos_ = end + 1;
-        return true;
+      if (parent.element == Element::Plist && parent.holdsValue) return fail(tag + " where </plist> was expected");
+      if (parent.element == Element::Dict && !parent.holdsValue && *element != Element::Key) {
+        return fail(tag + " in a dictionary where <key> was expected");
       }
+      if (parent.element == Element::Dict && parent.holdsValue && *element == Element::Key) {
+        return fail(keyWithoutValue(parent));
+      }
+      if (parent.element != Element::Dict && *element == Element::Key) return fail("<key> outside a dictionary");
+      if (parent.element == Element::Plist) parent.holdsValue = true;
+      if (parent.element == Element::Dict) parent.holdsValue = false;  // a key begins, or the waiting one has its value
     }
-    bool hex = ref.starts_with("#x");
-    std::string_view digits = ref.substr(hex ? 2 : 1);
-    bool numeric = ref.starts_with("#") && !digits.empty();
-    uint32_t code = 0;
-    for (char c : digits) {
-      if (!numeric || (hex ? !isHexDigit(c) : !isDigit(c))) {
-        numeric = false;
+    if (containers_ > kMaxNestingDepth) {
+      return fail("nesting deeper than " + std::to_string(kMaxNestingDepth) + " levels");
+    }
+    if (*element == Element::Dict || *element == Element::Array) ++containers_;
+    stack_.push_back({*element, {}, false, offset() + static_cast<size_t>(XML_GetCurrentByteCount(parser_))});
+  }
+
+  void end() {
+    if (!problem_.empty()) return;
+    Frame frame = std::move(stack_.back());
+    stack_.pop_back();
+    const std::string_view name = nameOf(frame.element);
+    const std::string_view content = trim(frame.text);
+    switch (frame.element) {
+      case Element::Plist:
+        if (!frame.holdsValue) fail("<plist> holds no value");
+        return;
+      case Element::Dict:
+        if (frame.holdsValue) fail(keyWithoutValue(frame));
+        [[fallthrough]];
+      case Element::Array:
+        --containers_;
+        return;
+      case Element::Key:
+        stack_.back().text = std::move(frame.text);
+        stack_.back().holdsValue = true;
+        return;
+      case Element::True:
+      case Element::False:
+        if (!content.empty()) fail("<" + std::string(name) + "> with content");
+        return;
+      case Element::String:
+        return;
+      case Element::Integer:
+      case Element::Real:
+      case Element::Date:
+      case Element::Data:
         break;
-      }
-      code = code * (hex ? 16 : 10) + static_cast<uint32_t>(digitValue(c));
     }
-    if (!numeric || code == 0 || code > 0x10FFFF) return fail("unknown entity reference &" + std::string(ref) + ";");
-    *out += code < 0x80 ? static_cast<char>(code) : '?';
-    pos_ = end + 1;
-    return true;
-  }
-
-  // Character data up to the next tag, with comments, CDATA sections and
-  // references resolved.
-  bool readText(std::string* out) {
-    while (!atEnd()) {
-      char c = s_[pos_];
-      if (c == '<') {
-        if (startsWith(kCommentOpen)) {
-          pos_ += kCommentOpen.size();
-          if (!skipPast(kCommentClose, "comment")) return false;
-          continue;
-        }
-        if (startsWith(kCDATAOpen)) {
-          pos_ += kCDATAOpen.size();
-          size_t end = s_.find(kCDATAClose, pos_);
-          if (end == std::string_view::npos) return fail("unterminated CDATA section");
-          *out += s_.substr(pos_, end - pos_);
-          pos_ = end + kCDATAClose.size();
-          continue;
-        }
-        return true;
-      }
-      ++pos_;
-      if (c == '&') {
-        if (!readReference(out)) return false;
-      } else {
-        *out += c;
-      }
-    }
-    return fail("unexpected end of the document");
-  }
-
-  // The text of a leaf element whose start tag has been read, and the raw
-  // bytes it came from.
-  bool leafText(const Tag& tag, std::string* text, std::string_view* raw = nullptr) {
-    if (tag.empty) return true;
-    size_t start = pos_;
-    if (!readText(text)) return false;
-    if (raw) *raw = s_.substr(start, pos_ - start);
-    return expectClosing(tag.name);
-  }
-
-  // libplist reads integers with strtoull's automatic base, so "010" would
-  // be octal 8 and "08" would be 0. A plain decimal with leading zeros is
-  // noted for rewriting without them.
-  void noteLeadingZeros(std::string_view raw) {
-    if (raw.find_first_of("&<") != std::string_view::npos) return;
-    std::string_view content = trim(raw);
-    size_t digits = !content.empty() && (content.front() == '-' || content.front() == '+') ? 1 : 0;
-    size_t first = digits;
-    while (first + 1 < content.size() && content[first] == '0' && isDigit(content[first + 1])) ++first;
-    if (first == digits) return;
-    size_t offset = static_cast<size_t>(content.data() - s_.data());
-    edits_.push_back({offset, content.size(), std::string(content.substr(0, digits)) + std::string(content.substr(first))});
-  }
-
-  bool document() {
-    size_t start = pos_;
-    Tag tag;
-    if (!readTag(&tag)) return false;
-    if (tag.closing) return fail("</" + std::string(tag.name) + "> without a start tag");
-    if (tag.name != "plist") {
-      pos_ = start;  // a root value without the <plist> element
-      return value(0);
-    }
-    if (tag.empty) return fail("<plist> holds no value");
-    if (!skipMisc()) return false;
-    if (startsWith("</")) return fail("<plist> holds no value");
-    if (!value(0) || !skipMisc()) return false;
-    if (atEnd()) return fail("missing </plist>");
-    return expectClosing("plist");
-  }
-
-  bool value(int depth) {
-    if (depth > kMaxNestingDepth) return fail("nesting deeper than " + std::to_string(kMaxNestingDepth) + " levels");
-    Tag tag;
-    if (!readTag(&tag)) return false;
-    if (tag.closing) return fail("</" + std::string(tag.name) + "> where a value was expected");
-    const std::string_view name = tag.name;
-    if (name == "dict") return dictionary(tag, depth);
-    if (name == "array") return array(tag, depth);
-    if (name == "true" || name == "false") return boolean(tag);
-    if (name == "key") return fail("<key> outside a dictionary");
-    std::string text;
-    if (name == "string") return leafText(tag, &text);
-    if (name != "integer" && name != "real" && name != "date" && name != "data") {
-      return fail("unknown element <" + std::string(name) + ">");
-    }
-    std::string_view raw;
-    if (!leafText(tag, &text, &raw)) return false;
-    std::string_view content = trim(text);
-    bool valid = name == "integer" ? isIntegerText(content)
-                 : name == "real"  ? isRealText(content)
-                 : name == "date"  ? isDateText(content)
-                                   : isBase64Text(content);
+    const bool valid = frame.element == Element::Integer ? isIntegerText(content)
+                       : frame.element == Element::Real  ? isRealText(content)
+                       : frame.element == Element::Date  ? isDateText(content)
+                                                         : isBase64Text(content);
     if (!valid) {
       static constexpr size_t kQuotedTextLimit = 40;
       return fail(std::string(name) + " element holds \"" + std::string(content.substr(0, kQuotedTextLimit)) +
                   "\", which is not valid");
     }
-    if (name == "integer") noteLeadingZeros(raw);
-    return true;
+    noteCanonicalText(frame.element, content, frame.contentStart, offset());
   }
 
-  bool boolean(const Tag& tag) {
-    std::string text;
-    if (!leafText(tag, &text)) return false;
-    if (!trim(text).empty()) return fail("<" + std::string(tag.name) + "> with content");
-    return true;
-  }
-
-  bool dictionary(const Tag& tag, int depth) {
-    if (tag.empty) return true;
-    for (;;) {
-      if (!skipMisc()) return false;
-      if (startsWith("</")) return expectClosing("dict");
-      Tag key;
-      if (!readTag(&key)) return false;
-      if (key.closing || key.name != "key") {
-        return fail("<" + std::string(key.name) + "> in a dictionary where <key> was expected");
-      }
-      std::string keyText;
-      if (!leafText(key, &keyText) || !skipMisc()) return false;
-      if (atEnd() || startsWith("</")) return fail("dictionary key \"" + keyText + "\" has no value");
-      if (!value(depth + 1)) return false;
+  void text(std::string_view text) {
+    if (!problem_.empty() || stack_.empty()) return;
+    Frame& frame = stack_.back();
+    if (!isContainer(frame.element)) {
+      // A reference is reported on its own, as the character it names.
+      const size_t at = offset();
+      appendText(text, inCDATA_ || at >= s_.size() || s_[at] != '&', &frame.text);
+    } else if (!trim(text).empty()) {
+      fail("text where an element was expected");
     }
   }
 
-  bool array(const Tag& tag, int depth) {
-    if (tag.empty) return true;
-    for (;;) {
-      if (!skipMisc()) return false;
-      if (startsWith("</")) return expectClosing("array");
-      if (!value(depth + 1)) return false;
+  void cdataStart() {
+    if (!stack_.empty() && isContainer(stack_.back().element)) return fail("text where an element was expected");
+    inCDATA_ = true;
+  }
+
+  static std::string_view nameOf(Element element) {
+    for (const auto& [name, e] : kElements) {
+      if (e == element) return name;
     }
+    return {};
+  }
+
+  static std::string keyWithoutValue(const Frame& dictionary) {
+    return "dictionary key \"" + dictionary.text + "\" has no value";
+  }
+
+  // libplist reads the text of numbers, dates and data as it stands in the
+  // document, so a reference, comment or CDATA section there would be read
+  // as something else than what this check read; such text is rewritten as
+  // read. It reads integers with strtoull's automatic base, so "010" would be
+  // octal 8 and "08" would be 0: a decimal with leading zeros is rewritten
+  // without them.
+  void noteCanonicalText(Element element, std::string_view content, size_t start, size_t end) {
+    std::string canonical(content);
+    if (element == Element::Integer) {
+      const size_t sign = !content.empty() && (content.front() == '-' || content.front() == '+') ? 1 : 0;
+      size_t first = sign;
+      while (first + 1 < content.size() && content[first] == '0' && isDigit(content[first + 1])) ++first;
+      canonical = std::string(content.substr(0, sign)) + std::string(content.substr(first));
+    }
+    const std::string_view raw = s_.substr(start, end > start ? end - start : 0);
+    if (trim(raw) != canonical) edits_.push_back({start, raw.size(), std::move(canonical)});
   }
 
   // The document with the noted edits applied, or "" when there are none.
@@ -466,7 +440,10 @@ class Checker {
   };
 
   std::string_view s_;
-  size_t pos_ = 0;
+  XML_Parser parser_ = nullptr;
+  std::vector<Frame> stack_;
+  int containers_ = 0;  // dictionaries and arrays open
+  bool inCDATA_ = false;
   std::string problem_;
   size_t problemOffset_ = 0;
   std::vector<Edit> edits_;
@@ -474,6 +451,8 @@ class Checker {
 
 }  // namespace
 
-XMLCheck checkXMLPropertyList(std::string_view text) { return Checker(text).run(); }
+XMLCheck checkXMLPropertyList(std::string_view text) {
+  return Checker(text).run();
+}
 
 }  // namespace platform::plist::detail

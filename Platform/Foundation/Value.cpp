@@ -4,17 +4,40 @@
 #include <cinttypes>
 #include <cmath>
 #include <cstdio>
+#include <iterator>
+#include <type_traits>
+#include <utility>
 
 #include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/Text.h"
 
 namespace platform {
 
 namespace {
 
-// Heap payloads of the non-scalar types.
-template <class T>
-T* payload(void* p) {
-  return static_cast<T*>(p);
+using detail::Boxed;
+
+// The visitor of several lambdas.
+template <class... F>
+struct Overloaded : F... {
+  using F::operator()...;
+};
+template <class... F>
+Overloaded(F...) -> Overloaded<F...>;
+
+// The numeric views: booleans and integers convert as C++ converts them, reals
+// through `fromReal`, anything that is not a number gives `fallback`.
+template <class R, class Storage, class FromReal>
+R numericView(const Storage& storage, R fallback, FromReal fromReal) {
+  return std::visit(Overloaded{[&](double d) -> R { return fromReal(d); },
+                               [&](const auto& x) -> R {
+                                 if constexpr (std::is_integral_v<std::decay_t<decltype(x)>>) {
+                                   return static_cast<R>(x);
+                                 } else {
+                                   return fallback;
+                                 }
+                               }},
+                    storage);
 }
 
 std::string describeReal(double d) {
@@ -59,150 +82,107 @@ std::string describeNested(const Value& v) {
 
 }  // namespace
 
-Value::Value() : i_(0) {}
-Value::Value(std::nullptr_t) : Value() {}
-Value::Value(bool b) : type_(Type::Boolean), b_(b) {}
-Value::Value(int i) : type_(Type::Integer), i_(i) {}
-Value::Value(long i) : type_(Type::Integer), i_(i) {}
-Value::Value(long long i) : type_(Type::Integer), i_(i) {}
-Value::Value(unsigned u) : type_(Type::Unsigned), u_(u) {}
-Value::Value(unsigned long u) : type_(Type::Unsigned), u_(u) {}
-Value::Value(unsigned long long u) : type_(Type::Unsigned), u_(u) {}
-Value::Value(double d) : type_(Type::Real), d_(d) {}
-Value::Value(const char* s) : Value() {
-  if (s) {
-    type_ = Type::String;
-    p_ = new std::string(s);
-  }
+Value::Value() = default;
+Value::Value(std::nullptr_t) {}
+Value::Value(bool b) : storage_(b) {}
+Value::Value(int i) : storage_(int64_t{i}) {}
+Value::Value(long i) : storage_(int64_t{i}) {}
+Value::Value(long long i) : storage_(int64_t{i}) {}
+Value::Value(unsigned u) : storage_(uint64_t{u}) {}
+Value::Value(unsigned long u) : storage_(uint64_t{u}) {}
+Value::Value(unsigned long long u) : storage_(uint64_t{u}) {}
+Value::Value(double d) : storage_(d) {}
+Value::Value(const char* s) {
+  if (s) storage_.emplace<Boxed<std::string>>(std::string(s));
 }
-Value::Value(std::string s) : type_(Type::String), p_(new std::string(std::move(s))) {}
-Value::Value(std::string_view s) : type_(Type::String), p_(new std::string(s)) {}
-Value::Value(Data d) : type_(Type::Data), p_(new Data(std::move(d))) {}
-Value::Value(Date d) : type_(Type::Date), p_(new Date(d)) {}
-Value::Value(Array a) : type_(Type::Array), p_(new Array(std::move(a))) {}
-Value::Value(Dictionary d) : type_(Type::Dictionary), p_(new Dictionary(std::move(d))) {}
-Value::Value(URL u) : type_(Type::URL), p_(new URL(std::move(u))) {}
-Value::Value(Error e) : type_(Type::Error), p_(new Error(std::move(e))) {}
+Value::Value(std::string s) : storage_(Boxed<std::string>(std::move(s))) {}
+Value::Value(std::string_view s) : storage_(Boxed<std::string>(std::string(s))) {}
+Value::Value(Data d) : storage_(Boxed<Data>(std::move(d))) {}
+Value::Value(Date d) : storage_(d) {}
+Value::Value(Array a) : storage_(Boxed<Array>(std::move(a))) {}
+Value::Value(Dictionary d) : storage_(Boxed<Dictionary>(std::move(d))) {}
+Value::Value(URL u) : storage_(Boxed<URL>(std::move(u))) {}
+Value::Value(Error e) : storage_(Boxed<Error>(std::move(e))) {}
 
-Value::Value(const Value& other) : i_(0) { copyFrom(other); }
-Value::Value(Value&& other) noexcept : i_(0) { moveFrom(std::move(other)); }
+Value::Value(const Value& other) = default;
+// A moved-from Value is null, never an empty box.
+Value::Value(Value&& other) noexcept : storage_(std::exchange(other.storage_, std::monostate{})) {}
 Value& Value::operator=(const Value& other) {
-  if (this != &other) {
-    Value copy(other);
-    destroy();
-    moveFrom(std::move(copy));
-  }
+  // `other` may live inside this Value (v = (*v.asArray())[0]): copy it out
+  // before replacing what holds it.
+  if (this != &other) *this = Value(other);
   return *this;
 }
 Value& Value::operator=(Value&& other) noexcept {
   if (this != &other) {
-    // `other` may live inside this Value (v = std::move((*v.asArray())[0])):
-    // take it out before destroying what holds it.
     Value taken(std::move(other));
-    destroy();
-    moveFrom(std::move(taken));
+    storage_ = std::exchange(taken.storage_, std::monostate{});
   }
   return *this;
 }
-Value::~Value() { destroy(); }
+Value::~Value() = default;
 
-void Value::destroy() noexcept {
-  switch (type_) {
-    case Type::String: delete payload<std::string>(p_); break;
-    case Type::Data: delete payload<Data>(p_); break;
-    case Type::Date: delete payload<Date>(p_); break;
-    case Type::Array: delete payload<Array>(p_); break;
-    case Type::Dictionary: delete payload<Dictionary>(p_); break;
-    case Type::URL: delete payload<URL>(p_); break;
-    case Type::Error: delete payload<Error>(p_); break;
-    default: break;
-  }
-  type_ = Type::Null;
-  i_ = 0;
-}
-
-void Value::copyFrom(const Value& other) {
-  switch (other.type_) {
-    case Type::String: p_ = new std::string(*payload<std::string>(other.p_)); break;
-    case Type::Data: p_ = new Data(*payload<Data>(other.p_)); break;
-    case Type::Date: p_ = new Date(*payload<Date>(other.p_)); break;
-    case Type::Array: p_ = new Array(*payload<Array>(other.p_)); break;
-    case Type::Dictionary: p_ = new Dictionary(*payload<Dictionary>(other.p_)); break;
-    case Type::URL: p_ = new URL(*payload<URL>(other.p_)); break;
-    case Type::Error: p_ = new Error(*payload<Error>(other.p_)); break;
-    default: u_ = other.u_; break;
-  }
-  type_ = other.type_;
-}
-
-void Value::moveFrom(Value&& other) noexcept {
-  type_ = other.type_;
-  u_ = other.u_;  // copies the scalar or steals the payload pointer
-  other.type_ = Type::Null;
-  other.i_ = 0;
+template <class T>
+T* Value::boxed() const {
+  const Boxed<T>* box = std::get_if<Boxed<T>>(&storage_);
+  return box ? &**box : nullptr;
 }
 
 bool Value::isNumber() const {
-  return type_ == Type::Boolean || type_ == Type::Integer || type_ == Type::Unsigned || type_ == Type::Real;
+  return isBoolean() || isInteger() || type() == Type::Real;
 }
 
-const std::string* Value::asString() const { return type_ == Type::String ? payload<std::string>(p_) : nullptr; }
-const Data* Value::asData() const { return type_ == Type::Data ? payload<Data>(p_) : nullptr; }
-const Array* Value::asArray() const { return type_ == Type::Array ? payload<Array>(p_) : nullptr; }
-Array* Value::asArray() { return type_ == Type::Array ? payload<Array>(p_) : nullptr; }
-const Dictionary* Value::asDictionary() const {
-  return type_ == Type::Dictionary ? payload<Dictionary>(p_) : nullptr;
+const std::string* Value::asString() const {
+  return boxed<std::string>();
 }
-Dictionary* Value::asDictionary() { return type_ == Type::Dictionary ? payload<Dictionary>(p_) : nullptr; }
-const URL* Value::asURL() const { return type_ == Type::URL ? payload<URL>(p_) : nullptr; }
-const Error* Value::asError() const { return type_ == Type::Error ? payload<Error>(p_) : nullptr; }
-const Date* Value::asDate() const { return type_ == Type::Date ? payload<Date>(p_) : nullptr; }
+const Data* Value::asData() const {
+  return boxed<Data>();
+}
+const Array* Value::asArray() const {
+  return boxed<Array>();
+}
+Array* Value::asArray() {
+  return boxed<Array>();
+}
+const Dictionary* Value::asDictionary() const {
+  return boxed<Dictionary>();
+}
+Dictionary* Value::asDictionary() {
+  return boxed<Dictionary>();
+}
+const URL* Value::asURL() const {
+  return boxed<URL>();
+}
+const Error* Value::asError() const {
+  return boxed<Error>();
+}
+const Date* Value::asDate() const {
+  return std::get_if<Date>(&storage_);
+}
 
 bool Value::boolValue(bool fallback) const {
-  switch (type_) {
-    case Type::Boolean: return b_;
-    case Type::Integer: return i_ != 0;
-    case Type::Unsigned: return u_ != 0;
-    case Type::Real: return d_ != 0;
-    default: return fallback;
-  }
+  return numericView(storage_, fallback, [](double d) { return d != 0; });
 }
 
 int64_t Value::int64Value(int64_t fallback) const {
-  switch (type_) {
-    case Type::Boolean: return b_ ? 1 : 0;
-    case Type::Integer: return i_;
-    case Type::Unsigned: return static_cast<int64_t>(u_);
-    case Type::Real:
-      if (std::isnan(d_)) return 0;
-      if (d_ >= 9.2233720368547758e18) return INT64_MAX;
-      if (d_ <= -9.2233720368547758e18) return INT64_MIN;
-      return static_cast<int64_t>(d_);
-    default: return fallback;
-  }
+  return numericView(storage_, fallback, [](double d) -> int64_t {
+    if (std::isnan(d)) return 0;
+    if (d >= 9.2233720368547758e18) return INT64_MAX;
+    if (d <= -9.2233720368547758e18) return INT64_MIN;
+    return static_cast<int64_t>(d);
+  });
 }
 
 uint64_t Value::uint64Value(uint64_t fallback) const {
-  switch (type_) {
-    case Type::Boolean: return b_ ? 1 : 0;
-    case Type::Integer: return static_cast<uint64_t>(i_);
-    case Type::Unsigned: return u_;
-    case Type::Real:
-      if (std::isnan(d_) || d_ <= 0) return d_ <= -1 ? static_cast<uint64_t>(int64Value()) : 0;
-      if (d_ >= 1.8446744073709552e19) return UINT64_MAX;
-      return static_cast<uint64_t>(d_);
-    default: return fallback;
-  }
+  return numericView(storage_, fallback, [](double d) -> uint64_t {
+    if (std::isnan(d) || d <= 0) return d <= -1 ? static_cast<uint64_t>(Value(d).int64Value()) : 0;
+    if (d >= 1.8446744073709552e19) return UINT64_MAX;
+    return static_cast<uint64_t>(d);
+  });
 }
 
 double Value::doubleValue(double fallback) const {
-  switch (type_) {
-    case Type::Boolean: return b_ ? 1 : 0;
-    case Type::Integer: return static_cast<double>(i_);
-    case Type::Unsigned: return static_cast<double>(u_);
-    case Type::Real: return d_;
-    default: return fallback;
-  }
+  return numericView(storage_, fallback, [](double d) { return d; });
 }
 
 const Value* Value::get(std::string_view key) const {
@@ -213,97 +193,86 @@ const Value* Value::get(std::string_view key) const {
 }
 
 std::string Value::description() const {
-  switch (type_) {
-    case Type::Null: return "(null)";
-    case Type::Boolean: return b_ ? "1" : "0";
-    case Type::Integer: return std::to_string(i_);
-    case Type::Unsigned: return std::to_string(u_);
-    case Type::Real: return describeReal(d_);
-    case Type::String: return *payload<std::string>(p_);
-    case Type::Data: {
-      const Data& data = *payload<Data>(p_);
-      std::string out = "{length = " + std::to_string(data.size()) + ", bytes = 0x";
-      static const char kHex[] = "0123456789abcdef";
-      size_t shown = data.size() <= 24 ? data.size() : 8;
-      for (size_t i = 0; i < shown; ++i) {
-        out += kHex[data[i] >> 4];
-        out += kHex[data[i] & 15];
-      }
-      if (shown < data.size()) out += "...";
-      return out + "}";
-    }
-    case Type::Date: {
-      char buf[48];
-      std::snprintf(buf, sizeof buf, "%.3f seconds since 2001-01-01", payload<Date>(p_)->secondsSinceReferenceDate);
-      return buf;
-    }
-    case Type::Array: {
-      std::string out = "(";
-      bool first = true;
-      for (const Value& v : *payload<Array>(p_)) {
-        if (!first) out += ", ";
-        first = false;
-        out += describeNested(v);
-      }
-      return out + ")";
-    }
-    case Type::Dictionary: {
-      std::string out = "{";
-      for (const auto& [k, v] : *payload<Dictionary>(p_)) {
-        out += quoteIfNeeded(k) + " = " + describeNested(v) + "; ";
-      }
-      return out + "}";
-    }
-    case Type::URL: return payload<URL>(p_)->description();
-    case Type::Error: return payload<Error>(p_)->description();
-  }
-  return "";
+  return std::visit(Overloaded{
+                        [](std::monostate) -> std::string { return "(null)"; },
+                        [](bool b) -> std::string { return b ? "1" : "0"; },
+                        [](int64_t i) { return std::to_string(i); },
+                        [](uint64_t u) { return std::to_string(u); },
+                        [](double d) { return describeReal(d); },
+                        [](const Boxed<std::string>& s) { return *s; },
+                        [](const Boxed<Data>& boxedData) {
+                          const Data& data = *boxedData;
+                          std::string out = "{length = " + std::to_string(data.size()) + ", bytes = 0x";
+                          size_t shown = data.size() <= 24 ? data.size() : 8;
+                          out += hexString(data.data(), shown);
+                          if (shown < data.size()) out += "...";
+                          return out + "}";
+                        },
+                        [](const Date& date) -> std::string {
+                          char buf[48];
+                          std::snprintf(buf, sizeof buf, "%.3f seconds since 2001-01-01",
+                                        date.secondsSinceReferenceDate);
+                          return buf;
+                        },
+                        [](const Boxed<Array>& array) {
+                          std::string out = "(";
+                          bool first = true;
+                          for (const Value& v : *array) {
+                            if (!first) out += ", ";
+                            first = false;
+                            out += describeNested(v);
+                          }
+                          return out + ")";
+                        },
+                        [](const Boxed<Dictionary>& dictionary) {
+                          std::string out = "{";
+                          for (const auto& [k, v] : *dictionary)
+                            out += quoteIfNeeded(k) + " = " + describeNested(v) + "; ";
+                          return out + "}";
+                        },
+                        [](const Boxed<URL>& url) { return (*url).description(); },
+                        [](const Boxed<Error>& error) { return (*error).description(); },
+                    },
+                    storage_);
 }
 
 std::string_view Value::typeName() const {
-  switch (type_) {
-    case Type::Null: return "null";
-    case Type::Boolean: return "boolean";
-    case Type::Integer: return "integer";
-    case Type::Unsigned: return "integer";
-    case Type::Real: return "real";
-    case Type::String: return "string";
-    case Type::Data: return "data";
-    case Type::Date: return "date";
-    case Type::Array: return "array";
-    case Type::Dictionary: return "dictionary";
-    case Type::URL: return "URL";
-    case Type::Error: return "error";
-  }
-  return "unknown";
+  static constexpr std::string_view kNames[] = {"null", "boolean", "integer", "integer",    "real", "string",
+                                                "data", "date",    "array",   "dictionary", "URL",  "error"};
+  static_assert(std::size(kNames) == std::variant_size_v<Storage>);
+  static_assert(
+      std::is_same_v<std::variant_alternative_t<static_cast<size_t>(Type::Unsigned), Storage>, uint64_t> &&
+          std::is_same_v<std::variant_alternative_t<static_cast<size_t>(Type::Date), Storage>, Date> &&
+          std::is_same_v<std::variant_alternative_t<static_cast<size_t>(Type::Error), Storage>, Boxed<Error>> &&
+          std::variant_size_v<Storage> == static_cast<size_t>(Type::Error) + 1,
+      "the variant's alternatives follow the order of Type");
+  return kNames[storage_.index()];
 }
 
 bool Value::operator==(const Value& other) const {
   if (isInteger() && other.isInteger()) {
-    if (type_ == other.type_) return u_ == other.u_;
+    if (type() == other.type()) return uint64Value() == other.uint64Value();
     // Mixed signedness: equal only when both are the same non-negative number.
-    int64_t s = type_ == Type::Integer ? i_ : other.i_;
-    uint64_t u = type_ == Type::Unsigned ? u_ : other.u_;
+    int64_t s = type() == Type::Integer ? int64Value() : other.int64Value();
+    uint64_t u = type() == Type::Unsigned ? uint64Value() : other.uint64Value();
     return s >= 0 && static_cast<uint64_t>(s) == u;
   }
-  if (type_ != other.type_) return false;
-  switch (type_) {
-    case Type::Null: return true;
-    case Type::Boolean: return b_ == other.b_;
-    case Type::Real: return d_ == other.d_;
-    case Type::String: return *payload<std::string>(p_) == *payload<std::string>(other.p_);
-    case Type::Data: return *payload<Data>(p_) == *payload<Data>(other.p_);
-    case Type::Date: return *payload<Date>(p_) == *payload<Date>(other.p_);
-    case Type::Array: return *payload<Array>(p_) == *payload<Array>(other.p_);
-    case Type::Dictionary: return *payload<Dictionary>(p_) == *payload<Dictionary>(other.p_);
-    case Type::URL: return *payload<URL>(p_) == *payload<URL>(other.p_);
-    case Type::Error: {
-      const Error& a = *payload<Error>(p_);
-      const Error& b = *payload<Error>(other.p_);
-      return a.domain() == b.domain() && a.code() == b.code() && a.userInfo() == b.userInfo();
-    }
-    default: return false;
-  }
+  if (type() != other.type()) return false;
+  return std::visit(
+      [&](const auto& mine) {
+        using T = std::decay_t<decltype(mine)>;
+        const T& theirs = *std::get_if<T>(&other.storage_);
+        if constexpr (std::is_same_v<T, Boxed<Error>>) {
+          const Error& a = *mine;
+          const Error& b = *theirs;
+          return a.domain() == b.domain() && a.code() == b.code() && a.userInfo() == b.userInfo();
+        } else if constexpr (std::is_same_v<T, std::monostate> || std::is_arithmetic_v<T> || std::is_same_v<T, Date>) {
+          return mine == theirs;
+        } else {
+          return *mine == *theirs;
+        }
+      },
+      storage_);
 }
 
 Array makeStringArray(std::initializer_list<std::string_view> items) {

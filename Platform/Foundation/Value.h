@@ -21,6 +21,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <variant>
 #include <vector>
 
 #include "Platform/Foundation/URL.h"
@@ -29,6 +30,30 @@ namespace platform {
 
 class Value;
 class Error;
+
+namespace detail {
+
+// A heap-held object with value semantics: copying copies the object. It keeps
+// a Value two words wide and lets alternatives that are not complete where
+// Value is declared (arrays and dictionaries of Values, Error) sit in its
+// variant. Only a Value's own moved-from storage ever holds an empty box.
+template <class T>
+class Boxed {
+ public:
+  explicit Boxed(T object) : object_(std::make_unique<T>(std::move(object))) {}
+  Boxed(const Boxed& other) : object_(std::make_unique<T>(*other.object_)) {}
+  Boxed(Boxed&&) noexcept = default;
+  Boxed& operator=(const Boxed& other) { return *this = Boxed(other); }
+  Boxed& operator=(Boxed&&) noexcept = default;
+  ~Boxed() = default;
+
+  T& operator*() const { return *object_; }
+
+ private:
+  std::unique_ptr<T> object_;
+};
+
+}  // namespace detail
 
 using Array = std::vector<Value>;
 using Dictionary = std::map<std::string, Value, std::less<>>;
@@ -71,20 +96,20 @@ class Value {
   Value& operator=(Value&& other) noexcept;
   ~Value();
 
-  Type type() const { return type_; }
-  bool isNull() const { return type_ == Type::Null; }
-  bool isBoolean() const { return type_ == Type::Boolean; }
+  Type type() const { return static_cast<Type>(storage_.index()); }
+  bool isNull() const { return type() == Type::Null; }
+  bool isBoolean() const { return type() == Type::Boolean; }
   // True for booleans, integers (either signedness) and reals: what the
   // system's documents call a number object.
   bool isNumber() const;
-  bool isInteger() const { return type_ == Type::Integer || type_ == Type::Unsigned; }
-  bool isString() const { return type_ == Type::String; }
-  bool isData() const { return type_ == Type::Data; }
-  bool isDate() const { return type_ == Type::Date; }
-  bool isArray() const { return type_ == Type::Array; }
-  bool isDictionary() const { return type_ == Type::Dictionary; }
-  bool isURL() const { return type_ == Type::URL; }
-  bool isError() const { return type_ == Type::Error; }
+  bool isInteger() const { return type() == Type::Integer || type() == Type::Unsigned; }
+  bool isString() const { return type() == Type::String; }
+  bool isData() const { return type() == Type::Data; }
+  bool isDate() const { return type() == Type::Date; }
+  bool isArray() const { return type() == Type::Array; }
+  bool isDictionary() const { return type() == Type::Dictionary; }
+  bool isURL() const { return type() == Type::URL; }
+  bool isError() const { return type() == Type::Error; }
 
   // Pointer accessors: null when the Value is of another type.
   const std::string* asString() const;
@@ -122,18 +147,15 @@ class Value {
   bool operator==(const Value& other) const;
 
  private:
-  void destroy() noexcept;
-  void copyFrom(const Value& other);
-  void moveFrom(Value&& other) noexcept;
+  // The alternatives in the order of Type, so that the index is the type.
+  using Storage =
+      std::variant<std::monostate, bool, int64_t, uint64_t, double, detail::Boxed<std::string>, detail::Boxed<Data>,
+                   Date, detail::Boxed<Array>, detail::Boxed<Dictionary>, detail::Boxed<URL>, detail::Boxed<Error>>;
 
-  Type type_ = Type::Null;
-  union {
-    bool b_;
-    int64_t i_;
-    uint64_t u_;
-    double d_;
-    void* p_;  // heap payload for every other type, owned
-  };
+  template <class T>
+  T* boxed() const;
+
+  Storage storage_;
 };
 
 // Convenience: an Array of strings.

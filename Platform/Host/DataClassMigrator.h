@@ -16,7 +16,7 @@ class DataClassMigrator {
   virtual std::string dataClassName() = 0;
   virtual float estimatedDuration() = 0;
   virtual float migrationProgress() = 0;
-  virtual bool performMigration() = 0;
+  [[nodiscard]] virtual bool performMigration() = 0;
 };
 
 }  // namespace platform

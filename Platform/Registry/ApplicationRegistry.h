@@ -27,6 +27,9 @@ inline constexpr char kRegistryPackageTypeKey[] = "PackageType";
 inline constexpr char kRegistryPackageTypeCustomer[] = "Customer";
 inline constexpr char kRegistryPackageTypePlaceholder[] = "Placeholder";
 inline constexpr char kRegistryStoreMetadataKey[] = "StoreMetadata";
+// The store-metadata file beside "Payload" in a package, in an installed
+// bundle's container and in an application's old container.
+inline constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
 // Progress-report keys.
 inline constexpr char kRegistryProgressErrorKey[] = "Error";
 inline constexpr char kRegistryProgressErrorDescriptionKey[] = "ErrorDescription";
@@ -77,10 +80,10 @@ class ApplicationRegistry {
   // Installs the package directory at `package` ("Payload/*.app", optional
   // "*.vpnplugin", store metadata beside "Payload"). `progress` may be empty.
   // Returns only after the last report has been delivered.
-  virtual bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
+  [[nodiscard]] virtual bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
                               Error* error) = 0;
   // Installs a placeholder bundle directory; no progress reports.
-  virtual bool installBundle(const URL& bundle, const Dictionary& options, Error* error) = 0;
+  [[nodiscard]] virtual bool installBundle(const URL& bundle, const Dictionary& options, Error* error) = 0;
 };
 
 // What a dry run asks of a registry beyond lookups: where the containers it

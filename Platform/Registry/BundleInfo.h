@@ -9,13 +9,10 @@
 #include <string_view>
 #include <vector>
 
+#include "Platform/BundleReader.h"
 #include "Platform/Foundation/Error.h"
 
 namespace platform::registry {
-
-// Path extensions of the bundles the registry installs.
-inline constexpr char kApplicationBundleExtension[] = "app";
-inline constexpr char kVPNPluginBundleExtension[] = "vpnplugin";
 
 struct BundleInfo {
   std::string identifier;

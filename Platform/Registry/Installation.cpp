@@ -20,7 +20,6 @@ constexpr char kInstallBundleFunction[] = "SQLiteApplicationRegistry::installBun
 
 constexpr char kPayloadDirectoryName[] = "Payload";
 // A placeholder's store metadata, kept beside its bundle.
-constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
 
 constexpr int kPercentVerifying = 5;
 constexpr int kPercentStaging = 30;

@@ -20,12 +20,12 @@ namespace platform::registry {
 
 // Installs a package directory, calling `progress` (may be empty) on the
 // calling thread with each report, the failure report included.
-bool installPackageDirectory(RegistryState& state, const URL& package, const Dictionary& options,
+[[nodiscard]] bool installPackageDirectory(RegistryState& state, const URL& package, const Dictionary& options,
                              const InstallProgressCallback& progress, Error* error);
 
 // Installs a copy of the bundle directory at `bundle` (left in place): a
 // placeholder when the options' package type is kRegistryPackageTypePlaceholder,
 // else an ordinary application.
-bool installBundleDirectory(RegistryState& state, const URL& bundle, const Dictionary& options, Error* error);
+[[nodiscard]] bool installBundleDirectory(RegistryState& state, const URL& bundle, const Dictionary& options, Error* error);
 
 }  // namespace platform::registry

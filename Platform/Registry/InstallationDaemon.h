@@ -23,7 +23,7 @@ class InstallationDaemonClient {
   virtual bool QuillsetRegisterSafeHarborForContainerType(const std::string& path, const std::string& identifier,
                                                           int containerType, const Value* options) = 0;
   // Brings the data protection of the containers up to date.
-  virtual bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const Dictionary& options) = 0;
+  [[nodiscard]] virtual bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const Dictionary& options) = 0;
 };
 
 }  // namespace platform

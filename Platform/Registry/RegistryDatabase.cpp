@@ -23,6 +23,11 @@ constexpr char kConnectionSetup[] =
     "PRAGMA synchronous=FULL;"
     "PRAGMA foreign_keys=ON;";
 
+// The layout of the tables below, kept in the database's user_version. Bump it
+// with every change to them; a database of a higher version is refused, since
+// this build could not read it correctly and would damage it if it wrote.
+constexpr int64_t kSchemaVersion = 1;
+
 // Group containers are shared by every application of a group, so a group's
 // container lives in its own table; record_groups says which groups a record
 // has. A record's has_group_dictionary is 0 for placeholders.
@@ -117,8 +122,38 @@ std::unique_ptr<Database> Database::open(const std::string& path, Error* error) 
       *error = sqliteFailure(path, "enable WAL", SQLITE_CANTOPEN, ("journal mode is " + mode->text(0)).c_str());
     return nullptr;
   }
-  if (!db->execute(kSchema, error)) return nullptr;
+  mode.reset();  // a statement still stepping would keep the schema's transaction from committing
+  if (!db->createSchema(error)) return nullptr;
   return db;
+}
+
+bool Database::createSchema(Error* error) {
+  // Read and set the version in the transaction that creates the tables, so
+  // that no other process can upgrade the database in between.
+  std::optional<Transaction> transaction = Transaction::begin(*this, error);
+  if (!transaction) return false;
+  std::optional<Statement> query = prepare("PRAGMA user_version;", error);
+  bool failed = false;
+  if (!query || !query->step(&failed, error)) return false;
+  const int64_t version = query->integer(0);
+  query.reset();
+  if (version > kSchemaVersion) {
+    if (error) {
+      *error = Error(
+          kRegistryErrorDomain, kRegistryErrorNewerDatabase,
+          Dictionary{{kLocalizedDescriptionKey,
+                      Value(Format("registry database %s has schema version %lld, newer than version %lld "
+                                   "that this build reads; it is left untouched",
+                                   path_, static_cast<long long>(version), static_cast<long long>(kSchemaVersion)))}});
+    }
+    return false;
+  }
+  if (!execute(kSchema, error)) return false;
+  if (version < kSchemaVersion &&
+      !execute(Format("PRAGMA user_version=%lld;", static_cast<long long>(kSchemaVersion)).c_str(), error)) {
+    return false;
+  }
+  return transaction->commit(error);
 }
 
 std::unique_ptr<Database> Database::openReadOnly(const std::string& path, Error* error) {

@@ -39,7 +39,9 @@ enum class CommitDurability {
 class Database {
  public:
   // Opens (creating when needed) the database at `path` in WAL mode with
-  // synchronous=FULL and creates the schema. Null on failure.
+  // synchronous=FULL and creates the schema, recording its version. Null on
+  // failure; a database of a newer schema version fails with
+  // kRegistryErrorNewerDatabase and is not changed.
   static std::unique_ptr<Database> open(const std::string& path, Error* error);
   // Opens an existing database for reading only, changing nothing on disk
   // (not even the change time of a file: SQLite gives the files it opens to
@@ -55,9 +57,9 @@ class Database {
   Database& operator=(const Database&) = delete;
 
   // Runs one or more statements without results.
-  bool execute(const char* sql, Error* error);
+  [[nodiscard]] bool execute(const char* sql, Error* error);
   // How the following commits reach the disk; Immediate after open().
-  bool setCommitDurability(CommitDurability durability, Error* error);
+  [[nodiscard]] bool setCommitDurability(CommitDurability durability, Error* error);
   std::optional<Statement> prepare(const char* sql, Error* error);
   const std::string& path() const { return path_; }
   // The record for the connection's last failure while `what`.
@@ -65,6 +67,7 @@ class Database {
 
  private:
   Database(sqlite3* handle, std::string path) : handle_(handle), path_(std::move(path)) {}
+  [[nodiscard]] bool createSchema(Error* error);
   friend class Statement;
   sqlite3* handle_;
   std::string path_;
@@ -86,10 +89,10 @@ class Statement {
 
   // Advances: true with a row, false at the end; on failure false with *error.
   // `failed` distinguishes the end from a failure.
-  bool step(bool* failed, Error* error);
+  [[nodiscard]] bool step(bool* failed, Error* error);
   // Runs a statement that returns no rows, then resets it so that it can be
   // bound and run again.
-  bool run(Error* error);
+  [[nodiscard]] bool run(Error* error);
 
   std::string text(int column) const;
   std::optional<std::string> optionalText(int column) const;
@@ -113,7 +116,7 @@ class Transaction {
   Transaction& operator=(Transaction&&) = delete;
   Transaction(const Transaction&) = delete;
   ~Transaction();
-  bool commit(Error* error);
+  [[nodiscard]] bool commit(Error* error);
 
  private:
   explicit Transaction(Database* db) : db_(db) {}

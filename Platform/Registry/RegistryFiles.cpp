@@ -16,6 +16,8 @@
 #include <memory>
 
 #include "Platform/Foundation/Format.h"
+#include "Platform/Foundation/Text.h"
+#include "Platform/FileSystem.h"
 #include "Platform/Registry/SQLiteRegistry.h"
 
 namespace platform::registry {
@@ -27,31 +29,6 @@ constexpr mode_t kFileMode = 0644;
 constexpr size_t kCopyBufferSize = 1 << 16;
 constexpr size_t kUUIDBytes = 16;
 
-// Owns a file descriptor.
-class Descriptor {
- public:
-  explicit Descriptor(int fd) : fd_(fd) {}
-  ~Descriptor() {
-    if (fd_ >= 0) close(fd_);
-  }
-  Descriptor(const Descriptor&) = delete;
-  Descriptor& operator=(const Descriptor&) = delete;
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-  // Closes now, reporting the outcome (a deferred write error shows here).
-  int closeNow() {
-    int rc = close(fd_);
-    fd_ = -1;
-    return rc;
-  }
-
- private:
-  int fd_;
-};
-
-struct DirCloser {
-  void operator()(DIR* dir) const { closedir(dir); }
-};
 struct FtsCloser {
   void operator()(FTS* fts) const { fts_close(fts); }
 };
@@ -79,9 +56,9 @@ bool writeAll(int fd, const uint8_t* bytes, size_t length) {
 }
 
 bool copyFileContents(const std::string& source, const std::string& destination, mode_t mode, Error* error) {
-  Descriptor in(open(source.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFD in(open(source.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
   if (!in.valid()) return fail(error, "open", source, errno);
-  Descriptor out(open(destination.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode & 07777));
+  ScopedFD out(open(destination.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode & 07777));
   if (!out.valid()) return fail(error, "create", destination, errno);
   std::vector<uint8_t> buffer(kCopyBufferSize);
   for (;;) {
@@ -92,7 +69,7 @@ bool copyFileContents(const std::string& source, const std::string& destination,
     if (!writeAll(out.get(), buffer.data(), static_cast<size_t>(n))) return fail(error, "write", destination, errno);
   }
   if (fsync(out.get()) != 0) return fail(error, "fsync", destination, errno);
-  if (out.closeNow() != 0) return fail(error, "close", destination, errno);
+  if (!out.close()) return fail(error, "close", destination, errno);
   return true;
 }
 
@@ -119,11 +96,6 @@ Error registryError(int64_t code, const std::string& message) {
   return Error(kRegistryErrorDomain, code, Dictionary{{kLocalizedDescriptionKey, Value(message)}});
 }
 
-bool isDirectory(const std::string& path) {
-  struct stat st;
-  return stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
-}
-
 bool isDirectoryNoFollow(const std::string& path) {
   struct stat st;
   return lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
@@ -135,8 +107,8 @@ bool exists(const std::string& path) {
 }
 
 std::optional<std::vector<std::string>> listDirectory(const std::string& path, Error* error) {
-  std::unique_ptr<DIR, DirCloser> dir(opendir(path.c_str()));
-  if (!dir) {
+  ScopedDIR dir(opendir(path.c_str()));
+  if (!dir.valid()) {
     fail(error, "opendir", path, errno);
     return std::nullopt;
   }
@@ -157,13 +129,8 @@ std::optional<std::vector<std::string>> listDirectory(const std::string& path, E
 }
 
 bool makeDirectories(const std::string& path, Error* error) {
-  if (isDirectory(path)) return true;
-  size_t slash = path.find_last_of('/');
-  if (slash != std::string::npos && slash > 0 && !makeDirectories(path.substr(0, slash), error)) return false;
-  if (mkdir(path.c_str(), kDirectoryMode) != 0 && !(errno == EEXIST && isDirectory(path))) {
-    return fail(error, "mkdir", path, errno);
-  }
-  return true;
+  const int errnum = platform::makeDirectories(path, kDirectoryMode);
+  return errnum == 0 || fail(error, "mkdir", path, errnum);
 }
 
 bool createNewDirectory(const std::string& path, Error* error) {
@@ -233,22 +200,22 @@ bool moveItem(const std::string& source, const std::string& destination, Error* 
 }
 
 bool syncDirectory(const std::string& path, Error* error) {
-  Descriptor fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  ScopedFD fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd.valid()) return fail(error, "open", path, errno);
   return fsync(fd.get()) == 0 || fail(error, "fsync", path, errno);
 }
 
 bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error) {
-  Descriptor fd(open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kFileMode));
+  ScopedFD fd(open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kFileMode));
   if (!fd.valid()) return fail(error, "create", path, errno);
   if (!writeAll(fd.get(), bytes.data(), bytes.size())) return fail(error, "write", path, errno);
   if (fsync(fd.get()) != 0) return fail(error, "fsync", path, errno);
-  if (fd.closeNow() != 0) return fail(error, "close", path, errno);
+  if (!fd.close()) return fail(error, "close", path, errno);
   return true;
 }
 
 bool setProtectionClass(const std::string& path, int32_t protectionClass, Error* error) {
-  Descriptor fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFD fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (!fd.valid()) return fail(error, "open", path, errno);
   if (fsetxattr(fd.get(), kProtectionClassAttributeName, &protectionClass, sizeof protectionClass, 0) != 0) {
     return fail(error, "setxattr", path, errno);
@@ -268,16 +235,7 @@ std::optional<std::string> newUUID(Error* error) {
     }
     got += static_cast<size_t>(n);
   }
-  bytes[6] = static_cast<uint8_t>((bytes[6] & 0x0F) | 0x40);  // version 4
-  bytes[8] = static_cast<uint8_t>((bytes[8] & 0x3F) | 0x80);  // RFC 4122 variant
-  std::string out;
-  for (size_t i = 0; i < sizeof bytes; ++i) {
-    if (i == 4 || i == 6 || i == 8 || i == 10) out += '-';
-    char hex[3];
-    snprintf(hex, sizeof hex, "%02X", bytes[i]);
-    out += hex;
-  }
-  return out;
+  return uuidString(bytes);
 }
 
 std::optional<FileLock> FileLock::acquire(const std::string& path, Error* error) {
@@ -286,7 +244,7 @@ std::optional<FileLock> FileLock::acquire(const std::string& path, Error* error)
     fail(error, "open", path, errno);
     return std::nullopt;
   }
-  FileLock lock(fd);
+  FileLock lock(ScopedFD{fd});
   while (flock(fd, LOCK_EX) != 0) {
     if (errno != EINTR) {
       fail(error, "flock", path, errno);
@@ -294,10 +252,6 @@ std::optional<FileLock> FileLock::acquire(const std::string& path, Error* error)
     }
   }
   return lock;
-}
-
-FileLock::~FileLock() {
-  if (fd_ >= 0) close(fd_);  // closing releases the flock
 }
 
 }  // namespace platform::registry

@@ -12,7 +12,9 @@
 #include <string>
 #include <vector>
 
+#include "Platform/FileSystem.h"
 #include "Platform/Foundation/Error.h"
+#include "Platform/PosixHandles.h"
 
 namespace platform::registry {
 
@@ -22,7 +24,7 @@ Error posixFailure(int64_t code, const std::string& what, const std::string& pat
 // A registry error without an underlying error.
 Error registryError(int64_t code, const std::string& message);
 
-bool isDirectory(const std::string& path);
+// isDirectory is the platform's (FileSystem.h).
 // A directory itself, not a symbolic link to one.
 bool isDirectoryNoFollow(const std::string& path);
 bool exists(const std::string& path);  // without following a final symbolic link
@@ -32,26 +34,26 @@ bool exists(const std::string& path);  // without following a final symbolic lin
 std::optional<std::vector<std::string>> listDirectory(const std::string& path, Error* error);
 
 // mkdir -p with mode 0755; an existing directory is success.
-bool makeDirectories(const std::string& path, Error* error);
+[[nodiscard]] bool makeDirectories(const std::string& path, Error* error);
 // Makes the missing parents of `path` and then `path` itself, which must not
 // exist yet (so that undoing it can never remove something older).
-bool createNewDirectory(const std::string& path, Error* error);
+[[nodiscard]] bool createNewDirectory(const std::string& path, Error* error);
 // Removes the item at `path` and everything under it; nothing there is success.
-bool removeTree(const std::string& path, Error* error);
+[[nodiscard]] bool removeTree(const std::string& path, Error* error);
 // Copies the tree at `source` to `destination` (which must not exist):
 // directories, regular files (with their modes) and symbolic links. Every file
 // and directory of the copy is flushed; the parent of `destination` is not.
-bool copyTree(const std::string& source, const std::string& destination, Error* error);
+[[nodiscard]] bool copyTree(const std::string& source, const std::string& destination, Error* error);
 // Renames `source` to `destination`. Only a rename can be undone after a crash,
 // so there is no copying fallback: across file systems this fails (EXDEV).
-bool moveItem(const std::string& source, const std::string& destination, Error* error);
+[[nodiscard]] bool moveItem(const std::string& source, const std::string& destination, Error* error);
 // Flushes a directory's entries (fsync on the directory), so that the renames
 // and creations in it survive a power loss.
-bool syncDirectory(const std::string& path, Error* error);
+[[nodiscard]] bool syncDirectory(const std::string& path, Error* error);
 // Writes `bytes` to a new file at `path` and flushes it.
-bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error);
+[[nodiscard]] bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error);
 // Sets the data-protection class attribute of the directory at `path`.
-bool setProtectionClass(const std::string& path, int32_t protectionClass, Error* error);
+[[nodiscard]] bool setProtectionClass(const std::string& path, int32_t protectionClass, Error* error);
 
 // A random UUID in upper-case 8-4-4-4-12 form (version 4).
 std::optional<std::string> newUUID(Error* error);
@@ -63,14 +65,10 @@ class FileLock {
  public:
   // Blocks until the lock is held; none when the lock file cannot be opened.
   static std::optional<FileLock> acquire(const std::string& path, Error* error);
-  FileLock(FileLock&& other) noexcept : fd_(other.fd_) { other.fd_ = -1; }
-  FileLock& operator=(FileLock&&) = delete;
-  FileLock(const FileLock&) = delete;
-  ~FileLock();
 
  private:
-  explicit FileLock(int fd) : fd_(fd) {}
-  int fd_;
+  explicit FileLock(ScopedFD fd) : fd_(std::move(fd)) {}
+  ScopedFD fd_;  // closing it releases the lock
 };
 
 }  // namespace platform::registry

@@ -58,12 +58,12 @@ std::optional<std::string> newContainerPath(const std::string& parent, Error* er
 // An entry that points outside the registry's areas (RegistryAreas.h) is not
 // acted on: it counts as one that could not be undone, so the journal keeps
 // it and every later installation refuses to start over it.
-bool undoJournal(const RegistryLayout& layout, const std::vector<JournalEntry>& entries, const char* function,
+[[nodiscard]] bool undoJournal(const RegistryLayout& layout, const std::vector<JournalEntry>& entries, const char* function,
                  Error* error);
 
 // Brings the files back in line with the records after an interrupted
 // installation, and empties the journal. REQUIRES: changeMutex and the install
 // lock held. False (the journal kept) when something could not be undone.
-bool recoverJournalLocked(RegistryState& state, const char* function, Error* error);
+[[nodiscard]] bool recoverJournalLocked(RegistryState& state, const char* function, Error* error);
 
 }  // namespace platform::registry

@@ -53,30 +53,30 @@ struct JournalEntry {
   std::string destination;
 };
 
-bool loadRecord(Database& db, const std::string& identifier, std::optional<StoredRecord>* record, Error* error);
-bool loadAllRecords(Database& db, std::vector<StoredRecord>* records, Error* error);
+[[nodiscard]] bool loadRecord(Database& db, const std::string& identifier, std::optional<StoredRecord>* record, Error* error);
+[[nodiscard]] bool loadAllRecords(Database& db, std::vector<StoredRecord>* records, Error* error);
 // Inserts or replaces the record and its group memberships; every group of the
 // record must already have its container (saveGroupContainer).
-bool saveRecord(Database& db, const StoredRecord& record, Error* error);
+[[nodiscard]] bool saveRecord(Database& db, const StoredRecord& record, Error* error);
 
-bool loadGroupContainer(Database& db, const std::string& group, std::optional<std::string>* path, Error* error);
+[[nodiscard]] bool loadGroupContainer(Database& db, const std::string& group, std::optional<std::string>* path, Error* error);
 // Records the container of a group that has none yet.
-bool saveGroupContainer(Database& db, const std::string& group, const std::string& path, Error* error);
+[[nodiscard]] bool saveGroupContainer(Database& db, const std::string& group, const std::string& path, Error* error);
 
-bool loadSystemDataContainer(Database& db, const std::string& identifier, std::optional<std::string>* path,
+[[nodiscard]] bool loadSystemDataContainer(Database& db, const std::string& identifier, std::optional<std::string>* path,
                              Error* error);
 // Records the data container of a built-in application unless one is already
 // recorded (another process may have been first): *winner is what is recorded
 // afterwards.
-bool saveSystemDataContainer(Database& db, const std::string& identifier, const std::string& path, std::string* winner,
+[[nodiscard]] bool saveSystemDataContainer(Database& db, const std::string& identifier, const std::string& path, std::string* winner,
                              Error* error);
 
-bool saveSafeHarbor(Database& db, const SafeHarborRecord& harbor, Error* error);
-bool loadSafeHarbors(Database& db, std::vector<SafeHarborRecord>* harbors, Error* error);
+[[nodiscard]] bool saveSafeHarbor(Database& db, const SafeHarborRecord& harbor, Error* error);
+[[nodiscard]] bool loadSafeHarbors(Database& db, std::vector<SafeHarborRecord>* harbors, Error* error);
 
 // The journal, in the order entries were appended.
-bool appendJournal(Database& db, const std::vector<JournalEntry>& entries, Error* error);
-bool loadJournal(Database& db, std::vector<JournalEntry>* entries, Error* error);
-bool clearJournal(Database& db, Error* error);
+[[nodiscard]] bool appendJournal(Database& db, const std::vector<JournalEntry>& entries, Error* error);
+[[nodiscard]] bool loadJournal(Database& db, std::vector<JournalEntry>* entries, Error* error);
+[[nodiscard]] bool clearJournal(Database& db, Error* error);
 
 }  // namespace platform::registry

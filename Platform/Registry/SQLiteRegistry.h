@@ -67,6 +67,7 @@ inline constexpr int64_t kRegistryErrorFileOperation = 6;       // a container c
 inline constexpr int64_t kRegistryErrorInvalidOptions = 7;      // options the call does not support
 inline constexpr int64_t kRegistryErrorNotReplaceable = 8;      // a placeholder for an installed application
 inline constexpr int64_t kRegistryErrorOutsideAreas = 9;  // a recorded path outside the registry's own directories
+inline constexpr int64_t kRegistryErrorNewerDatabase = 10;       // the database was made by a newer version
 
 // Values of kRegistryProgressStatusKey, in the order an installation reports
 // them. "RegisteringApplication" comes after the files are in place and before
@@ -103,13 +104,13 @@ class SQLiteApplicationRegistry final : public ApplicationRegistry, public Insta
 
   bool isInstalled(const std::string& identifier) override;
   std::optional<BundleRecord> recordForIdentifier(const std::string& identifier) override;
-  bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
+  [[nodiscard]] bool installPackage(const URL& package, const Dictionary& options, const InstallProgressCallback& progress,
                       Error* error) override;
-  bool installBundle(const URL& bundle, const Dictionary& options, Error* error) override;
+  [[nodiscard]] bool installBundle(const URL& bundle, const Dictionary& options, Error* error) override;
 
   bool QuillsetRegisterSafeHarborForContainerType(const std::string& path, const std::string& identifier,
                                                   int containerType, const Value* options) override;
-  bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const Dictionary& options) override;
+  [[nodiscard]] bool QuillsetUpdateContainerDataProtectionForMigratorOnly(const Dictionary& options) override;
 
   // Inspection (tools and tests): every record, built-in applications
   // included, ordered by identifier; every registered safe harbor, ordered by

@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "Platform/FileSystem.h"
 #include "Shared/FileManager/DataProtection.h"
 #include "Shared/FileManager/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
@@ -23,45 +24,6 @@ constexpr char kCreateDirectoryFn[] =
     "-[QSFileManager createDirectoryAtURL:withIntermediateDirectories:mode:class:error:]";
 constexpr char kCreateTemporaryDirectoryFn[] = "-[QSFileManager createTemporaryDirectoryInDirectoryURL:error:]";
 constexpr char kTemporaryDirectoryTemplate[] = "temp.XXXXXX";
-constexpr char kPathSeparator = '/';
-
-bool isDirectory(const std::string& path) {
-  struct stat status {};
-  return stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
-}
-
-// mkdir that tolerates an existing directory (followed through links, as
-// path resolution would follow it).
-int makeOneDirectory(const std::string& path, mode_t mode) {
-  if (mkdir(path.c_str(), mode) == 0) return 0;
-  int errnum = errno;
-  if (errnum == EEXIST && isDirectory(path)) return 0;
-  return errnum;
-}
-
-// Creates `path` and every missing ancestor, each with `mode`. Returns 0 or
-// the error number of the creation that failed; an existing directory is no
-// failure, an existing item of another kind fails with EEXIST (at the end of
-// the path) or ENOTDIR (in the middle). Works upwards only as far as needed,
-// so an existing parent costs one call.
-int makePath(const std::string& path, mode_t mode) {
-  std::vector<size_t> missing;  // lengths of the prefixes still to create, deepest first
-  size_t length = path.size();
-  for (;;) {
-    int errnum = makeOneDirectory(path.substr(0, length), mode);
-    if (errnum == 0) break;
-    if (errnum != ENOENT) return errnum;
-    missing.push_back(length);
-    size_t slash = path.rfind(kPathSeparator, length - 1);
-    while (slash != std::string::npos && slash > 0 && path[slash - 1] == kPathSeparator) --slash;
-    if (slash == std::string::npos || slash == 0) return ENOENT;  // no ancestor left to create
-    length = slash;
-  }
-  for (auto it = missing.rbegin(); it != missing.rend(); ++it) {
-    if (int errnum = makeOneDirectory(path.substr(0, *it), mode); errnum != 0) return errnum;
-  }
-  return 0;
-}
 
 }  // namespace
 
@@ -69,7 +31,7 @@ bool QSFileManager::createDirectoryAtURL(const URL& url, bool withIntermediateDi
                                          int32_t dataProtectionClass, Error* error) const {
   const std::string& path = url.path();
   if (withIntermediateDirectories) {
-    if (int errnum = makePath(path, mode); errnum != 0) {
+    if (int errnum = platform::makeDirectories(path, mode); errnum != 0) {
       return QSFail(error, QSPOSIXError(kCreateDirectoryFn, __LINE__, errnum, "mkpath_np of %@ failed: %s", path,
                                         QSErrorText(errnum)));
     }

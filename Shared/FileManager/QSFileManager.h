@@ -4,7 +4,9 @@
 //
 // Out-parameter contract: an `error` argument is written if and only if the
 // operation fails (createTemporaryDirectoryInDirectoryURL clears it at entry),
-// and only when it is not null. Nothing throws.
+// and only when it is not null. Nothing throws. Every result must be looked
+// at ([[nodiscard]]); a caller that deliberately does not casts it to void and
+// says why.
 //
 // Thread safety: the shared instance is created once, safely under concurrent
 // first calls, and never destroyed. The class holds no state; every operation
@@ -84,8 +86,8 @@ class QSFileManager {
   static QSFileManager& defaultManager();
 
   // --- Existence (lstat; a dangling link exists) ---------------------------
-  bool itemExistsAtURL(const platform::URL& url) const;
-  bool itemDoesNotExistAtURL(const platform::URL& url) const;
+  [[nodiscard]] bool itemExistsAtURL(const platform::URL& url) const;
+  [[nodiscard]] bool itemDoesNotExistAtURL(const platform::URL& url) const;
 
   // --- Listing -------------------------------------------------------------
   // The children in directory order ("." and ".." never listed). A symbolic
@@ -95,12 +97,12 @@ class QSFileManager {
       const platform::URL& url, bool ignoringSymlinks, platform::Error* error = nullptr) const;
 
   // --- Removal (recursive, never follows links; absent items succeed) -------
-  bool removeItemAtURL(const platform::URL& url, platform::Error* error = nullptr) const;
+  [[nodiscard]] bool removeItemAtURL(const platform::URL& url, platform::Error* error = nullptr) const;
 
   // --- Directory creation ---------------------------------------------------
-  bool createDirectoryAtURL(const platform::URL& url, bool withIntermediateDirectories, mode_t mode,
+  [[nodiscard]] bool createDirectoryAtURL(const platform::URL& url, bool withIntermediateDirectories, mode_t mode,
                             int32_t dataProtectionClass, platform::Error* error = nullptr) const;
-  bool createDirectoryAtURL(const platform::URL& url, bool withIntermediateDirectories, mode_t mode,
+  [[nodiscard]] bool createDirectoryAtURL(const platform::URL& url, bool withIntermediateDirectories, mode_t mode,
                             platform::Error* error = nullptr) const;
 
   // --- Copy and move ---------------------------------------------------------
@@ -110,23 +112,23 @@ class QSFileManager {
   // durable, renames it into place and only then sets the source aside and
   // removes it (see CopyMove.cpp): an item is complete at one path or the
   // other at every instant, whether the process is killed or the power fails.
-  bool _copyItemAtURL(const platform::URL& src, const platform::URL& dst, bool failIfSrcMissing,
+  [[nodiscard]] bool _copyItemAtURL(const platform::URL& src, const platform::URL& dst, bool failIfSrcMissing,
                       platform::Error* error = nullptr) const;
-  bool _moveItemAtURL(const platform::URL& src, const platform::URL& dst, bool failIfSrcMissing,
+  [[nodiscard]] bool _moveItemAtURL(const platform::URL& src, const platform::URL& dst, bool failIfSrcMissing,
                       platform::Error* error = nullptr) const;
-  bool copyItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst,
+  [[nodiscard]] bool copyItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst,
                              platform::Error* error = nullptr) const;
-  bool copyItemAtURL(const platform::URL& src, const platform::URL& dst, platform::Error* error = nullptr) const;
-  bool moveItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst,
+  [[nodiscard]] bool copyItemAtURL(const platform::URL& src, const platform::URL& dst, platform::Error* error = nullptr) const;
+  [[nodiscard]] bool moveItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst,
                              platform::Error* error = nullptr) const;
-  bool moveItemAtURL(const platform::URL& src, const platform::URL& dst, platform::Error* error = nullptr) const;
+  [[nodiscard]] bool moveItemAtURL(const platform::URL& src, const platform::URL& dst, platform::Error* error = nullptr) const;
   // Cleans what an interrupted move of `src` to `dst` across file systems
   // left: the source set aside is removed when the destination exists (its
   // complete copy), kept otherwise (false, with a level-3 line); an
   // unfinished hidden copy is removed while the source is in place. Callers
   // run it before they look at `src`; without leftovers it only tests two
   // names.
-  bool finishInterruptedMoveOfItemAtURL(const platform::URL& src, const platform::URL& dst,
+  [[nodiscard]] bool finishInterruptedMoveOfItemAtURL(const platform::URL& src, const platform::URL& dst,
                                         platform::Error* error = nullptr) const;
   // Whether `name` is one that a move across file systems gives an item
   // while it is under way.
@@ -137,7 +139,7 @@ class QSFileManager {
   // moved into or out of it survives a power cut. A link at the path fails.
   bool synchronizeDirectoryAtURL(const platform::URL& url, platform::Error* error = nullptr) const;
   // --- Temporary directories ("temp.XXXXXX", mode 0700) ----------------------
-  std::optional<platform::URL> createTemporaryDirectoryInDirectoryURL(const platform::URL& parent,
+  [[nodiscard]] std::optional<platform::URL> createTemporaryDirectoryInDirectoryURL(const platform::URL& parent,
                                                                       platform::Error* error = nullptr) const;
 
   // --- Status of one item (lstat; a final symbolic link is not followed) ------
@@ -152,18 +154,18 @@ class QSFileManager {
   // root's file system. Stops at the first entry the walk cannot stat (POSIX
   // record) or the step refuses (the step's record, if it wrote one). Nothing
   // is logged. A missing step only visits.
-  bool _traverseDirectory(const platform::URL& root, platform::Error* error, const QSTraversalBlock& withBlock) const;
+  [[nodiscard]] bool _traverseDirectory(const platform::URL& root, platform::Error* error, const QSTraversalBlock& withBlock) const;
   // Gives every item of the tree `toUID`:`GID`, directories mode 0755 and the
   // rest 0644 (a link's own mode is left as it is: Linux cannot change it).
   // Items that cannot be changed are logged and passed over; with
   // `validateSymlinks`, a link that leads outside the tree stops the walk with
   // code 70. Changes made before a failure stay.
-  bool standardizeOwnershipAtURL(const platform::URL& url, uint32_t toUID, uint32_t GID, bool validateSymlinks,
+  [[nodiscard]] bool standardizeOwnershipAtURL(const platform::URL& url, uint32_t toUID, uint32_t GID, bool validateSymlinks,
                                  platform::Error* error = nullptr) const;
-  bool createSymbolicLinkAtURL(const platform::URL& url, const platform::URL& withDestinationURL,
+  [[nodiscard]] bool createSymbolicLinkAtURL(const platform::URL& url, const platform::URL& withDestinationURL,
                                platform::Error* error = nullptr) const;
   // The link's text (at most 1024 bytes) as an unresolved URL.
-  std::optional<platform::URL> destinationOfSymbolicLinkAtURL(const platform::URL& url,
+  [[nodiscard]] std::optional<platform::URL> destinationOfSymbolicLinkAtURL(const platform::URL& url,
                                                               platform::Error* error = nullptr) const;
 
   // --- Sizes and room (read only) -----------------------------------------------
@@ -180,17 +182,17 @@ class QSFileManager {
   // The real path of `url` when it lies inside `ifChildOfURL` (links resolved,
   // missing tails tolerated), or none with one level-3 line saying why. An
   // empty URL stands for a missing argument.
-  std::optional<platform::URL> realPathForURL(const platform::URL& url, const platform::URL& ifChildOfURL) const;
-  std::optional<platform::URL> _realPathForURL(const platform::URL& url, bool allowNonExistentPathComponents) const;
-  std::optional<platform::URL> _realPathWhatExistsInPath(const std::string& path) const;
+  [[nodiscard]] std::optional<platform::URL> realPathForURL(const platform::URL& url, const platform::URL& ifChildOfURL) const;
+  [[nodiscard]] std::optional<platform::URL> _realPathForURL(const platform::URL& url, bool allowNonExistentPathComponents) const;
+  [[nodiscard]] std::optional<platform::URL> _realPathWhatExistsInPath(const std::string& path) const;
   // Whether `url` lies strictly inside `base` (or is `base` itself, when
   // `orIsBase`), judged by where every existing part of both leads, so that a
   // link on the way out of the base is caught. Relative and empty paths and
   // paths with a ".." component are refused. Nothing is logged: the caller
   // says what the path was for.
-  bool urlLiesInsideURL(const platform::URL& url, const platform::URL& base, bool orIsBase = false) const;
+  [[nodiscard]] bool urlLiesInsideURL(const platform::URL& url, const platform::URL& base, bool orIsBase = false) const;
   // A null path pointer stands for a missing path.
-  bool _validateSymlink(const std::string* path, uint32_t withStartingDepth, uint32_t* andEndingDepth) const;
+  [[nodiscard]] bool _validateSymlink(const std::string* path, uint32_t withStartingDepth, uint32_t* andEndingDepth) const;
 
   // --- Data-protection classes and extended attributes ------------------------
   // Classes are read and set through a descriptor opened without following a
@@ -198,23 +200,23 @@ class QSFileManager {
   // at the path itself; attribute write and read failures are logged records
   // of code 4 with the POSIX error underneath. A missing install type reads 0;
   // bundleAtURLIsPlaceholder never fails and never logs.
-  bool dataProtectionClassOfItemAtURL(const platform::URL& url, int32_t* dataProtectionClass,
+  [[nodiscard]] bool dataProtectionClassOfItemAtURL(const platform::URL& url, int32_t* dataProtectionClass,
                                       platform::Error* error = nullptr) const;
-  bool setDataProtectionClassOfItemAtURL(const platform::URL& url, int32_t toClass,
+  [[nodiscard]] bool setDataProtectionClassOfItemAtURL(const platform::URL& url, int32_t toClass,
                                          const QSDataProtectionPredicate& ifPredicate,
                                          platform::Error* error = nullptr) const;
-  bool markBundleAsPlaceholder(const platform::URL& bundle, platform::Error* withError = nullptr) const;
-  bool bundleAtURLIsPlaceholder(const platform::URL& bundle) const;
-  bool setInstallType(const platform::Value& installType, const platform::URL& onBundle,
+  [[nodiscard]] bool markBundleAsPlaceholder(const platform::URL& bundle, platform::Error* withError = nullptr) const;
+  [[nodiscard]] bool bundleAtURLIsPlaceholder(const platform::URL& bundle) const;
+  [[nodiscard]] bool setInstallType(const platform::Value& installType, const platform::URL& onBundle,
                       platform::Error* error = nullptr) const;
-  std::optional<platform::Value> installTypeForBundle(const platform::URL& bundle,
+  [[nodiscard]] std::optional<platform::Value> installTypeForBundle(const platform::URL& bundle,
                                                       platform::Error* error = nullptr) const;
 
   // --- Store data ----------------------------------------------------------------
   // Copies or moves the four store items (those present) from `source` into
   // the existing `toDirectory`. Each failure is logged (code 24, keyed by the
   // item); it ends the capture only when `failureIsFatal`. Nothing is undone.
-  bool captureStoreDataFromDirectory(const platform::URL& source, const platform::URL& toDirectory, bool doCopy,
+  [[nodiscard]] bool captureStoreDataFromDirectory(const platform::URL& source, const platform::URL& toDirectory, bool doCopy,
                                      bool failureIsFatal, platform::Error* withError = nullptr) const;
 
  private:

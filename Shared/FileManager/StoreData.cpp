@@ -3,6 +3,7 @@
 
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
+#include "Shared/Support/QSLayoutNames.h"
 
 using platform::Error;
 using platform::URL;
@@ -13,17 +14,16 @@ constexpr char kCaptureStoreDataFn[] =
     "-[QSFileManager captureStoreDataFromDirectory:toDirectory:doCopy:failureIsFatal:withError:]";
 
 // The store items in the order they are captured, each with the key that
-// names its failure. The same four names make up the configuration's list of
-// an application's store-metadata items.
+// names its failure.
 struct StoreItem {
   const char* name;
   const char* failureKey;
 };
 constexpr std::array<StoreItem, 4> kStoreItems = {{
-    {"Manifest.plist", "ManifestCaptureFailed"},
-    {"VendraArtwork", "VendraArtworkCaptureFailed"},
-    {"VendraMetadata.plist", "VendraMetadataCaptureFailed"},
-    {"GeoJSON", "GeoJSONCaptureFailed"},
+    {kQSStoreManifestItemName, "ManifestCaptureFailed"},
+    {kQSStoreArtworkItemName, "VendraArtworkCaptureFailed"},
+    {kQSStoreMetadataItemName, "VendraMetadataCaptureFailed"},
+    {kQSStoreGeoJSONItemName, "GeoJSONCaptureFailed"},
 }};
 
 }  // namespace

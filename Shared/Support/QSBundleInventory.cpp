@@ -20,7 +20,6 @@ using platform::Value;
 namespace {
 
 constexpr char kBundleURLInfoKey[] = "com.vantrel.Quillset.bundleURL";
-constexpr char kApplicationExtension[] = "app";
 constexpr char kFrameworkExtension[] = "framework";
 constexpr char kApplicationsDirectoryName[] = "Applications";
 constexpr char kDebugMountRelativePath[] = "private/var/debug_mount";
@@ -84,7 +83,7 @@ std::optional<Dictionary> QSGlobalConfiguration::_bundleIDMapForBundlesInDirecto
 }
 
 std::optional<Dictionary> QSGlobalConfiguration::_bundleIDMapForAppsInDirectory(const URL& directory) {
-  return _bundleIDMapForBundlesInDirectory(directory, kApplicationExtension);
+  return _bundleIDMapForBundlesInDirectory(directory, platform::kApplicationBundleExtension);
 }
 
 std::optional<Dictionary> QSGlobalConfiguration::cachedAppMap(std::optional<Dictionary>& field,

@@ -1,10 +1,10 @@
-#include <openssl/evp.h>
-
 #include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <memory>
 
+#include "Platform/Digest.h"
+#include "Platform/Foundation/Text.h"
 #include "Platform/ReadOnlyFile.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
@@ -16,29 +16,11 @@ constexpr char kReadFileFunction[] = "_ReadFile";
 constexpr char kDigestFunction[] = "QSCreateSHA256Digest";
 // The most of a file that is held in memory at once.
 constexpr int64_t kReadChunkLimit = 65536;
-constexpr char kHexDigits[] = "0123456789abcdef";
-constexpr unsigned kNibbleBits = 4;
-constexpr unsigned kLowNibbleMask = 0x0f;
 
 struct FreeDeleter {
   void operator()(uint8_t* p) const { std::free(p); }
 };
 using HeapBuffer = std::unique_ptr<uint8_t, FreeDeleter>;
-
-struct DigestContextDeleter {
-  void operator()(EVP_MD_CTX* context) const { EVP_MD_CTX_free(context); }
-};
-using DigestContext = std::unique_ptr<EVP_MD_CTX, DigestContextDeleter>;
-
-std::string hexString(const unsigned char* bytes, size_t length) {
-  std::string text;
-  text.reserve(length * 2);
-  for (size_t i = 0; i < length; ++i) {
-    text += kHexDigits[bytes[i] >> kNibbleBits];
-    text += kHexDigits[bytes[i] & kLowNibbleMask];
-  }
-  return text;
-}
 
 // Writes a failure line of the reader without disturbing errno, which the
 // digest's own line reports after the reader has returned.
@@ -86,18 +68,16 @@ bool _ReadFile(const char* path, const QSReadFileConsumer& consumer) {
 }
 
 std::optional<std::string> QSCreateSHA256Digest(const platform::URL& location) {
-  DigestContext context(EVP_MD_CTX_new());
-  bool started = context && EVP_DigestInit_ex(context.get(), EVP_sha256(), nullptr) == 1;
-  bool read = started && _ReadFile(location.fileSystemRepresentation(), [&](const uint8_t* bytes, size_t length) {
-                return EVP_DigestUpdate(context.get(), bytes, length) == 1;
-              });
-  unsigned char digest[EVP_MAX_MD_SIZE];
-  unsigned int digestLength = 0;
-  if (!read || EVP_DigestFinal_ex(context.get(), digest, &digestLength) != 1) {
+  platform::SHA256 hasher;
+  if (!_ReadFile(location.fileSystemRepresentation(), [&](const uint8_t* bytes, size_t length) {
+        hasher.update(bytes, length);
+        return true;
+      })) {
     QS_SYSLOG(kQSLogLevelError, kDigestFunction, "Failed to read %@ : %s", location, QSErrorText(errno));
     return std::nullopt;
   }
-  return hexString(digest, digestLength);
+  const platform::SHA256Digest digest = hasher.finish();
+  return platform::hexString(digest.data(), digest.size());
 }
 
 std::optional<std::string> QSCreateSHA256Digest(const std::string& path) {

@@ -1,6 +1,7 @@
 #include "Shared/Support/QSGlobalConfiguration.h"
 
 #include "Shared/FileManager/QSFileManager.h"
+#include "Shared/Support/QSLayoutNames.h"
 #include "Shared/Support/QSLog.h"
 
 using platform::URL;
@@ -48,10 +49,6 @@ constexpr char kDeveloperFrameworksRootRelativePath[] = "Developer";
 constexpr char kFrameworksName[] = "Frameworks";
 constexpr char kPrivateFrameworksName[] = "PrivateFrameworks";
 
-constexpr char kManifestItemName[] = "Manifest.plist";
-constexpr char kArtworkItemName[] = "VendraArtwork";
-constexpr char kStoreMetadataItemName[] = "VendraMetadata.plist";
-constexpr char kGeoJSONItemName[] = "GeoJSON";
 constexpr char kDocumentsItemName[] = "Documents";
 constexpr char kLibraryItemName[] = "Library";
 constexpr char kTmpItemName[] = "tmp";
@@ -282,7 +279,7 @@ std::set<URL> QSGlobalConfiguration::allFrameworksDirectories() {
 // --- Item names ------------------------------------------------------------------------
 
 std::vector<std::string> QSGlobalConfiguration::appBundleMetadataItemNames() const {
-  return {kManifestItemName, kArtworkItemName, kStoreMetadataItemName, kGeoJSONItemName};
+  return {kQSStoreManifestItemName, kQSStoreArtworkItemName, kQSStoreMetadataItemName, kQSStoreGeoJSONItemName};
 }
 
 std::vector<std::string> QSGlobalConfiguration::appUserDataItemNames() const {

@@ -64,7 +64,7 @@ using QSReadFileConsumer = std::function<bool(const uint8_t* bytes, size_t lengt
 // size is taken once, when the file is opened. True when the whole file was
 // handed over (an empty file gives no chunk); false after a failure (logged
 // under "_ReadFile") or a refusal of the consumer (not logged).
-bool _ReadFile(const char* path, const QSReadFileConsumer& consumer);
+[[nodiscard]] bool _ReadFile(const char* path, const QSReadFileConsumer& consumer);
 
 // --- Resource usage -----------------------------------------------------------
 

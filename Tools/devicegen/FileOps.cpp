@@ -11,6 +11,8 @@
 
 #include <memory>
 
+#include "Platform/FileSystem.h"
+
 namespace devicegen {
 namespace {
 
@@ -23,28 +25,11 @@ bool fail(std::string* why, const char* call, const std::string& path, int err) 
   return false;
 }
 
-struct DirCloser {
-  void operator()(DIR* dir) const { closedir(dir); }
-};
-
 }  // namespace
 
-UniqueFd::~UniqueFd() {
-  if (fd_ >= 0) close(fd_);
-}
-
 bool makeDirectories(const std::string& path, std::string* why) {
-  if (mkdir(path.c_str(), kDirectoryMode) == 0) return true;
-  int err = errno;
-  if (err == ENOENT) {
-    const size_t slash = path.find_last_of('/');
-    if (slash == std::string::npos || slash == 0) return fail(why, "mkdir", path, err);
-    if (!makeDirectories(path.substr(0, slash), why)) return false;
-    if (mkdir(path.c_str(), kDirectoryMode) == 0) return true;
-    err = errno;
-  }
-  if (err == EEXIST && itemKind(path) == ItemKind::Directory) return true;
-  return fail(why, "mkdir", path, err);
+  const int err = platform::makeDirectories(path, kDirectoryMode);
+  return err == 0 || fail(why, "mkdir", path, err);
 }
 
 bool writeWholeFile(const std::string& path, const void* bytes, size_t length, mode_t mode, std::string* why) {
@@ -90,12 +75,12 @@ std::optional<std::string> readLinkText(const std::string& path) {
   return text;
 }
 
-bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, Sha256Digest* digest, uint64_t* size,
+bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, platform::SHA256Digest* digest, uint64_t* size,
                   std::string* why) {
   UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
   if (!fd.valid()) return fail(why, "open", path, errno);
   if (buffer.size() < kReadChunk) buffer.resize(kReadChunk);
-  Sha256 hasher;
+  platform::SHA256 hasher;
   uint64_t total = 0;
   for (;;) {
     const ssize_t got = read(fd.get(), buffer.data(), buffer.size());
@@ -113,8 +98,8 @@ bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, Sha256D
 }
 
 std::optional<std::vector<std::string>> directoryEntries(const std::string& path) {
-  std::unique_ptr<DIR, DirCloser> dir(opendir(path.c_str()));
-  if (!dir) return std::nullopt;
+  platform::ScopedDIR dir(opendir(path.c_str()));
+  if (!dir.valid()) return std::nullopt;
   std::vector<std::string> names;
   while (const dirent* entry = readdir(dir.get())) {
     const std::string name = entry->d_name;

@@ -16,25 +16,12 @@
 #include <string>
 #include <vector>
 
-#include "Tools/devicegen/Digest.h"
+#include "Platform/Digest.h"
+#include "Platform/PosixHandles.h"
 
 namespace devicegen {
 
-// An owned file descriptor, closed when the object goes away.
-class UniqueFd {
- public:
-  explicit UniqueFd(int fd = -1) : fd_(fd) {}
-  ~UniqueFd();
-  UniqueFd(UniqueFd&& other) noexcept : fd_(other.fd_) { other.fd_ = -1; }
-  UniqueFd& operator=(UniqueFd&&) = delete;
-  UniqueFd(const UniqueFd&) = delete;
-  UniqueFd& operator=(const UniqueFd&) = delete;
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-
- private:
-  int fd_;
-};
+using UniqueFd = platform::ScopedFD;
 
 inline constexpr mode_t kDirectoryMode = 0755;
 inline constexpr mode_t kFileMode = 0644;
@@ -42,10 +29,10 @@ inline constexpr mode_t kExecutableMode = 0755;
 
 // Creates `path` and its missing ancestors (mode 0755); an existing directory
 // is success.
-bool makeDirectories(const std::string& path, std::string* why);
+[[nodiscard]] bool makeDirectories(const std::string& path, std::string* why);
 // Creates or truncates `path` and writes `length` bytes; no fsync.
-bool writeWholeFile(const std::string& path, const void* bytes, size_t length, mode_t mode, std::string* why);
-bool makeSymlink(const std::string& target, const std::string& path, std::string* why);
+[[nodiscard]] bool writeWholeFile(const std::string& path, const void* bytes, size_t length, mode_t mode, std::string* why);
+[[nodiscard]] bool makeSymlink(const std::string& target, const std::string& path, std::string* why);
 
 enum class ItemKind { Missing, File, Directory, Link, Other };
 // What lies at `path` itself (lstat); the size of a regular file in *size.
@@ -54,7 +41,7 @@ ItemKind itemKind(const std::string& path, uint64_t* size = nullptr);
 std::optional<std::string> readLinkText(const std::string& path);
 // Reads the regular file at `path` through `buffer` (grown as needed and
 // reused across calls) and hashes it. Refuses to follow a symbolic link.
-bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, Sha256Digest* digest, uint64_t* size,
+[[nodiscard]] bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, platform::SHA256Digest* digest, uint64_t* size,
                   std::string* why);
 // Names in the directory at `path` ("." and ".." excluded), or none when it
 // cannot be read.

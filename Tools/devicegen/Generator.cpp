@@ -6,6 +6,7 @@
 
 #include "Platform/BundleReader.h"
 #include "Platform/Foundation/PropertyList.h"
+#include "Platform/Imaging.h"
 #include "Platform/SystemVersion.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Tools/devicegen/FileOps.h"
@@ -296,7 +297,7 @@ class ImageWriter {
 
   bool writeBuiltIn(const std::string& name, const std::string& identifier, const std::string& version,
                     const Dictionary& info, bool noDataContainer, std::string* why) {
-    const std::string bundle = join(layout_.systemApplicationsDirectory(), name + "." + kBundleExtensionApp);
+    const std::string bundle = join(layout_.systemApplicationsDirectory(), name + "." + platform::kApplicationBundleExtension);
     manifest_.builtIns.push_back({identifier, layout_.relative(bundle), version, noDataContainer});
     const int hue = static_cast<int>(random_.between(0, 359));
     return devicegen::makeDirectories(bundle, why) &&
@@ -307,10 +308,10 @@ class ImageWriter {
   bool writeApplications(std::string* why) {
     for (const AppPlan& app : apps_) {
       const std::string container = join(layout_.oldApplicationsDirectory(), app.uuid);
-      const std::string bundle = join(container, app.name + "." + kBundleExtensionApp);
+      const std::string bundle = join(container, app.name + "." + platform::kApplicationBundleExtension);
       if (!devicegen::makeDirectories(bundle, why) || !writeApplicationBundle(app, bundle, why)) return false;
       if (!app.pluginName.empty() &&
-          !writePlugin(app, join(container, app.pluginName + "." + kBundleExtensionVPNPlugin), why)) {
+          !writePlugin(app, join(container, app.pluginName + "." + platform::kVPNPluginBundleExtension), why)) {
         return false;
       }
       if (!writeStoreMetadata(app, container, why)) return false;
@@ -321,7 +322,7 @@ class ImageWriter {
       ManifestContainer entry;
       entry.identifier = app.identifier;
       entry.containerPath = layout_.relative(container);
-      entry.bundleName = app.name + "." + kBundleExtensionApp;
+      entry.bundleName = app.name + "." + platform::kApplicationBundleExtension;
       entry.version = app.version;
       entry.placeholder = app.role == Role::Placeholder;
       entry.builtInRefusal = app.role == Role::BuiltInOlder;
@@ -370,14 +371,14 @@ class ImageWriter {
                               {"itemName", app.displayName},
                               {"bundleVersion", app.version},
                               {"artistName", "Example Developer"}};
-    if (!writePlist(metadata, join(container, kStoreMetadataFileName), platform::plist::Format::XML, why)) return false;
+    if (!writePlist(metadata, join(container, kQSStoreMetadataItemName), platform::plist::Format::XML, why)) return false;
     if (app.storeMetadata == AppPlan::StoreMetadata::MetadataOnly) return true;
     std::vector<uint8_t>& artwork = buffer(kArtworkBytes);
     random_.fill(artwork.data(), kArtworkBytes);
     const Dictionary packageManifest{{"Identifier", app.identifier}, {"Version", app.version}};
-    return writePlist(packageManifest, join(container, kStoreManifestFileName), platform::plist::Format::XML, why) &&
-           writeWholeFile(join(container, kStoreArtworkFileName), artwork.data(), kArtworkBytes, kFileMode, why) &&
-           writeWholeFile(join(container, kStoreGeoJSONFileName), kGeoJSONDocument, sizeof kGeoJSONDocument - 1,
+    return writePlist(packageManifest, join(container, kQSStoreManifestItemName), platform::plist::Format::XML, why) &&
+           writeWholeFile(join(container, kQSStoreArtworkItemName), artwork.data(), kArtworkBytes, kFileMode, why) &&
+           writeWholeFile(join(container, kQSStoreGeoJSONItemName), kGeoJSONDocument, sizeof kGeoJSONDocument - 1,
                           kFileMode, why);
   }
 
@@ -385,7 +386,7 @@ class ImageWriter {
     for (const VPNOnlyPlan& plan : vpnOnly_) {
       const AppPlan& carrier = *plan.carrier;
       const std::string container = join(layout_.oldApplicationsDirectory(), plan.uuid);
-      const std::string bundleName = carrier.pluginName + "." + kBundleExtensionVPNPlugin;
+      const std::string bundleName = carrier.pluginName + "." + platform::kVPNPluginBundleExtension;
       if (!writePlugin(carrier, join(container, bundleName), why) ||
           !writeTree(container, ManifestItem::Owner::Application, carrier.pluginIdentifier, applicationDataShape(),
                      false, why)) {
@@ -535,7 +536,7 @@ class ImageWriter {
     if (!writeWholeFile(join(container, relative), bytes, size, kFileMode, why)) return false;
     ManifestItem& item = addItem(owner, ownerId, ManifestItem::Kind::File, relative);
     item.size = size;
-    item.digest = sha256(bytes, size);
+    item.digest = platform::sha256(bytes, size);
     return true;
   }
 

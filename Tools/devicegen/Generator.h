@@ -42,6 +42,6 @@ std::string checkImageOptions(const ImageOptions& options);
 
 // Writes the image and its manifest. REQUIRES: checkImageOptions() == "".
 // False with *why on the first failure; what was written so far stays.
-bool createImage(const ImageOptions& options, Manifest* manifest, std::string* why);
+[[nodiscard]] bool createImage(const ImageOptions& options, Manifest* manifest, std::string* why);
 
 }  // namespace devicegen

@@ -1,8 +1,8 @@
 // DeviceLayout: where the parts of a device image lie under its system root:
 // the migrator's locations (old applications directory, old install map,
 // data directory, system applications, item-name lists) as its configuration
-// builds them, the names of the files the migrator reads and writes there,
-// and the image's own additions.
+// builds them and the image's own additions. The names of the files the
+// migrator reads and writes there are the configuration's (QSLayoutNames.h).
 //
 // The migrator's own locations come from a QSGlobalConfiguration built for
 // the root, so that the tools and the migrator cannot disagree.
@@ -14,24 +14,17 @@
 #include <string>
 #include <string_view>
 
-#include "AppMigrator/QSAppMigrator.h"
 #include "Platform/Foundation/URL.h"
 #include "Platform/Preferences.h"
+#include "Shared/Support/QSLayoutNames.h"
 
 class QSGlobalConfiguration;
 
 namespace devicegen {
 
-// Files and keys the migrator reads and writes.
+// The install map's entries of user applications (the migrator reads only
+// the group-container entries).
 inline constexpr char kInstallMapUserKey[] = "User";
-inline constexpr char kBundleExtensionApp[] = "app";
-inline constexpr char kBundleExtensionVPNPlugin[] = "vpnplugin";
-
-// Store-metadata items of an old container (appBundleMetadataItemNames).
-inline constexpr char kStoreManifestFileName[] = "Manifest.plist";
-inline constexpr char kStoreArtworkFileName[] = "VendraArtwork";
-inline constexpr char kStoreMetadataFileName[] = "VendraMetadata.plist";
-inline constexpr char kStoreGeoJSONFileName[] = "GeoJSON";
 
 // The image's own additions, relative to the root.
 inline constexpr char kManifestFileName[] = "devicegen-manifest.plist";

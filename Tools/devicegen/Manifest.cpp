@@ -1,6 +1,7 @@
 #include "Tools/devicegen/Manifest.h"
 
 #include "Platform/Foundation/PropertyList.h"
+#include "Platform/Foundation/Text.h"
 #include "Platform/Foundation/URL.h"
 #include "Tools/UTF8.h"
 
@@ -89,7 +90,7 @@ Value itemValue(const ManifestItem& item) {
     case ManifestItem::Kind::File:
       d[kKindKey] = kItemFile;
       d[kSizeKey] = Value(static_cast<unsigned long long>(item.size));
-      d[kDigestKey] = hexDigest(item.digest);
+      d[kDigestKey] = platform::hexString(item.digest.data(), item.digest.size());
       break;
     case ManifestItem::Kind::Directory:
       d[kKindKey] = kItemDirectory;
@@ -156,8 +157,8 @@ class FieldReader {
     }
     return result;
   }
-  Sha256Digest digest(const char* key) {
-    Sha256Digest digest{};
+  platform::SHA256Digest digest(const char* key) {
+    platform::SHA256Digest digest{};
     const std::string hex = string(key);
     if (!ok_) return digest;
     if (hex.size() != digest.size() * 2) {

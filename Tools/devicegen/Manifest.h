@@ -13,7 +13,7 @@
 #include <vector>
 
 #include "Platform/Foundation/Value.h"
-#include "Tools/devicegen/Digest.h"
+#include "Platform/Digest.h"
 
 namespace devicegen {
 
@@ -63,7 +63,7 @@ struct ManifestItem {
   std::string ownerIdentifier;  // record identifier, or group identifier
   std::string path;             // relative to the container; any bytes
   uint64_t size = 0;
-  Sha256Digest digest{};
+  platform::SHA256Digest digest{};
   std::string linkTarget;
 };
 
@@ -84,7 +84,7 @@ platform::Value manifestToValue(const Manifest& manifest);
 // None with *why when the value is not a manifest this version understands.
 std::optional<Manifest> manifestFromValue(const platform::Value& value, std::string* why);
 
-bool writeManifest(const Manifest& manifest, const std::string& path, std::string* why);
+[[nodiscard]] bool writeManifest(const Manifest& manifest, const std::string& path, std::string* why);
 std::optional<Manifest> readManifest(const std::string& path, std::string* why);
 
 }  // namespace devicegen

@@ -3,6 +3,8 @@
 #include <cstring>
 #include <numeric>
 
+#include "Platform/Foundation/Text.h"
+
 namespace devicegen {
 namespace {
 
@@ -59,19 +61,9 @@ void DeterministicRandom::fill(uint8_t* bytes, size_t length) {
 }
 
 std::string DeterministicRandom::uuid() {
-  static constexpr char kHex[] = "0123456789ABCDEF";
   uint8_t bytes[16];
   fill(bytes, sizeof bytes);
-  bytes[6] = static_cast<uint8_t>((bytes[6] & 0x0F) | 0x40);
-  bytes[8] = static_cast<uint8_t>((bytes[8] & 0x3F) | 0x80);
-  std::string text;
-  text.reserve(36);
-  for (size_t i = 0; i < sizeof bytes; ++i) {
-    if (i == 4 || i == 6 || i == 8 || i == 10) text += '-';
-    text += kHex[bytes[i] >> 4];
-    text += kHex[bytes[i] & 0x0F];
-  }
-  return text;
+  return platform::uuidString(bytes);
 }
 
 std::vector<size_t> DeterministicRandom::permutation(size_t count) {

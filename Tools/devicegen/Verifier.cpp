@@ -7,6 +7,7 @@
 #include <set>
 
 #include "Platform/Foundation/PropertyList.h"
+#include "Platform/Foundation/Text.h"
 #include "Platform/Registry/SQLiteRegistry.h"
 #include "Tools/UTF8.h"
 #include "Tools/devicegen/FileOps.h"
@@ -170,12 +171,12 @@ class ImageVerifier {
         if (size != item.size) {
           return show(path) + ": " + std::to_string(size) + " bytes, expected " + std::to_string(item.size);
         }
-        Sha256Digest digest;
+        platform::SHA256Digest digest;
         std::string why;
         if (!digestOfFile(path, readBuffer_, &digest, &size, &why)) return show(why);
         if (digest != item.digest) {
-          return show(path) + ": content differs (SHA-256 " + hexDigest(digest) + ", expected " +
-                 hexDigest(item.digest) + ")";
+          return show(path) + ": content differs (SHA-256 " + platform::hexString(digest.data(), digest.size()) +
+                 ", expected " + platform::hexString(item.digest.data(), item.digest.size()) + ")";
         }
         return "";
       }

@@ -134,6 +134,14 @@ TEST(PropertyListXMLCheck, RefusesWhatLibplistLetsThroughAndReadsTheFormsOtherWr
        Value(Array{Value(-1500.0), Value(-HUGE_VAL), Value(3.0), Value(Date{100}), Value(Data{0, 1, 2, 3, 4})}), ""},
       {"<dict><key>a</key><integer>1</integer><key>a</key><integer>2</integer></dict>",
        Value(Dictionary{{"a", Value(2)}}), ""},
+      // Entities are never expanded nor fetched; a comment in the internal subset may hold quotes and brackets.
+      {"<!DOCTYPE plist [ <!ENTITY x \"y\"> ]><plist><string>&x;</string></plist>", std::nullopt, "&x;"},
+      {"<!DOCTYPE plist [ <!ENTITY x SYSTEM \"/etc/hostname\"> ]><string>&x;</string>", std::nullopt, "external"},
+      {"<!DOCTYPE plist [ <!-- don't ] --> ]><string>a</string>", Value("a"), ""},
+      // Text is what the references name, raw bytes stay bytes; libplist reads numbers as this check read them.
+      {"<dict><key>&#xE9;t\xE9&#xF7E9;</key></dict>", std::nullopt, "key \"\xC3\xA9t\xE9\xEF\x9F\xA9\" has no"},
+      {"<array><integer>&#x31;0</integer><real>1<!-- c -->.5</real><real><![CDATA[2.5]]></real></array>",
+       Value(Array{Value(10), Value(1.5), Value(2.5)}), ""},
   };
   for (const auto& [document, expected, problem] : cases) {
     Error error;

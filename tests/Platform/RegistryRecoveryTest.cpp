@@ -1,7 +1,10 @@
-// Crash consistency, a concurrent reader and an unwritable database.
+// Crash consistency, a concurrent reader, an unwritable database and one of a
+// newer schema.
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <sqlite3.h>
 
 #include <atomic>
 
@@ -179,6 +182,45 @@ TEST_F(RegistryRecovery, CommitWithoutItsOwnFlushLastsOneTransaction) {
   ASSERT_TRUE(open) << error.description();
   EXPECT_FALSE(Transaction::begin(*db, &error, CommitDurability::WithNextFlush));
   EXPECT_EQ(synchronous(), kFull);
+}
+
+// The schema version of the database at `path`, after setting it to `set` when given.
+int64_t userVersion(const std::string& path, std::optional<int> set = std::nullopt) {
+  sqlite3* db = nullptr;
+  int64_t version = -1;
+  if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE, nullptr) == SQLITE_OK &&
+      (!set || sqlite3_exec(db, ("PRAGMA user_version=" + std::to_string(*set)).c_str(), nullptr, nullptr,
+                            nullptr) == SQLITE_OK)) {
+    sqlite3_stmt* query = nullptr;
+    if (sqlite3_prepare_v2(db, "PRAGMA user_version;", -1, &query, nullptr) == SQLITE_OK &&
+        sqlite3_step(query) == SQLITE_ROW) {
+      version = sqlite3_column_int64(query, 0);
+    }
+    sqlite3_finalize(query);
+  }
+  sqlite3_close(db);
+  return version;
+}
+
+// A new database records its schema version; one of an older version (0: made
+// before versions were kept) is brought up to it; one of a newer version is
+// refused, naming both versions, and left as it was.
+TEST_F(RegistryRecovery, DatabaseOfANewerSchemaVersionIsRefusedAndLeftUntouched) {
+  const std::string database = at("private/var/db/appregistry/registry.sqlite");
+  openRegistry().reset();
+  ASSERT_EQ(userVersion(database), 1);
+  ASSERT_EQ(userVersion(database, 0), 0);
+  openRegistry().reset();
+  EXPECT_EQ(userVersion(database), 1);
+
+  ASSERT_EQ(userVersion(database, 7), 7);
+  Error error;
+  EXPECT_FALSE(SQLiteApplicationRegistry::open(base_, &error));
+  EXPECT_EQ(registryCode(error), kRegistryErrorNewerDatabase) << error.description();
+  EXPECT_EQ(error.localizedDescription(), "registry database " + database +
+                                              " has schema version 7, newer than version 1 that this build reads; "
+                                              "it is left untouched");
+  EXPECT_EQ(userVersion(database), 7);
 }
 
 }  // namespace
