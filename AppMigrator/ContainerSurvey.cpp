@@ -77,17 +77,15 @@ struct FoundBundles {
   std::optional<URL> vpnPlugin;
 };
 
-// What of a container without a usable bundle is worth keeping: its user data
-// items and the bundles that could not be read.
-std::vector<URL> recoverableItems(const URL& container, const std::vector<URL>& unreadableBundles) {
+}  // namespace
+
+std::vector<URL> QSAppMigrator::_recoverableItems(const URL& container, const std::vector<URL>& unreadableBundles) {
   std::vector<URL> items = unreadableBundles;
   for (const std::string& name : QSGlobalConfiguration::sharedInstance().appUserDataItemNames()) {
     items.push_back(container.appending(name, true));
   }
   return items;
 }
-
-}  // namespace
 
 std::optional<Dictionary> QSAppMigrator::_introspectContainer(const URL& entry, bool* orderResultEarly) {
   return _actOnSurvey(entry, _surveyEntry(entry), orderResultEarly);
@@ -111,7 +109,7 @@ std::optional<Dictionary> QSAppMigrator::_actOnSurvey(const URL& entry, QSEntryS
                "QSAppMigrator: No app or vpn bundle found in container %@ ; removing it", entry.path());
       // The user's data and any bundle that could not be read are kept for a
       // person; a container whose items could not all be kept stays.
-      if (!_moveItemsToRecovery(recoverableItems(entry, survey.unreadableBundles), entry)) {
+      if (!_moveItemsToRecovery(_recoverableItems(entry, survey.unreadableBundles), entry)) {
         _reportEntry(platform::EntryOutcome::Kept, "its data could not be moved to the recovery directory");
         return std::nullopt;
       }

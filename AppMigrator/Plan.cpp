@@ -102,7 +102,7 @@ MigrationPlan QSAppMigrator::planMigration() {
   for (const URL& entry : _itemsToMigrate.value_or(std::vector<URL>())) {
     ++plan.entries;
     if (entry.lastPathComponent() == kQSOldApplicationsNoteFileName) {
-      plan.discards.push_back({PlannedDiscardKind::NoteFile, entry.path(), _measureItem(entry), {}});
+      plan.discards.push_back({PlannedDiscardKind::NoteFile, entry.path(), _measureItem(entry), {}, {}, {}});
       continue;
     }
     QSEntrySurvey survey = _surveyEntry(entry);
@@ -115,13 +115,17 @@ MigrationPlan QSAppMigrator::planMigration() {
         }
         break;
       case QSEntrySurvey::Finding::StrayFile:
-        plan.discards.push_back({PlannedDiscardKind::StrayFile, entry.path(), _measureItem(entry), {}});
+        plan.discards.push_back({PlannedDiscardKind::StrayFile, entry.path(), _measureItem(entry), {}, {}, {}});
         break;
       case QSEntrySurvey::Finding::NoBundle: {
-        PlannedDiscard discard{PlannedDiscardKind::ContainerWithoutBundle, entry.path(), _measureItem(entry), {}};
+        PlannedDiscard discard{PlannedDiscardKind::ContainerWithoutBundle, entry.path(), _measureItem(entry), {}, {}, {}};
         for (const URL& item : fm.urlsForItemsInDirectoryAtURL(entry, false).value_or(std::vector<URL>())) {
           discard.items.push_back(item.lastPathComponent());
         }
+        for (const URL& item : _recoverableItems(entry, survey.unreadableBundles)) {
+          if (fm.itemExistsAtURL(item)) discard.recoveredItems.push_back(item.lastPathComponent());
+        }
+        discard.recoveryDirectory = QSGlobalConfiguration::sharedInstance().recoveryDirectoryPath().path();
         plan.discards.push_back(std::move(discard));
         break;
       }

@@ -173,6 +173,10 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   // directory named after the container, flushed, with a level-5 line. False,
   // with a level-3 line, when any could not be moved: the container must stay.
   bool _moveItemsToRecovery(const std::vector<platform::URL>& items, const platform::URL& fromContainer);
+  // What of a container without a usable bundle is worth keeping: its user
+  // data items (present or not) and the bundles that could not be read.
+  static std::vector<platform::URL> _recoverableItems(const platform::URL& container,
+                                                      const std::vector<platform::URL>& unreadableBundles);
 
   // Read access for tests and the host.
   uint64_t countItemsMigrated() const { return _countItemsMigrated.load(); }

@@ -75,7 +75,7 @@ const char* actionName(PlannedAction action) {
 const char* discardName(platform::PlannedDiscardKind kind) {
   switch (kind) {
     case platform::PlannedDiscardKind::ContainerWithoutBundle:
-      return "container without an identifiable bundle, removed with its data items";
+      return "container without an identifiable bundle, removed once its data items are recovered";
     case platform::PlannedDiscardKind::StrayFile:
       return "stray file in the old applications directory";
     case platform::PlannedDiscardKind::NoteFile:
@@ -120,6 +120,10 @@ std::string planText(const MigrationPlan& plan) {
     if (!d.items.empty()) {
       out += "; items:";
       for (const std::string& item : d.items) out += " " + tools::printable(item);
+    }
+    if (!d.recoveredItems.empty()) {
+      out += "; moved first to a directory of its own in " + tools::printable(d.recoveryDirectory) + ":";
+      for (const std::string& item : d.recoveredItems) out += " " + tools::printable(item);
     }
     out += "\n";
   }
@@ -201,6 +205,10 @@ std::string planJSON(const MigrationPlan& plan) {
     json.key("items").beginArray();
     for (const std::string& item : d.items) json.string(item);
     json.endArray();
+    json.key("recoveredItems").beginArray();
+    for (const std::string& item : d.recoveredItems) json.string(item);
+    json.endArray();
+    json.key("recoveryDirectory").string(d.recoveryDirectory);
     json.endObject();
   }
   json.endArray();

@@ -57,7 +57,7 @@ struct PlannedContainer {
 
 // Something the run removes for good, with everything in it.
 enum class PlannedDiscardKind {
-  ContainerWithoutBundle,  // no identifiable application or VPN plug-in: removed with its data items
+  ContainerWithoutBundle,  // no identifiable application or VPN plug-in: removed, its data items recovered first
   StrayFile,               // a regular file among the containers
   NoteFile,                // the previous release's note among the containers
 };
@@ -67,6 +67,10 @@ struct PlannedDiscard {
   std::string path;
   PlanSize size;
   std::vector<std::string> items;  // a container's own entries (names)
+  // Of a container without a bundle: the entries moved into a directory of
+  // their own under `recoveryDirectory` before the container is removed.
+  std::vector<std::string> recoveredItems;
+  std::string recoveryDirectory;
 };
 
 struct PlannedHarbor {

@@ -507,6 +507,10 @@ TEST_F(Migration, PlanChangesNothingAndForetellsWhatTheReportThenConfirms) {
   EXPECT_EQ(jsonNumber(plan, "files", "\"toMove\""), manifestTotal(image_, "Files"));
   EXPECT_EQ(jsonNumber(plan, "bytes", "/stray.bin\""), 700);
   EXPECT_EQ(jsonNumber(plan, "bytes", "/NOBUNDLE\""), 300);
+  // The bundle-less container's data goes to the recovery directory first.
+  const size_t recovered = plan.find("\"recoveredItems\"");
+  ASSERT_NE(recovered, std::string::npos) << plan;
+  EXPECT_NE(plan.substr(recovered, plan.find(']', recovered) - recovered).find("\"Documents\""), std::string::npos);
   EXPECT_NE(plan.find("\"resumedFromMarker\": true"), std::string::npos);
   EXPECT_NE(plan.find("\"enough\": true"), std::string::npos);
   EXPECT_EQ(plan.find("\"problem\": \""), std::string::npos) << "harbors the registry takes have no problem";
