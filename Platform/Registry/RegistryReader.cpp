@@ -54,6 +54,18 @@ BundleRecord bundleRecordFromStored(const StoredRecord& stored) {
   return record;
 }
 
+BundleRecord builtInRecordWithoutContainers(const BuiltInApplication& application) {
+  BundleRecord record;
+  record.identifier = application.info.identifier;
+  record.bundleType = kBundleTypeSystem;
+  record.bundleURL = directoryURL(application.bundlePath);
+  record.bundleContainerURL = record.bundleURL.deletingLastPathComponent();
+  record.foundBackingBundle = true;
+  record.version = application.info.version;
+  record.displayName = application.info.displayName;
+  return record;
+}
+
 }  // namespace registry
 
 RegistryReader::RegistryReader(RegistryLayout layout, std::unique_ptr<Database> db)
@@ -101,14 +113,7 @@ std::optional<BundleRecord> RegistryReader::recordForIdentifier(const std::strin
 }
 
 std::optional<BundleRecord> RegistryReader::builtInRecord(const BuiltInApplication& application) {
-  BundleRecord record;
-  record.identifier = application.info.identifier;
-  record.bundleType = kBundleTypeSystem;
-  record.bundleURL = directoryURL(application.bundlePath);
-  record.bundleContainerURL = record.bundleURL.deletingLastPathComponent();
-  record.foundBackingBundle = true;
-  record.version = application.info.version;
-  record.displayName = application.info.displayName;
+  BundleRecord record = registry::builtInRecordWithoutContainers(application);
   if (!application.info.noDataContainer) {
     std::optional<std::string> data;
     if (db_) {

@@ -21,10 +21,6 @@
 
 namespace platform {
 
-// kRegistryErrorDomain: the system root has no registry database.
-inline constexpr int64_t kRegistryErrorNoDatabase = 9;
-// kRegistryErrorDomain: a change was asked of a reader.
-inline constexpr int64_t kRegistryErrorReadOnly = 10;
 
 class RegistryReader final : public ApplicationRegistry, public RegistryForecast {
  public:
@@ -69,6 +65,8 @@ class RegistryReader final : public ApplicationRegistry, public RegistryForecast
 namespace registry {
 // The record the registry reports for a stored row.
 BundleRecord bundleRecordFromStored(const StoredRecord& stored);
+// The record of a built-in application, without its data and group containers.
+BundleRecord builtInRecordWithoutContainers(const BuiltInApplication& application);
 }  // namespace registry
 
 }  // namespace platform

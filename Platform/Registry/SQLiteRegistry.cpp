@@ -93,14 +93,7 @@ std::optional<std::string> ensureGroupContainer(RegistryState& state, const std:
 // The record of a built-in application; its data and group containers are
 // made on first lookup.
 std::optional<BundleRecord> systemRecord(RegistryState& state, const BuiltInApplication& application, Error* error) {
-  BundleRecord record;
-  record.identifier = application.info.identifier;
-  record.bundleType = kBundleTypeSystem;
-  record.bundleURL = directoryURL(application.bundlePath);
-  record.bundleContainerURL = record.bundleURL.deletingLastPathComponent();
-  record.foundBackingBundle = true;
-  record.version = application.info.version;
-  record.displayName = application.info.displayName;
+  BundleRecord record = builtInRecordWithoutContainers(application);
   if (!application.info.noDataContainer) {
     std::optional<std::string> data = ensureSystemDataContainer(state, record.identifier, error);
     if (!data) return std::nullopt;

@@ -68,6 +68,8 @@ inline constexpr int64_t kRegistryErrorInvalidOptions = 7;      // options the c
 inline constexpr int64_t kRegistryErrorNotReplaceable = 8;      // a placeholder for an installed application
 inline constexpr int64_t kRegistryErrorOutsideAreas = 9;  // a recorded path outside the registry's own directories
 inline constexpr int64_t kRegistryErrorNewerDatabase = 10;       // the database was made by a newer version
+inline constexpr int64_t kRegistryErrorNoDatabase = 11;          // the system root has no registry database (reader)
+inline constexpr int64_t kRegistryErrorReadOnly = 12;            // a change was asked of a reader
 
 // Values of kRegistryProgressStatusKey, in the order an installation reports
 // them. "RegisteringApplication" comes after the files are in place and before
