@@ -305,6 +305,7 @@ class Checker {
     const std::optional<Element> element = elementNamed(name);
     const std::string tag = "<" + std::string(name) + ">";
     if (!element || (*element == Element::Plist && !stack_.empty())) return fail("unknown element " + tag);
+    if (stack_.empty() && *element == Element::Key) return fail("<key> outside a dictionary");
     if (!stack_.empty()) {
       Frame& parent = stack_.back();
       if (!isContainer(parent.element)) {
@@ -329,7 +330,7 @@ class Checker {
   }
 
   void end() {
-    if (!problem_.empty()) return;
+    if (!problem_.empty() || stack_.empty()) return;
     Frame frame = std::move(stack_.back());
     stack_.pop_back();
     const std::string_view name = nameOf(frame.element);

@@ -115,6 +115,7 @@ TEST(PropertyListXMLCheck, RefusesWhatLibplistLetsThroughAndReadsTheFormsOtherWr
       {p + "<dict><key>a</key><string>x</string><key>b</key></dict></plist>", std::nullopt,
        "dictionary key \"b\" has no value"},
       {p + "<dict><key>a</key><true/></dict></plist>xyz", std::nullopt, "content after the end"},
+      {kHeader + "<key>a</key>", std::nullopt, "<key> outside a dictionary"},
       {p + "<dict><key>a</key><true/></dict>\n", std::nullopt, "missing </plist>"},
       {"\xEF\xBB\xBF", std::nullopt, "the document is empty"},
       {p + "<dict><key>a</key><string>abc", std::nullopt, "unexpected end of the document"},
