@@ -291,6 +291,16 @@ ssize_t pwrite64(int fd, const void* buffer, size_t length, off_t offset) {
   return writeAt(fd, buffer, length, offset, 1);
 }
 
+// A copy made inside the kernel is recorded as the write of the bytes it
+// copied, read again from the source.
+static void recordCopiedData(int in, off_t from, int out, off_t at, size_t length) {
+  if (gRecordFD < 0) return;
+  char* copied = malloc(length);
+  if (!copied || pread(in, copied, length, from) != (ssize_t)length) abort();
+  recordOnFD("write", out, NULL, at, 0, 0, copied, length);
+  free(copied);
+}
+
 ssize_t copy_file_range(int in, off_t* inOffset, int out, off_t* outOffset, size_t length, unsigned flags) {
   char path[PATH_MAX];
   if (failsReading(in)) {
@@ -301,12 +311,7 @@ ssize_t copy_file_range(int in, off_t* inOffset, int out, off_t* outOffset, size
   off_t at = outOffset ? *outOffset : lseek(out, 0, SEEK_CUR);
   off_t from = inOffset ? *inOffset : lseek(in, 0, SEEK_CUR);
   ssize_t n = REAL(copy_file_range)(in, inOffset, out, outOffset, length, flags);
-  if (n > 0 && gRecordFD >= 0) {
-    char* copied = malloc((size_t)n);
-    if (!copied || pread(in, copied, (size_t)n, from) != n) abort();
-    recordOnFD("write", out, NULL, at, 0, 0, copied, (size_t)n);
-    free(copied);
-  }
+  if (n > 0) recordCopiedData(in, from, out, at, (size_t)n);
   return n;
 }
 
@@ -321,12 +326,7 @@ static ssize_t sendFile(int out, int in, off_t* inOffset, size_t length) {
   off_t at = lseek(out, 0, SEEK_CUR);
   off_t from = inOffset ? *inOffset : lseek(in, 0, SEEK_CUR);
   ssize_t n = REAL(sendfile)(out, in, inOffset, length);
-  if (n > 0 && gRecordFD >= 0) {
-    char* sent = malloc((size_t)n);
-    if (!sent || pread(in, sent, (size_t)n, from) != n) abort();
-    recordOnFD("write", out, NULL, at, 0, 0, sent, (size_t)n);
-    free(sent);
-  }
+  if (n > 0) recordCopiedData(in, from, out, at, (size_t)n);
   return n;
 }
 ssize_t sendfile(int out, int in, off_t* inOffset, size_t length) { return sendFile(out, in, inOffset, length); }
