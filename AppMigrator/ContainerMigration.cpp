@@ -82,9 +82,16 @@ bool QSAppMigrator::_migrateContainerWithInfo(const Dictionary& info) {
   return outcome == InstallOutcome::Installed;
 }
 
+// The marker's data is flushed before it gets its name; the name itself needs
+// no flush. Every later change of the container (items leaving it, the bundle
+// staged, the container removed) is made on the container's own file system
+// and cannot reach the disk before the marker's name. Nothing elsewhere
+// depends on the marker: an item copied to another file system keeps its
+// source in this container until the source is set aside here.
 void QSAppMigrator::_writeContainerMarker(const Dictionary& info, const QSContainerInfo& in) {
   if (!platform::plist::writeFile(platform::Value(info), in.container.appending(kQSMigrationMarkerFileName),
-                                  platform::plist::Format::XML, true)) {
+                                  platform::plist::Format::XML, true, nullptr,
+                                  platform::plist::Durability::DataFlushed)) {
     QSAM_LOG(kQSLogLevelError, kFunction,
              "QSAppMigrator: Failed to write out container marker dictionary... hopefully we don't need it to "
              "recover.");

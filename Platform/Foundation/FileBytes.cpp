@@ -111,7 +111,7 @@ bool fillAndFlush(int fd, const Data& data, const URL& url, const std::string& s
                   Error* error) {
   if (!writeAll(fd, data)) return writeFailure(error, url, "write", shownPath);
   if (::fchmod(fd, modeForReplacing(url.path())) != 0) return writeFailure(error, url, "fchmod", shownPath);
-  if (durability == Durability::Flushed && ::fsync(fd) != 0) return writeFailure(error, url, "fsync", shownPath);
+  if (durability != Durability::Scratch && ::fsync(fd) != 0) return writeFailure(error, url, "fsync", shownPath);
   return true;
 }
 

@@ -404,11 +404,12 @@ std::optional<Data> serialize(const Value& value, Format format, Error* error) {
   return data;
 }
 
-bool writeFile(const Value& value, const URL& url, Format format, bool atomically, Error* error) {
+bool writeFile(const Value& value, const URL& url, Format format, bool atomically, Error* error,
+               Durability durability) {
   std::string problem;
   std::optional<Data> data = serializeValue(value, format, &problem);
   if (!data) return failWith(error, FileWriteError(url, problem));
-  return writeFileBytes(*data, url, atomically, error);
+  return writeFileBytes(*data, url, atomically, error, durability);
 }
 
 bool writeOrderedDictionary(const OrderedEntries& entries, const URL& url, Format format, bool atomically,

@@ -41,10 +41,15 @@ namespace platform::plist {
 
 enum class Format { XML, Binary };
 
-// Whether an atomic write is flushed. Scratch writes still replace the target
-// whole or not at all for every reader, but a power cut may lose them: for
-// files that are read back and removed before anything depends on them.
-enum class Durability { Flushed, Scratch };
+// Whether an atomic write is flushed. Flushed: the data before the file gets
+// its name, then the directory, so the write survives a power cut by itself.
+// DataFlushed: the data only; the name then persists in order with the other
+// changes of its file system (whatever changes there after it cannot reach
+// the disk before it), but nothing on another file system is ordered after
+// it. Scratch writes still replace the target whole or not at all for every
+// reader, but a power cut may lose them: for files that are read back and
+// removed before anything depends on them.
+enum class Durability { Flushed, DataFlushed, Scratch };
 
 // Files are read only when they are regular files no larger than a limit,
 // checked against the open file's status before anything is allocated; the
@@ -75,7 +80,7 @@ std::optional<Dictionary> readDictionary(const URL& url, const ReadOptions& opti
 // error); a URL nested inside is written as its path string.
 std::optional<Data> serialize(const Value& value, Format format, Error* error = nullptr);
 [[nodiscard]] bool writeFile(const Value& value, const URL& url, Format format = Format::XML, bool atomically = true,
-               Error* error = nullptr);
+                             Error* error = nullptr, Durability durability = Durability::Flushed);
 
 // A dictionary whose entries are written in the order given (a Dictionary is
 // ordered by key). Later duplicates of a key replace earlier ones in place.

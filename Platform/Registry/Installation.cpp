@@ -129,7 +129,7 @@ class Installation {
   bool planGroups(BundlePlan* plan, Error* error);
   void planCreation(const std::string& path);
   bool takeFileActions(Error* error);
-  bool syncTouchedDirectories(Error* error) const;
+  bool flushFileActionsThenCommit(Error* error) const;
   bool commit(Error* error);
   void rollBack();
   void cleanUp();
@@ -245,7 +245,7 @@ bool Installation::run(const Reporter& reporter, Error* error) {
     // makes new directories under fresh names: if a power cut loses its
     // journal, they are empty or copied directories that nothing records and
     // nothing else will ever use. Its journal goes to the disk with the
-    // commit that records them (same log, written before it).
+    // commit that records them (same log, written before it), at the barrier.
     const CommitDurability durability =
         transfer_ == Transfer::Move ? CommitDurability::Immediate : CommitDurability::WithNextFlush;
     std::lock_guard dbLock(state_.dbMutex);
@@ -262,6 +262,10 @@ bool Installation::run(const Reporter& reporter, Error* error) {
     rollBack();
     return false;
   }
+  // The commit is visible now but not yet durable. When the barrier fails the
+  // records stay (they describe what is on disk); the removals the commit
+  // journalled are left to the next recovery, which repeats them harmlessly.
+  if (!flushFileActionsThenCommit(error)) return false;
   reporter.status(kRegistryStatusCleaningUp, kPercentCleaningUp);
   cleanUp();
   reporter.status(kRegistryStatusComplete, kPercentComplete);
@@ -279,28 +283,23 @@ bool Installation::takeFileActions(Error* error) {
       if (!copyTree(plan.source, plan.bundlePath, error)) return false;
     }
   }
-  if (storeMetadata_ &&
-      !writeNewFile(path::join(bundles_.front().container, kStoreMetadataFileName), *storeMetadata_, error)) {
-    return false;
-  }
-  return syncTouchedDirectories(error);
+  return !storeMetadata_ ||
+         writeNewFile(path::join(bundles_.front().container, kStoreMetadataFileName), *storeMetadata_, error);
 }
 
-// The commit must not become durable before the file actions it records:
-// every directory that received an entry is flushed, once. The directories
-// that moved items left (Payload, the package directory) are not: until the
-// commit is durable a power cut rolls the move back whatever they say, and
-// after it the item is whole under its new name, which is flushed; at worst
-// the old name survives beside it until the package directory is removed,
-// and no item is ever in neither place. A copy flushes its own tree.
-bool Installation::syncTouchedDirectories(Error* error) const {
-  std::set<std::string> directories;
-  for (const JournalEntry& entry : journal_) directories.insert(parentOf(entry.destination));
-  for (const BundlePlan& plan : bundles_) directories.insert(plan.container);
-  for (const std::string& directory : directories) {
-    if (!syncDirectory(directory, error)) return false;
-  }
-  return true;
+// One barrier makes the installation durable: the file systems of the new
+// containers first (their directories, a copy's files, the moves' new names;
+// a move's old name is on the same file system), then the registry's own,
+// which holds the commit (written to the log without a flush, and with no
+// checkpoint that could flush it early). A power cut before the barrier loses
+// the commit: a move's flushed journal rolls it back, a copy leaves
+// directories that nothing records. Once the commit is on disk, so is
+// everything it records; nothing depends on the commit before this returns.
+bool Installation::flushFileActionsThenCommit(Error* error) const {
+  std::vector<std::string> paths;
+  for (const JournalEntry& entry : journal_) paths.push_back(parentOf(entry.destination));
+  paths.push_back(parentOf(state_.db->path()));
+  return syncFileSystems(paths, error);
 }
 
 bool Installation::commit(Error* error) {
@@ -312,7 +311,7 @@ bool Installation::commit(Error* error) {
   if (transfer_ == Transfer::Move && packagePath_) removals_.push_back({JournalKind::Remove, "", *packagePath_});
 
   std::lock_guard dbLock(state_.dbMutex);
-  auto transaction = Transaction::begin(*state_.db, error);
+  auto transaction = Transaction::begin(*state_.db, error, CommitDurability::WithNextFlush);
   if (!transaction) return false;
   for (const auto& [group, path] : newGroups_) {
     // A lookup of a built-in application of the same group may have recorded

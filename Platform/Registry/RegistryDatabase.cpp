@@ -224,10 +224,16 @@ bool Database::execute(const char* sql, Error* error) {
   return false;
 }
 
+// A checkpoint flushes the log before it copies it into the database, which
+// would make a commit durable before the barrier its caller orders after its
+// own file actions. So no checkpoint runs at a commit that waits for such a
+// barrier; the next immediate commit checkpoints at SQLite's default size.
+constexpr char kImmediateCommits[] = "PRAGMA synchronous=FULL; PRAGMA wal_autocheckpoint=1000;";
+constexpr char kCommitsWithNextFlush[] = "PRAGMA synchronous=NORMAL; PRAGMA wal_autocheckpoint=0;";
+
 bool Database::setCommitDurability(CommitDurability durability, Error* error) {
   if (durability == durability_) return true;
-  const char* pragma =
-      durability == CommitDurability::Immediate ? "PRAGMA synchronous=FULL;" : "PRAGMA synchronous=NORMAL;";
+  const char* pragma = durability == CommitDurability::Immediate ? kImmediateCommits : kCommitsWithNextFlush;
   if (!execute(pragma, error)) return false;
   durability_ = durability;
   return true;

@@ -29,10 +29,11 @@ class Statement;
 enum class CommitDurability {
   // The commit flushes the log (synchronous=FULL) before it returns.
   Immediate,
-  // The commit returns without a flush (synchronous=NORMAL); it reaches the
-  // disk with the next immediate commit or checkpoint. Only for changes whose
-  // loss in a power cut is harmless, or that a later immediate commit makes
-  // durable before anything depends on them.
+  // The commit returns without a flush (synchronous=NORMAL, and no automatic
+  // checkpoint at it); it reaches the disk with the next immediate commit or
+  // a flush of the log's file system. Only for changes whose loss in a power
+  // cut is harmless, or that such a flush makes durable before anything
+  // depends on them.
   WithNextFlush,
 };
 

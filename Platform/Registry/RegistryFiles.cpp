@@ -68,7 +68,6 @@ bool copyFileContents(const std::string& source, const std::string& destination,
     if (n == 0) break;
     if (!writeAll(out.get(), buffer.data(), static_cast<size_t>(n))) return fail(error, "write", destination, errno);
   }
-  if (fsync(out.get()) != 0) return fail(error, "fsync", destination, errno);
   if (!out.close()) return fail(error, "close", destination, errno);
   return true;
 }
@@ -174,7 +173,6 @@ bool copyTree(const std::string& source, const std::string& destination, Error* 
         break;
       case FTS_DP:
         if (chmod(target.c_str(), entry->fts_statp->st_mode & 07777) != 0) return fail(error, "chmod", target, errno);
-        if (!syncDirectory(target, error)) return false;
         break;
       case FTS_F:
         if (!copyFileContents(entry->fts_path, target, entry->fts_statp->st_mode, error)) return false;
@@ -199,17 +197,28 @@ bool moveItem(const std::string& source, const std::string& destination, Error* 
          fail(error, "rename", source + " to " + destination, errno);
 }
 
-bool syncDirectory(const std::string& path, Error* error) {
-  ScopedFD fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!fd.valid()) return fail(error, "open", path, errno);
-  return fsync(fd.get()) == 0 || fail(error, "fsync", path, errno);
+bool syncFileSystems(const std::vector<std::string>& paths, Error* error) {
+  std::vector<std::pair<dev_t, ScopedFD>> opened;
+  for (const std::string& path : paths) {
+    ScopedFD fd(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!fd.valid()) return fail(error, "open", path, errno);
+    struct stat st;
+    if (fstat(fd.get(), &st) != 0) return fail(error, "fstat", path, errno);
+    opened.emplace_back(st.st_dev, std::move(fd));
+  }
+  for (size_t i = 0; i < opened.size(); ++i) {
+    const auto later = std::find_if(opened.begin() + static_cast<std::ptrdiff_t>(i) + 1, opened.end(),
+                                    [&](const auto& entry) { return entry.first == opened[i].first; });
+    if (later != opened.end()) continue;  // flushed at its last place
+    if (syncfs(opened[i].second.get()) != 0) return fail(error, "syncfs", paths[i], errno);
+  }
+  return true;
 }
 
 bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error) {
   ScopedFD fd(open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kFileMode));
   if (!fd.valid()) return fail(error, "create", path, errno);
   if (!writeAll(fd.get(), bytes.data(), bytes.size())) return fail(error, "write", path, errno);
-  if (fsync(fd.get()) != 0) return fail(error, "fsync", path, errno);
   if (!fd.close()) return fail(error, "close", path, errno);
   return true;
 }

@@ -41,16 +41,18 @@ std::optional<std::vector<std::string>> listDirectory(const std::string& path, E
 // Removes the item at `path` and everything under it; nothing there is success.
 [[nodiscard]] bool removeTree(const std::string& path, Error* error);
 // Copies the tree at `source` to `destination` (which must not exist):
-// directories, regular files (with their modes) and symbolic links. Every file
-// and directory of the copy is flushed; the parent of `destination` is not.
+// directories, regular files (with their modes) and symbolic links. Nothing is
+// flushed: the caller makes the copy durable with syncFileSystems.
 [[nodiscard]] bool copyTree(const std::string& source, const std::string& destination, Error* error);
 // Renames `source` to `destination`. Only a rename can be undone after a crash,
 // so there is no copying fallback: across file systems this fails (EXDEV).
 [[nodiscard]] bool moveItem(const std::string& source, const std::string& destination, Error* error);
-// Flushes a directory's entries (fsync on the directory), so that the renames
-// and creations in it survive a power loss.
-[[nodiscard]] bool syncDirectory(const std::string& path, Error* error);
-// Writes `bytes` to a new file at `path` and flushes it.
+// Flushes the file system of each path (syncfs): every change made there
+// before, data and names, survives a power loss. Each file system is flushed
+// once, at the place of its last path, so the file system of the last path
+// is flushed after every other.
+[[nodiscard]] bool syncFileSystems(const std::vector<std::string>& paths, Error* error);
+// Writes `bytes` to a new file at `path`, not flushed (see copyTree).
 [[nodiscard]] bool writeNewFile(const std::string& path, const std::vector<uint8_t>& bytes, Error* error);
 // Sets the data-protection class attribute of the directory at `path`.
 [[nodiscard]] bool setProtectionClass(const std::string& path, int32_t protectionClass, Error* error);

@@ -151,21 +151,25 @@ TEST_F(RegistryRecovery, UnwritableDatabaseOrContainerFailsAndLeavesThePackageWh
 }
 
 // A commit that reaches the disk only with the next flush weakens that one
-// transaction: whether it is committed or rolled back, every later commit on
-// the connection is flushed again; one refused because another is open leaves
-// that one flushed.
+// transaction: it is not flushed and no checkpoint (which flushes the log)
+// runs at it; whether it is committed or rolled back, every later commit on
+// the connection is flushed and checkpointed again; one refused because
+// another is open leaves that one flushed.
 TEST_F(RegistryRecovery, CommitWithoutItsOwnFlushLastsOneTransaction) {
   using registry::CommitDurability;
   using registry::Transaction;
   Error error;
   auto db = registry::Database::open(at("registry.sqlite"), &error);
   ASSERT_TRUE(db) << error.description();
-  auto synchronous = [&] {
-    auto query = db->prepare("PRAGMA synchronous;", &error);
+  auto setting = [&](const char* pragma) {
+    auto query = db->prepare(pragma, &error);
     bool failed = false;
     return query && query->step(&failed, &error) ? query->integer(0) : -1;
   };
-  constexpr int64_t kNormal = 1, kFull = 2;
+  // synchronous, wal_autocheckpoint
+  auto durability = [&] { return std::pair(setting("PRAGMA synchronous;"), setting("PRAGMA wal_autocheckpoint;")); };
+  const std::pair<int64_t, int64_t> deferred{1, 0}, immediate{2, 1000};
+  EXPECT_EQ(durability(), immediate);
   const std::function<void(std::optional<Transaction>&)> endings[] = {
       [&](auto& t) { EXPECT_TRUE(db->execute("DELETE FROM install_journal;", &error) && t->commit(&error)); },
       [](auto& t) { t.reset(); },
@@ -174,14 +178,14 @@ TEST_F(RegistryRecovery, CommitWithoutItsOwnFlushLastsOneTransaction) {
     SCOPED_TRACE(k);
     std::optional<Transaction> transaction = Transaction::begin(*db, &error, CommitDurability::WithNextFlush);
     ASSERT_TRUE(transaction) << error.description();
-    EXPECT_EQ(synchronous(), kNormal);
+    EXPECT_EQ(durability(), deferred);
     endings[k](transaction);
-    EXPECT_EQ(synchronous(), kFull);
+    EXPECT_EQ(durability(), immediate);
   }
   std::optional<Transaction> open = Transaction::begin(*db, &error);
   ASSERT_TRUE(open) << error.description();
   EXPECT_FALSE(Transaction::begin(*db, &error, CommitDurability::WithNextFlush));
-  EXPECT_EQ(synchronous(), kFull);
+  EXPECT_EQ(durability(), immediate);
 }
 
 // The schema version of the database at `path`, after setting it to `set` when given.
