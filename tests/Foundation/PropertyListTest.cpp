@@ -5,7 +5,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <chrono>
 #include <cmath>
 #include <filesystem>
@@ -32,13 +31,6 @@ std::optional<Value> parseText(const std::string& text, Error* error = nullptr) 
 std::optional<Value> roundTrip(const Value& value, plist::Format format) {
   std::optional<Data> bytes = plist::serialize(value, format);
   return bytes ? plist::parse(bytes->data(), bytes->size()) : std::nullopt;
-}
-
-std::vector<std::string> directoryNames(const std::string& dir) {
-  std::vector<std::string> names;
-  for (const auto& entry : std::filesystem::directory_iterator(dir)) names.push_back(entry.path().filename());
-  std::sort(names.begin(), names.end());
-  return names;
 }
 
 // Expects a failure record: domain and code, a phrase of the reason, and the POSIX error beneath when given.
@@ -263,7 +255,7 @@ TEST_F(PropertyListFile, WritesRoundTripAndAtomicReplaceKeepsPermissionsAndLeave
   // Replacing a long name needs a temporary name within the name limit.
   const std::string longName(250, 'n');
   for (int i = 0; i < 2; ++i) EXPECT_TRUE(plist::writeFile(Value(Dictionary{}), urlOf(longName), kBinary, true));
-  EXPECT_EQ(directoryNames(dir_.path()), (std::vector<std::string>{"blob", "m.plist", longName}));
+  EXPECT_EQ(qstest::entries(dir_.path()), (std::vector<std::string>{"blob", "m.plist", longName}));
 }
 
 // The temporary file is linked beside the target, then the rename over the immutable target is refused.
@@ -289,8 +281,8 @@ TEST_F(PropertyListFile, RefusedWritesKeepTheOldFileAndLeaveNothingBeside) {
     EXPECT_FALSE(plist::writeFileBytes(Data(4096, 7), url, atomically, &error)) << url.path();
     expectFileError(error, kFileWriteUnknownError, code == ENOSPC ? "write failed" : "", code);
   }
-  EXPECT_EQ(directoryNames(pathOf("d.plist")), std::vector<std::string>{"child"});
-  EXPECT_EQ(directoryNames(dir_.path()), (std::vector<std::string>{"d.plist", "m.plist", "o.plist"}));
+  EXPECT_EQ(qstest::entries(pathOf("d.plist")), std::vector<std::string>{"child"});
+  EXPECT_EQ(qstest::entries(dir_.path()), (std::vector<std::string>{"d.plist", "m.plist", "o.plist"}));
 }
 
 // A writer killed at any instant leaves the old file or the new one, and no temporary file beside it.
@@ -307,7 +299,7 @@ TEST_F(PropertyListFile, WriterKilledWhileWritingLeavesNoTemporaryFile) {
     std::this_thread::sleep_for(std::chrono::milliseconds(delayMs));
     kill(child, SIGKILL);
     ASSERT_EQ(waitpid(child, nullptr, 0), child);
-    EXPECT_EQ(directoryNames(dir_.path()), std::vector<std::string>{"record.plist"}) << "after " << delayMs << " ms";
+    EXPECT_EQ(qstest::entries(dir_.path()), std::vector<std::string>{"record.plist"}) << "after " << delayMs << " ms";
     const size_t size = std::filesystem::file_size(pathOf("record.plist"));
     EXPECT_TRUE(size == 3 || size == big.size()) << size;
   }

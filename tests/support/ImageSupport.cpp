@@ -34,9 +34,7 @@ std::optional<platform::Image> decodePNGFile(const std::string& path) {
   return decodePNG(bytes);
 }
 
-namespace {
-
-bool writePNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA) {
+bool writeSplitPNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA) {
   std::vector<uint8_t> pixels(static_cast<size_t>(width) * height * 4);
   for (int y = 0; y < height; ++y) {
     for (int x = 0; x < width; ++x) {
@@ -55,16 +53,6 @@ bool writePNG(const std::string& path, int width, int height, uint32_t leftRGBA,
   png.height = static_cast<png_uint_32>(height);
   png.format = PNG_FORMAT_RGBA;
   return png_image_write_to_file(&png, path.c_str(), 0, pixels.data(), 0, nullptr) != 0;
-}
-
-}  // namespace
-
-bool writeSolidPNG(const std::string& path, int width, int height, uint32_t rgba) {
-  return writePNG(path, width, height, rgba, rgba);
-}
-
-bool writeSplitPNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA) {
-  return writePNG(path, width, height, leftRGBA, rightRGBA);
 }
 
 uint32_t pixelAt(const platform::Image& image, int x, int y) {

@@ -69,6 +69,11 @@ std::string readFile(const std::string& path);
 bool makeDirs(const std::string& path, unsigned mode = 0755);
 // Sets or clears the immutable flag (FS_IMMUTABLE_FL) on `path`.
 bool setImmutable(const std::string& path, bool on);
+// Removes the tree at `path`, not following links, immutable flags cleared
+// first; false when something remains. Reports no test failure itself.
+bool removeTree(const std::string& path);
+// The entries of a directory, sorted (none when it cannot be listed).
+std::vector<std::string> entries(const std::string& directory);
 // Runs `fn` in a forked child that has dropped to uid/gid 65534; returns the
 // child's exit status (fn's result), or -1 when the child died otherwise.
 int runAsNobody(const std::function<int()>& fn);
