@@ -16,16 +16,5 @@ TEST(Conventions, VersionUsageAndErrorsOfEveryProgram) {
   }
 }
 
-// devicegen verify --json: the same verdict as the text, as one document; an
-// image not migrated yet has its containers left behind.
-TEST(Conventions, DevicegenVerifyWritesJson) {
-  qstest::TempDir dir("verify");
-  ASSERT_EQ(createImage(dir / "image", {"--apps", "2", "--files-per-app", "1"}).status, 0);
-  EXPECT_THAT(runTool("devicegen", {"verify", "--json", "--root", dir / "image"}),
-              exited(1, _,
-                     AllOf(StartsWith("{\"root\":\""), EndsWith("\n"), Not(HasSubstr("\"left behind\":0")),
-                           HasSubstr("\"ok\":false,\"fatal\":null,\"summary\":{\"applications\":2,"))));
-}
-
 }  // namespace
 }  // namespace tooltest

@@ -8,7 +8,7 @@ namespace tooltest {
 namespace {
 
 // Before the migration the image fails, listing what is left and not
-// installed; after it, it passes; then each damage is reported as exactly
+// installed, in text and in JSON; after it, it passes; then each damage is reported as exactly
 // the problem it is, and an unreadable manifest fails the verification.
 TEST(DevicegenVerify, UnmigratedFailsMigratedPassesAndEachDamageIsReportedPrecisely) {
   qstest::TempDir dir("devicegen-verify");
@@ -21,6 +21,10 @@ TEST(DevicegenVerify, UnmigratedFailsMigratedPassesAndEachDamageIsReportedPrecis
   };
   verify(1, {"left behind: old applications directory " + root_ + kOldApplications,
              "registry: not installed: com.example.", "version: no last system version", "... and ", "FAILED"});
+  EXPECT_THAT(runTool("devicegen", {"verify", "--json", "--root", root_}),  // the same verdict, as one document
+              exited(1, _,
+                     AllOf(StartsWith("{\"root\":\""), EndsWith("}\n"), Not(HasSubstr("\"left behind\":0")),
+                           HasSubstr("\"ok\":false,\"fatal\":null,\"summary\":{\"applications\":8,"))));
   EXPECT_THAT(runTool("devicegen", {"verify", "--root", dir / "absent"}),  // a failure, not a usage error
               exited(1, HasSubstr("realpath " + (dir / "absent"))));
 
