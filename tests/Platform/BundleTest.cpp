@@ -80,8 +80,8 @@ TEST(IconRendering, IconIsScaledAndMaskedWithStraightAlphaFromAReadablePNGInside
   ASSERT_TRUE(mkfifo((dir / "Pipe.png").c_str(), 0644) == 0 && symlink("Pipe.png", (dir / "Piped.png").c_str()) == 0);
   ASSERT_TRUE(symlink("/dev/zero", (dir / "Zero.png").c_str()) == 0 && writeSolidPNG(dir / "Wide.png", 5000, 1, kRed));
   const std::pair<Value, std::optional<uint32_t>> cases[] = {
-      {"AppIcon.png", kRed}, {7, kBlue},         {escape, {}},    {"Absent.png", {}}, {"Junk.png", {}},
-      {"Half.png", {}},      {"Pipe.png", {}},   {"Piped.png", {}}, {"Zero.png", {}},   {"Wide.png", {}}};
+      {"AppIcon.png", kRed}, {7, kBlue},       {escape, {}},      {"Absent.png", {}}, {"Junk.png", {}},
+      {"Half.png", {}},      {"Pipe.png", {}}, {"Piped.png", {}}, {"Zero.png", {}},   {"Wide.png", {}}};
   for (const auto& [iconFile, atQuarter] : cases) {
     const std::optional<Image> icon = render(dir, {{kBundleIconFileKey, iconFile}});
     ASSERT_EQ(icon.has_value(), atQuarter.has_value()) << iconFile.description();

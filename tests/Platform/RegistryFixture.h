@@ -2,9 +2,8 @@
 // built-in applications in it, and open the registry on it.
 #pragma once
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <functional>
 
@@ -48,6 +47,9 @@ inline void makeBundle(const std::string& path, const TestBundle& b) {
 inline bool exists(const std::string& path) {
   std::error_code error;
   return std::filesystem::exists(std::filesystem::symlink_status(path, error));
+}
+MATCHER(PathExists, "names something") {
+  return exists(arg);
 }
 
 class RegistryTest : public testing::Test {

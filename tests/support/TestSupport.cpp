@@ -20,6 +20,18 @@
 
 #include <gtest/gtest.h>
 
+namespace platform {
+void PrintTo(const Value& value, std::ostream* os) {
+  *os << value.description();
+}
+void PrintTo(const URL& url, std::ostream* os) {
+  *os << url.description();
+}
+void PrintTo(const Error& error, std::ostream* os) {
+  *os << error.description();
+}
+}  // namespace platform
+
 namespace qstest {
 
 const std::string& systemRoot() {

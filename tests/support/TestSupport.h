@@ -11,8 +11,19 @@
 #include <string>
 #include <vector>
 
+#include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/URL.h"
+#include "Platform/Foundation/Value.h"
 #include "Platform/Host/HostLog.h"
 #include "Platform/SystemLog.h"
+
+// Values, URLs and error records print as their descriptions in failed
+// assertions (containers of them too), instead of as raw bytes.
+namespace platform {
+void PrintTo(const Value& value, std::ostream* os);
+void PrintTo(const URL& url, std::ostream* os);
+void PrintTo(const Error& error, std::ostream* os);
+}  // namespace platform
 
 namespace qstest {
 
