@@ -4,8 +4,8 @@
 
 #include <cstring>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
+
+#include "TestSupport.h"
 
 namespace qstest {
 
@@ -28,10 +28,8 @@ std::optional<platform::Image> decodePNG(const platform::Data& bytes) {
 
 std::optional<platform::Image> decodePNGFile(const std::string& path) {
   if (!std::filesystem::is_regular_file(path)) return std::nullopt;
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return std::nullopt;
-  platform::Data bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  return decodePNG(bytes);
+  const std::string bytes = readFile(path);
+  return decodePNG(platform::Data(bytes.begin(), bytes.end()));
 }
 
 bool writeSplitPNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA) {
@@ -39,11 +37,7 @@ bool writeSplitPNG(const std::string& path, int width, int height, uint32_t left
   for (int y = 0; y < height; ++y) {
     for (int x = 0; x < width; ++x) {
       const uint32_t rgba = x < width / 2 ? leftRGBA : rightRGBA;
-      uint8_t* p = &pixels[(static_cast<size_t>(y) * width + x) * 4];
-      p[0] = rgba >> 24;
-      p[1] = (rgba >> 16) & 0xff;
-      p[2] = (rgba >> 8) & 0xff;
-      p[3] = rgba & 0xff;
+      for (int k = 0; k < 4; ++k) pixels[(static_cast<size_t>(y) * width + x) * 4 + k] = rgba >> (24 - 8 * k);
     }
   }
   png_image png;

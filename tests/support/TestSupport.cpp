@@ -117,16 +117,17 @@ std::vector<platform::HostLogLine> LogCapture::hostLines() const {
   return host_;
 }
 
-std::vector<std::string> LogCapture::systemMessages() const {
+template <class Line>
+std::vector<std::string> messagesOf(const std::vector<Line>& lines) {
   std::vector<std::string> out;
-  for (const auto& l : systemLines()) out.push_back(l.message);
+  for (const Line& l : lines) out.push_back(l.message);
   return out;
 }
-
+std::vector<std::string> LogCapture::systemMessages() const {
+  return messagesOf(systemLines());
+}
 std::vector<std::string> LogCapture::hostMessages() const {
-  std::vector<std::string> out;
-  for (const auto& l : hostLines()) out.push_back(l.message);
-  return out;
+  return messagesOf(hostLines());
 }
 
 size_t LogCapture::count(const std::string& text) const {
