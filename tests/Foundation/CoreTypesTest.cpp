@@ -12,17 +12,32 @@ namespace {
 
 using namespace platform;
 
-TEST(Value, KindsAndSignednessAreKeptApartEqualityIsDeepConversionsSaturateAndTheDescriptionQuotes) {
-  EXPECT_NE(Value(UINT64_MAX), Value(-1));
-  EXPECT_EQ(Value(5), Value(5U));
-  EXPECT_TRUE(Value(1.0) != Value(1) && Value(true) != Value(1) && Value(nullptr) == Value());
-  EXPECT_NE(Value(Array{Value(Data{1, 2})}), Value(Array{Value(Data{1, 3})}));
-  EXPECT_NE(Value(Error("D", 1, {{"x", Value(1)}})), Value(Error("D", 1, {{"x", Value(2)}})));
+// Each row: two values and whether they are equal.
+TEST(ValueEquality, KindsAndSignednessAreKeptApartAndContainersCompareDeeply) {
+  const std::tuple<Value, Value, bool> rows[] = {
+      {Value(UINT64_MAX), Value(-1), false},
+      {Value(5), Value(5U), true},
+      {Value(1.0), Value(1), false},
+      {Value(true), Value(1), false},
+      {Value(nullptr), Value(), true},
+      {Value(Array{Value(Data{1, 2})}), Value(Array{Value(Data{1, 3})}), false},
+      {Value(Error("D", 1, {{"x", Value(1)}})), Value(Error("D", 1, {{"x", Value(2)}})), false},
+  };
+  for (const auto& [a, b, equal] : rows) EXPECT_EQ(a == b, equal) << a.description() << " == " << b.description();
+}
+
+TEST(ValueConversions, SaturateTruncateTowardZeroAndFallBackOnlyForOtherKinds) {
   EXPECT_EQ((std::vector<int64_t>{Value(-2.9).int64Value(), Value(-1e30).int64Value(), Value(NAN).int64Value(),
                                   Value(true).int64Value()}),
             (std::vector<int64_t>{-2, INT64_MIN, 0, 1}));
-  EXPECT_TRUE(Value(1e30).uint64Value() == UINT64_MAX && Value(0.5).uint64Value() == 0 && Value(0.1).boolValue() &&
-              !Value(0).boolValue(true) && Value("s").doubleValue(2.5) == 2.5 && !Value("s").isNumber());
+  EXPECT_EQ((std::vector<uint64_t>{Value(1e30).uint64Value(), Value(0.5).uint64Value(), Value(NAN).uint64Value()}),
+            (std::vector<uint64_t>{UINT64_MAX, 0, 0}));
+  EXPECT_EQ((std::vector<bool>{Value(0.1).boolValue(), Value(0).boolValue(true), Value("s").isNumber()}),
+            (std::vector<bool>{true, false, false}));
+  EXPECT_EQ(Value("s").doubleValue(2.5), 2.5);
+}
+
+TEST(ValueDescription, QuotesStringsAndAbbreviatesLongData) {
   EXPECT_EQ(Value(Dictionary{{"a b", Value(Array{Value(""), Value("say \"hi\"\n"), Value(Data(30, 0x1f)), Value(),
                                                  Value(UINT64_MAX), Value(3.0), Value(0.5), Value(Date{1.5}),
                                                  Value(URL::fileURL("/x"))})}})

@@ -13,11 +13,11 @@ TEST(Json, StringsOfAnyBytesAreEscapedAndRecoverable) {
       {std::string("\x01\x1f\x7f", 3), "\"\\u0001\\u001f\\u007f\""},
       {std::string("nul\0x", 5), "\"nul\\u0000x\""},
       {"\xc3\xa9\xe2\x82\xac\xf0\x9f\x98\x80", "\"\xc3\xa9\xe2\x82\xac\xf0\x9f\x98\x80\""},  // kept as UTF-8
-      {"\xff", "\"\\udcff\""},                                                              // not UTF-8
-      {"\xc0\xaf", "\"\\udcc0\\udcaf\""},                                                   // overlong
-      {"\xed\xa0\x80", "\"\\udced\\udca0\\udc80\""},                                        // a surrogate
-      {"\xf4\x90\x80\x80", "\"\\udcf4\\udc90\\udc80\\udc80\""},                             // beyond U+10FFFF
-      {"\xe2\x82", "\"\\udce2\\udc82\""},                                                   // cut short
+      {"\xff", "\"\\udcff\""},                                                               // not UTF-8
+      {"\xc0\xaf", "\"\\udcc0\\udcaf\""},                                                    // overlong
+      {"\xed\xa0\x80", "\"\\udced\\udca0\\udc80\""},                                         // a surrogate
+      {"\xf4\x90\x80\x80", "\"\\udcf4\\udc90\\udc80\\udc80\""},                              // beyond U+10FFFF
+      {"\xe2\x82", "\"\\udce2\\udc82\""},                                                    // cut short
   };
   for (const auto& [bytes, expected] : cases) EXPECT_EQ(platform::jsonQuoted(bytes), expected) << expected;
 }

@@ -5,10 +5,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <chrono>
 #include <cmath>
 #include <filesystem>
+#include <functional>
 #include <random>
 #include <thread>
 
@@ -34,18 +34,13 @@ std::optional<Value> roundTrip(const Value& value, plist::Format format) {
   return bytes ? plist::parse(bytes->data(), bytes->size()) : std::nullopt;
 }
 
-std::vector<std::string> directoryNames(const std::string& dir) {
-  std::vector<std::string> names;
-  for (const auto& entry : std::filesystem::directory_iterator(dir)) names.push_back(entry.path().filename());
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
 // Expects a failure record: domain and code, a phrase of the reason, and the POSIX error beneath when given.
 void expectFileError(const Error& error, int code, const std::string& phrase, int posix = 0) {
   EXPECT_TRUE(error.is(kFileErrorDomain, code)) << error.description();
   EXPECT_NE(error.localizedDescription().find(phrase), std::string::npos) << error.description();
-  EXPECT_TRUE(!posix || (error.underlyingError() && error.underlyingError()->isPOSIX(posix))) << error.description();
+  if (posix) {
+    EXPECT_TRUE(error.underlyingError() && error.underlyingError()->isPOSIX(posix)) << error.description();
+  }
 }
 
 // Every type a property list holds, with the integer edges libplist gets wrong
@@ -229,23 +224,76 @@ class PropertyListFile : public testing::Test {
   qstest::TempDir dir_;
 };
 
-// Each case: the file, the code, a phrase of the reason, the POSIX error beneath (0: none).
-TEST_F(PropertyListFile, ReadFailuresSayWhyWithThePOSIXErrorBeneath) {
-  ASSERT_TRUE(qstest::makeDirs(pathOf("dir.plist")));
-  ASSERT_EQ(mkfifo(pathOf("pipe").c_str(), 0644), 0);  // would block a plain reader for ever
-  ASSERT_TRUE(qstest::writeFile(pathOf("bad.plist"), kHeader + "<plist><integer>abc</integer></plist>"));
-  const std::tuple<std::string, int, std::string, int> cases[] = {
-      {"absent.plist", kFileReadNoSuchFileError, "Could not read \"" + pathOf("absent.plist") + "\": no such file",
-       ENOENT},
-      {"dir.plist", kFileReadUnknownError, "", EISDIR},
-      {"pipe", kFileReadUnknownError, "not a regular file", 0},
-      {"bad.plist", kFileReadUnknownError, "\": not a valid property list: integer element holds", 0}};
-  for (const auto& [name, code, phrase, posix] : cases) {
+// Each case makes the file at `path` in its own way; the read must end at once with a record that names the
+// path and says why, the POSIX error beneath when there is one, having allocated nothing near a claimed size
+// and waited on nothing.
+TEST_F(PropertyListFile, ReadFailuresSayWhyAndNeitherExhaustMemoryNorBlock) {
+  const std::string plist = "<plist><dict/></plist>";
+  using Make = std::function<bool(const std::string&)>;
+  const Make fifo = [](const std::string& p) { return mkfifo(p.c_str(), 0644) == 0; };
+  const struct {
+    const char* name;
+    Make make;
+    plist::ReadOptions options;
+    int code;
+    std::string reason;
+    int posix;
+  } kCases[] = {
+      {"absent", [](auto) { return true; }, {}, kFileReadNoSuchFileError, "no such file", ENOENT},
+      {"directory", [](auto p) { return qstest::makeDirs(p); }, {}, kFileReadUnknownError, "", EISDIR},
+      {"not a property list",
+       [](auto p) { return qstest::writeFile(p, kHeader + "<plist><integer>abc</integer></plist>"); },
+       {},
+       kFileReadUnknownError,
+       "not a valid property list: integer element holds",
+       0},
+      {"sparse 40 GiB",
+       [](auto p) { return qstest::writeFile(p, "") && truncate(p.c_str(), 40LL << 30) == 0; },
+       {},
+       kFileReadUnknownError,
+       "the file holds at least 42949672960 bytes, more than the 33554432 this reader takes",
+       0},
+      {"one byte over a small limit",
+       [&](auto p) { return qstest::writeFile(p, plist); },
+       {.sizeLimit = plist.size() - 1},
+       kFileReadUnknownError,
+       "the file holds at least 22 bytes, more than the 21 this reader takes",
+       0},
+      {"fifo", fifo, {}, kFileReadUnknownError, "not a regular file", 0},
+      {"link to a fifo",
+       [&](auto p) { return fifo(p + ".fifo") && symlink((p + ".fifo").c_str(), p.c_str()) == 0; },
+       {},
+       kFileReadUnknownError,
+       "not a regular file",
+       0},
+      {"character device",
+       [](auto p) { return symlink("/dev/zero", p.c_str()) == 0; },
+       {},
+       kFileReadUnknownError,
+       "not a regular file",
+       0},
+      {"refused link",
+       [&](auto p) { return qstest::writeFile(p + ".real", plist) && symlink((p + ".real").c_str(), p.c_str()) == 0; },
+       {.finalLink = plist::FinalLink::Refuse},
+       kFileReadUnknownError,
+       "a symbolic link, which this reader does not follow",
+       0},
+  };
+  int n = 0;
+  for (const auto& c : kCases) {
+    SCOPED_TRACE(c.name);
+    const std::string path = pathOf("case" + std::to_string(++n));
+    ASSERT_TRUE(c.make(path));
     Error error;
-    EXPECT_FALSE(plist::readFile(urlOf(name), &error));
-    expectFileError(error, code, phrase, posix);
-    EXPECT_EQ(error.userInfo().at(kFilePathErrorKey), Value(pathOf(name)));
+    EXPECT_FALSE(plist::readDictionary(URL::fileURL(path), c.options, &error));
+    expectFileError(error, c.code, "Could not read \"" + path + "\": " + c.reason, c.posix);
+    EXPECT_EQ(error.userInfo().at(kFilePathErrorKey), Value(path));
   }
+  // The same files within their limits, links followed, read as before.
+  ASSERT_TRUE(qstest::writeFile(pathOf("fits"), plist));
+  ASSERT_EQ(symlink(pathOf("fits").c_str(), pathOf("linked").c_str()), 0);
+  EXPECT_TRUE(plist::readDictionary(urlOf("fits"), {.sizeLimit = plist.size()}));
+  EXPECT_TRUE(plist::readDictionary(urlOf("linked")));
 }
 
 TEST_F(PropertyListFile, WritesRoundTripAndAtomicReplaceKeepsPermissionsAndLeavesNoTemporaryFile) {
@@ -263,7 +311,7 @@ TEST_F(PropertyListFile, WritesRoundTripAndAtomicReplaceKeepsPermissionsAndLeave
   // Replacing a long name needs a temporary name within the name limit.
   const std::string longName(250, 'n');
   for (int i = 0; i < 2; ++i) EXPECT_TRUE(plist::writeFile(Value(Dictionary{}), urlOf(longName), kBinary, true));
-  EXPECT_EQ(directoryNames(dir_.path()), (std::vector<std::string>{"blob", "m.plist", longName}));
+  EXPECT_EQ(qstest::entries(dir_.path()), (std::vector<std::string>{"blob", "m.plist", longName}));
 }
 
 // The temporary file is linked beside the target, then the rename over the immutable target is refused.
@@ -289,8 +337,8 @@ TEST_F(PropertyListFile, RefusedWritesKeepTheOldFileAndLeaveNothingBeside) {
     EXPECT_FALSE(plist::writeFileBytes(Data(4096, 7), url, atomically, &error)) << url.path();
     expectFileError(error, kFileWriteUnknownError, code == ENOSPC ? "write failed" : "", code);
   }
-  EXPECT_EQ(directoryNames(pathOf("d.plist")), std::vector<std::string>{"child"});
-  EXPECT_EQ(directoryNames(dir_.path()), (std::vector<std::string>{"d.plist", "m.plist", "o.plist"}));
+  EXPECT_EQ(qstest::entries(pathOf("d.plist")), std::vector<std::string>{"child"});
+  EXPECT_EQ(qstest::entries(dir_.path()), (std::vector<std::string>{"d.plist", "m.plist", "o.plist"}));
 }
 
 // A writer killed at any instant leaves the old file or the new one, and no temporary file beside it.
@@ -307,7 +355,7 @@ TEST_F(PropertyListFile, WriterKilledWhileWritingLeavesNoTemporaryFile) {
     std::this_thread::sleep_for(std::chrono::milliseconds(delayMs));
     kill(child, SIGKILL);
     ASSERT_EQ(waitpid(child, nullptr, 0), child);
-    EXPECT_EQ(directoryNames(dir_.path()), std::vector<std::string>{"record.plist"}) << "after " << delayMs << " ms";
+    EXPECT_EQ(qstest::entries(dir_.path()), std::vector<std::string>{"record.plist"}) << "after " << delayMs << " ms";
     const size_t size = std::filesystem::file_size(pathOf("record.plist"));
     EXPECT_TRUE(size == 3 || size == big.size()) << size;
   }

@@ -1,5 +1,4 @@
-// Reading files the system does not control, and judging where their paths
-// lead.
+// Judging where paths the system does not control lead.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -15,50 +14,9 @@
 namespace {
 
 using namespace platform;
-using qstest::TempDir;
 using qstest::makeDirs;
+using qstest::TempDir;
 using qstest::writeFile;
-
-// Each case makes the file at `path` in its own way; the read must end at once
-// with a 256 record saying why, having allocated nothing near the claimed size.
-TEST(UntrustedRead, RefusesWhatWouldExhaustMemoryOrBlock) {
-  TempDir dir;
-  const std::string plist = "<plist><dict/></plist>";
-  const struct {
-    const char* name;
-    std::function<bool(const std::string&)> make;
-    plist::ReadOptions options;
-    const char* reason;
-  } kCases[] = {
-      {"sparse 40 GiB", [](const std::string& p) { return writeFile(p, "") && truncate(p.c_str(), 40LL << 30) == 0; },
-       {}, "more than the 33554432 this reader takes"},
-      {"one byte over a small limit", [&](const std::string& p) { return writeFile(p, plist); },
-       {.sizeLimit = plist.size() - 1}, "more than the 21 this reader takes"},
-      {"fifo", [](const std::string& p) { return mkfifo(p.c_str(), 0644) == 0; }, {}, "not a regular file"},
-      {"link to a fifo", [&](const std::string& p) {
-         return mkfifo((p + ".fifo").c_str(), 0644) == 0 && symlink((p + ".fifo").c_str(), p.c_str()) == 0;
-       }, {}, "not a regular file"},
-      {"character device", [](const std::string& p) { return symlink("/dev/zero", p.c_str()) == 0; }, {},
-       "not a regular file"},
-      {"refused link", [&](const std::string& p) {
-         return writeFile(p + ".real", plist) && symlink((p + ".real").c_str(), p.c_str()) == 0;
-       }, {.finalLink = plist::FinalLink::Refuse}, "a symbolic link, which this reader does not follow"},
-  };
-  int n = 0;
-  for (const auto& c : kCases) {
-    SCOPED_TRACE(c.name);
-    const std::string path = dir / ("case" + std::to_string(++n));
-    ASSERT_TRUE(c.make(path));
-    Error error;
-    EXPECT_FALSE(plist::readDictionary(URL::fileURL(path), c.options, &error));
-    EXPECT_EQ(error.code(), kFileReadUnknownError);
-    EXPECT_NE(error.description().find(c.reason), std::string::npos) << error.description();
-  }
-  // The same files within their limits, links followed, read as before.
-  ASSERT_TRUE(writeFile(dir / "fits", plist) && symlink((dir / "fits").c_str(), (dir / "linked").c_str()) == 0);
-  EXPECT_TRUE(plist::readDictionary(URL::fileURL(dir / "fits"), {.sizeLimit = plist.size()}));
-  EXPECT_TRUE(plist::readDictionary(URL::fileURL(dir / "linked")));
-}
 
 TEST(PathContainment, JudgesWhereEveryExistingPartLeads) {
   TempDir dir;

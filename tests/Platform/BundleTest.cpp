@@ -21,20 +21,25 @@ TEST(BundleReading, InfoDictionaryOfDirectoriesOnly) {
   FileBundleReader reader;
   makeBundle(dir / "Notes.app", {.identifier = "ex.notes"});
   auto bundle = reader.openBundle(URL::fileURL(dir / "Notes.app", true));
-  ASSERT_TRUE(bundle && bundle->identifier() == "ex.notes");
+  ASSERT_TRUE(bundle);
+  EXPECT_EQ(bundle->identifier(), "ex.notes");
   std::optional<Dictionary> info = reader.infoDictionary(*bundle);
   ASSERT_TRUE(info && info->at(kBundleInfoPlistURLKey).asURL());
   EXPECT_EQ(info->at(kBundleInfoPlistURLKey).asURL()->path(), dir / "Notes.app/Info.plist");
   EXPECT_FALSE(bundle->info()->count(kBundleInfoPlistURLKey));
 
   ASSERT_TRUE(writeFile(dir / "file.app", "x"));
-  EXPECT_FALSE(reader.openBundle(URL::fileURL(dir / "file.app", true)) || reader.openBundle(URL()) ||
-               reader.openBundle(URL::fileURL(dir / "missing.app", true)));
+  for (const URL& notABundle : {URL::fileURL(dir / "file.app", true), URL(), URL::fileURL(dir / "missing.app", true)})
+    EXPECT_FALSE(reader.openBundle(notABundle)) << notABundle.description();
   ASSERT_TRUE(writeFile(dir / "Notes.app/Info.plist",
                         "<?xml version=\"1.0\"?><plist><array><string>x</string></array></plist>"));
   for (const std::string& bad : {dir / "Notes.app", dir.path()}) {  // an array, and no Info.plist at all
+    SCOPED_TRACE(bad);
     auto opened = reader.openBundle(URL::fileURL(bad, true));
-    EXPECT_TRUE(opened && !opened->info() && !reader.infoDictionary(*opened) && !opened->identifier()) << bad;
+    ASSERT_TRUE(opened);
+    EXPECT_EQ(opened->info(), std::nullopt);
+    EXPECT_EQ(reader.infoDictionary(*opened), std::nullopt);
+    EXPECT_EQ(opened->identifier(), std::nullopt);
   }
 }
 
@@ -80,8 +85,8 @@ TEST(IconRendering, IconIsScaledAndMaskedWithStraightAlphaFromAReadablePNGInside
   ASSERT_TRUE(mkfifo((dir / "Pipe.png").c_str(), 0644) == 0 && symlink("Pipe.png", (dir / "Piped.png").c_str()) == 0);
   ASSERT_TRUE(symlink("/dev/zero", (dir / "Zero.png").c_str()) == 0 && writeSolidPNG(dir / "Wide.png", 5000, 1, kRed));
   const std::pair<Value, std::optional<uint32_t>> cases[] = {
-      {"AppIcon.png", kRed}, {7, kBlue},         {escape, {}},    {"Absent.png", {}}, {"Junk.png", {}},
-      {"Half.png", {}},      {"Pipe.png", {}},   {"Piped.png", {}}, {"Zero.png", {}},   {"Wide.png", {}}};
+      {"AppIcon.png", kRed}, {7, kBlue},       {escape, {}},      {"Absent.png", {}}, {"Junk.png", {}},
+      {"Half.png", {}},      {"Pipe.png", {}}, {"Piped.png", {}}, {"Zero.png", {}},   {"Wide.png", {}}};
   for (const auto& [iconFile, atQuarter] : cases) {
     const std::optional<Image> icon = render(dir, {{kBundleIconFileKey, iconFile}});
     ASSERT_EQ(icon.has_value(), atQuarter.has_value()) << iconFile.description();
@@ -99,8 +104,8 @@ Image gradient(int width, int height) {
 TEST(PNGEncoding, RoundTripsPixelsExactlyAndRefusesAnythingButOneWellFormedImage) {
   PNGImageEncoding encoding;
   Data buffer;
-  EXPECT_FALSE(encoding.createEncoder(buffer, "public.jpeg", 1) || encoding.createEncoder(buffer, kImageTypePNG, 0) ||
-               encoding.createEncoder(buffer, kImageTypePNG, 2));
+  for (const auto& [type, count] : {std::pair{"public.jpeg", 1}, {kImageTypePNG, 0}, {kImageTypePNG, 2}})
+    EXPECT_FALSE(encoding.createEncoder(buffer, type, count)) << type << " " << count;
   Image truncated = gradient(4, 4);
   truncated.rgba.pop_back();
   for (const std::vector<Image>& images : std::vector<std::vector<Image>>{

@@ -50,12 +50,12 @@ TEST_F(RegistryAreas, JournalRowsPointingElsewhereAreRefusedAndKept) {
     EXPECT_FALSE(install(*registry, makePackage("p", {.identifier = "ex.after", .version = "1"}), "ex.after", &error));
     EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorOutsideAreas)) << error.description();
     EXPECT_EQ(readFile(sentinel), "mine");
-    EXPECT_TRUE(exists(container + "/App.app") && exists(at("elsewhere/Payload/x")));
+    EXPECT_THAT((std::vector{container + "/App.app", at("elsewhere/Payload/x")}), testing::Each(PathExists()));
     plant(base_, "DELETE FROM install_journal;");  // what the person does
   }
   // A package directory elsewhere in the root is a row the registry writes.
-  plant(base_, "INSERT INTO install_journal(kind, source, destination) VALUES('remove', '', '" + at("elsewhere") +
-                   "');");
+  plant(base_,
+        "INSERT INTO install_journal(kind, source, destination) VALUES('remove', '', '" + at("elsewhere") + "');");
   ASSERT_TRUE(installApp(*openRegistry(), {.identifier = "ex.after", .version = "1"}));
   EXPECT_FALSE(exists(at("elsewhere")));
   // A package outside the root is not installed from (nor, later, removed).
@@ -80,11 +80,12 @@ TEST_F(RegistryAreas, RecordedContainersElsewhereStopTheInstallation) {
   for (const auto& c : kCases) {
     SCOPED_TRACE(c.identifier);
     ASSERT_TRUE(installApp(*openRegistry(), {.identifier = c.identifier, .version = "1", .groups = {"g"}}));
-    plant(base_, c.sql + (std::string(c.identifier) == "ex.group" ? ";" : " WHERE identifier = '" +
-                                                                             std::string(c.identifier) + "';"));
+    plant(base_, c.sql + (std::string(c.identifier) == "ex.group"
+                              ? ";"
+                              : " WHERE identifier = '" + std::string(c.identifier) + "';"));
     Error error;
-    EXPECT_FALSE(install(*openRegistry(), makePackage(c.identifier, {.identifier = c.identifier, .version = "2",
-                                                                      .groups = {"g"}}),
+    EXPECT_FALSE(install(*openRegistry(),
+                         makePackage(c.identifier, {.identifier = c.identifier, .version = "2", .groups = {"g"}}),
                          c.identifier, &error));
     EXPECT_TRUE(error.is(kRegistryErrorDomain, kRegistryErrorOutsideAreas)) << error.description();
     EXPECT_EQ(readFile(at("private/var/mobile/Documents/k")), "k");

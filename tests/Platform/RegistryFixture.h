@@ -2,9 +2,8 @@
 // built-in applications in it, and open the registry on it.
 #pragma once
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <functional>
 
@@ -44,19 +43,13 @@ inline void makeBundle(const std::string& path, const TestBundle& b) {
   ASSERT_TRUE(writeFile(path + "/main", "executable of " + b.identifier));
 }
 
-// Entries of a directory (none when it is missing), sorted; whether a path
-// names anything, a dangling link included.
-inline std::vector<std::string> entries(const std::string& directory) {
-  std::vector<std::string> names;
-  std::error_code missing;
-  for (const auto& entry : std::filesystem::directory_iterator(directory, missing))
-    names.push_back(entry.path().filename());
-  std::sort(names.begin(), names.end());
-  return names;
-}
+// Whether a path names anything, a dangling link included.
 inline bool exists(const std::string& path) {
   std::error_code error;
   return std::filesystem::exists(std::filesystem::symlink_status(path, error));
+}
+MATCHER(PathExists, "names something") {
+  return exists(arg);
 }
 
 class RegistryTest : public testing::Test {

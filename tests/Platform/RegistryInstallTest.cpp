@@ -78,7 +78,8 @@ TEST_F(RegistryInstall, PlaceholderIsACopyWhoseDataContainerOutlivesItsReplaceme
   ASSERT_EQ(placeholder("ex.game", Value(Data{'<', 0, 0xFF}), staged), 0);
   EXPECT_FALSE(registry->isInstalled("ex.inner"));
   const BundleRecord first = *registry->recordForIdentifier("ex.game");
-  EXPECT_TRUE(first.bundleType == kBundleTypePlaceholder && first.isPlaceholder);
+  EXPECT_EQ(first.bundleType, kBundleTypePlaceholder);
+  EXPECT_TRUE(first.isPlaceholder);
   EXPECT_FALSE(first.groupContainerURLs) << "a placeholder's record has no group dictionary";
   EXPECT_EQ(readFile(first.bundleURL.path() + "/Info.plist"), readFile(staged + "/Info.plist"));
   EXPECT_EQ(readFile(first.bundleContainerURL.path() + "/VendraMetadata.plist"), std::string("<\0\xFF", 3));
@@ -91,7 +92,8 @@ TEST_F(RegistryInstall, PlaceholderIsACopyWhoseDataContainerOutlivesItsReplaceme
   EXPECT_FALSE(exists(first.bundleContainerURL.path()));
   ASSERT_TRUE(installApp(*registry, {.identifier = "ex.game", .groups = {"group.game"}}));
   const BundleRecord real = *registry->recordForIdentifier("ex.game");
-  EXPECT_TRUE(!real.isPlaceholder && real.groupContainerURLs->size() == 1);
+  EXPECT_FALSE(real.isPlaceholder);
+  EXPECT_THAT(real.groupContainerURLs, testing::Optional(testing::SizeIs(1)));
   EXPECT_EQ(readFile(real.dataContainerURL->path() + "/save.dat"), "level 9");
   EXPECT_FALSE(exists(second.bundleContainerURL.path()));
 
@@ -165,9 +167,10 @@ TEST_F(RegistryInstall, BuiltInContainersAndTheDaemonsCalls) {
   EXPECT_TRUE(registry->safeHarbors().empty());
   for (const char* path : {"harbors/game", "harbors/two"}) {
     EXPECT_TRUE(registry->QuillsetRegisterSafeHarborForContainerType(at(path), "ex.game", 2, nullptr));
-    std::vector<SafeHarborRecord> harbors = openRegistry()->safeHarbors();
-    EXPECT_TRUE(harbors.size() == 1 && harbors[0].identifier == "ex.game" && harbors[0].path == at(path) &&
-                harbors[0].containerType == 2);
+    std::vector<std::tuple<std::string, std::string, int>> harbors;
+    for (const SafeHarborRecord& h : openRegistry()->safeHarbors())
+      harbors.emplace_back(h.identifier, h.path, h.containerType);
+    EXPECT_EQ(harbors, (std::vector<std::tuple<std::string, std::string, int>>{{"ex.game", at(path), 2}}));
   }
 }
 

@@ -5,21 +5,17 @@
 namespace qstest {
 namespace {
 
-class RegistryReaderTest : public RegistryTest {
- protected:
-  std::unique_ptr<platform::RegistryReader> openReader(bool allowMissing, platform::Error* error = nullptr) {
-    return platform::RegistryReader::open(base_, allowMissing, error);
-  }
-};
+using RegistryReaderTest = RegistryTest;
+using platform::RegistryReader;
 
 // Without a database: refused, or read as built-in applications only; either
 // way nothing is made under the root.
 TEST_F(RegistryReaderTest, RootWithoutDatabaseMakesNothing) {
   makeBundle(at("Applications/Clock.app"), {.identifier = "com.example.clock", .version = "3.0"});
   platform::Error error;
-  EXPECT_FALSE(openReader(false, &error));
+  EXPECT_FALSE(RegistryReader::open(base_, false, &error));
   EXPECT_EQ(registryCode(error), platform::kRegistryErrorNoDatabase);
-  auto reader = openReader(true);
+  auto reader = RegistryReader::open(base_, true);
   ASSERT_TRUE(reader);
   const auto clock = reader->recordForIdentifier("com.example.clock");
   ASSERT_TRUE(clock);
@@ -42,7 +38,7 @@ TEST_F(RegistryReaderTest, ReadsRecordsAndForetellsRefusals) {
     ASSERT_TRUE(installApp(*registry, {.identifier = "com.example.ledger", .groups = {"group.books"}}));
     ASSERT_TRUE(registry->recordForIdentifier("com.example.clock"));  // makes the built-in's data container
   }
-  auto reader = openReader(false);
+  auto reader = RegistryReader::open(base_, false);
   ASSERT_TRUE(reader);
   const auto ledger = reader->recordForIdentifier("com.example.ledger");
   ASSERT_TRUE(ledger && ledger->dataContainerURL);
@@ -51,8 +47,8 @@ TEST_F(RegistryReaderTest, ReadsRecordsAndForetellsRefusals) {
   const auto clock = reader->recordForIdentifier("com.example.clock");
   ASSERT_TRUE(clock && clock->dataContainerURL);
   EXPECT_FALSE(clock->dataContainerToBeMade);
-  const std::pair<const char*, bool> versions[] = {{"2.9", true}, {"3", true}, {"3.0", true}, {"3.0.1", false},
-                                                   {"10", false}};
+  const std::pair<const char*, bool> versions[] = {
+      {"2.9", true}, {"3", true}, {"3.0", true}, {"3.0.1", false}, {"10", false}};
   for (const auto& [version, refused] : versions) {
     EXPECT_EQ(reader->refusesAsNotNewerThanBuiltIn("com.example.clock", version), refused) << version;
   }

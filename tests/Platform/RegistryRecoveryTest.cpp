@@ -44,14 +44,17 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
       _exit(3);  // the kill never came
     }
     int result = 0;
-    ASSERT_TRUE(child > 0 && waitpid(child, &result, 0) == child && WIFSIGNALED(result) && WTERMSIG(result) == SIGKILL);
+    ASSERT_GT(child, 0);
+    ASSERT_EQ(waitpid(child, &result, 0), child);
+    ASSERT_EQ(WIFSIGNALED(result) ? WTERMSIG(result) : -1, SIGKILL) << "exit status " << WEXITSTATUS(result);
 
     LogCapture log;
     auto registry = openRegistry();
     EXPECT_EQ(log.contains("Recovered interrupted installation"), journalled);
     BundleRecord record = *registry->recordForIdentifier(id);
     EXPECT_EQ(record.version, committed ? "2" : "1");
-    EXPECT_TRUE(record.foundBackingBundle && record.dataContainerURL == old.dataContainerURL);
+    EXPECT_TRUE(record.foundBackingBundle);
+    EXPECT_EQ(record.dataContainerURL, old.dataContainerURL);
     EXPECT_EQ(readFile(old.dataContainerURL->path() + "/inbox"), "mail");
     EXPECT_EQ(registry->isInstalled(id + ".tunnel"), committed);
     EXPECT_EQ(exists(package), !committed);
@@ -67,22 +70,25 @@ TEST_F(RegistryRecovery, ReinstallKilledAtEachStageIsRolledBackOrFinishedWhenOpe
     // The application and its new plug-in in containers of their own, the
     // store metadata beside the application only.
     const std::optional<BundleRecord> tunnel = registry->recordForIdentifier(id + ".tunnel");
-    ASSERT_TRUE(tunnel && tunnel->dataContainerURL && exists(tunnel->dataContainerURL->path()) &&
-                tunnel->groupContainerURLs && tunnel->groupContainerURLs->empty());
+    ASSERT_TRUE(tunnel && tunnel->dataContainerURL);
+    EXPECT_THAT(tunnel->dataContainerURL->path(), PathExists());
+    EXPECT_THAT(tunnel->groupContainerURLs, testing::Optional(testing::IsEmpty()))
+        << "a plug-in's record has an empty group dictionary";
     EXPECT_EQ(record.bundleType + tunnel->bundleType, std::string(kBundleTypeUser) + kBundleTypeVPNPlugin);
     EXPECT_EQ(record.bundleURL.path() + tunnel->bundleURL.path(),
               record.bundleContainerURL.path() + "/App.app" + tunnel->bundleContainerURL.path() + "/Tunnel.vpnplugin");
     EXPECT_EQ(readFile(tunnel->bundleURL.path() + "/main"), "executable of " + id + ".tunnel");
     EXPECT_EQ(tunnel->dataContainerURL->deletingLastPathComponent().lastPathComponent(), "PluginKitPlugin");
-    EXPECT_TRUE(exists(record.bundleContainerURL.path() + "/VendraMetadata.plist") &&
-                !exists(tunnel->bundleContainerURL.path() + "/VendraMetadata.plist"));
+    EXPECT_THAT(record.bundleContainerURL.path() + "/VendraMetadata.plist", PathExists());
+    EXPECT_THAT(tunnel->bundleContainerURL.path() + "/VendraMetadata.plist", testing::Not(PathExists()));
     // Resuming, the caller finds its package gone or stages it again: a
     // replay, but not from another package or for another identifier.
     EXPECT_TRUE(install(*registry, package, id, &error)) << error.description();
     ASSERT_TRUE(makeDirs(package + "/Payload") && makeDirs(at("elsewhere/Payload")));
-    EXPECT_TRUE(!install(*registry, at("elsewhere"), id, &error) &&
-                registryCode(error) == kRegistryErrorInvalidPackage);
-    EXPECT_TRUE(!install(*registry, package, "other", &error) && registryCode(error) == kRegistryErrorInvalidPackage);
+    for (const auto& [from, identifier] : {std::pair{at("elsewhere"), id}, {package, std::string("other")}}) {
+      EXPECT_FALSE(install(*registry, from, identifier, &error)) << from << " " << identifier;
+      EXPECT_EQ(registryCode(error), kRegistryErrorInvalidPackage) << error.description();
+    }
     EXPECT_TRUE(install(*registry, package, id, &error)) << error.description();
     EXPECT_EQ(statuses_.back(), "AlreadyInstalledFromPackage");
     EXPECT_EQ(registry->recordForIdentifier(id)->bundleContainerURL, record.bundleContainerURL);
@@ -144,7 +150,8 @@ TEST_F(RegistryRecovery, UnwritableDatabaseOrContainerFailsAndLeavesThePackageWh
   EXPECT_TRUE(error.underlyingError() && error.underlyingError()->isPOSIX(EPERM)) << error.description();
   EXPECT_EQ(errors_, std::vector<std::string>{"FileOperationFailed"});
 
-  EXPECT_TRUE(exists(package + "/Payload/App.app/main") && exists(package + "/Manifest.plist"));
+  EXPECT_THAT((std::vector{package + "/Payload/App.app/main", package + "/Manifest.plist"}),
+              testing::Each(PathExists()));
   EXPECT_EQ(allContainers(), (std::vector<std::vector<std::string>>(4)));
   EXPECT_FALSE(registry->isInstalled("ex.notes"));
   ASSERT_TRUE(install(*registry, package, "ex.notes", &error)) << error.description();
@@ -193,8 +200,8 @@ int64_t userVersion(const std::string& path, std::optional<int> set = std::nullo
   sqlite3* db = nullptr;
   int64_t version = -1;
   if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE, nullptr) == SQLITE_OK &&
-      (!set || sqlite3_exec(db, ("PRAGMA user_version=" + std::to_string(*set)).c_str(), nullptr, nullptr,
-                            nullptr) == SQLITE_OK)) {
+      (!set || sqlite3_exec(db, ("PRAGMA user_version=" + std::to_string(*set)).c_str(), nullptr, nullptr, nullptr) ==
+                   SQLITE_OK)) {
     sqlite3_stmt* query = nullptr;
     if (sqlite3_prepare_v2(db, "PRAGMA user_version;", -1, &query, nullptr) == SQLITE_OK &&
         sqlite3_step(query) == SQLITE_ROW) {

@@ -5,7 +5,7 @@
 
 #include <filesystem>
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 #include "Shared/Support/QSGlobalConfiguration.h"
 #include "Support/SupportFixtures.h"
@@ -112,9 +112,8 @@ TEST_F(ConfigurationDirectories, AreMadeWithTheirModeAndClassOnEveryAccessAndAFa
     ASSERT_TRUE(qstest::setImmutable(parent, false));
     auto lines = log_.systemLines();
     ASSERT_EQ(lines.size(), 1u) << path;
-    EXPECT_TRUE(lines[0].level == 3 &&
-                lines[0].message.rfind(words + " \"" + url.description() + "\": Error Domain=", 0) == 0)
-        << lines[0].message;
+    EXPECT_EQ(lines[0].level, 3);
+    EXPECT_THAT(lines[0].message, testing::StartsWith(words + " \"" + url.description() + "\": Error Domain="));
     log_.clear();
   }
   // The caches directory made on the way to the staging root has no class of its own.

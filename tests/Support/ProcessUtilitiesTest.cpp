@@ -56,7 +56,8 @@ TEST(TransactionalTask, ReturnsAtOnceAndHoldsTheProcessUntilTheTaskEnds) {
     gate.set_value();
   }  // the queue runs what was queued before it goes
   EXPECT_EQ(platform::ProcessKeepAliveTransactionCount(), before);
-  EXPECT_TRUE(order.size() == 201u && std::is_sorted(order.begin(), order.end()));
+  EXPECT_EQ(order.size(), 201u);
+  EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
   EXPECT_NE(taskThread, std::this_thread::get_id());
   std::promise<void> ran;
   QSRunTransactionalTask(platform::WorkQueue::shared(), [&ran] { ran.set_value(); });

@@ -140,7 +140,8 @@ TEST(TypeHelpers, OnlyNumbersAreBooleansIntegerKindsAreOneClassAndNothingElseIsA
   EXPECT_TRUE(QSBooleanValue(Value("NO"), true));
   EXPECT_FALSE(QSBooleanValue(Value("YES"), false));
   const Value integers(Array{Value(-1), Value(UINT64_MAX)});
-  EXPECT_TRUE(QSArrayContainsOnlyClass(integers, Type::Integer) && QSArrayContainsOnlyClass(integers, Type::Unsigned));
+  EXPECT_TRUE(QSArrayContainsOnlyClass(integers, Type::Integer));
+  EXPECT_TRUE(QSArrayContainsOnlyClass(integers, Type::Unsigned));
   EXPECT_FALSE(QSArrayContainsOnlyClass(Value(Array{Value(true)}), Type::Integer));
   EXPECT_TRUE(QSArrayContainsOnlyClass(Value(Dictionary{{"a", Value(1)}}), Type::String));
   EXPECT_FALSE(QSArrayContainsOnlyClass(Value("text"), Type::String));

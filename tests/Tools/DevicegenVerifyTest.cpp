@@ -8,7 +8,7 @@ namespace tooltest {
 namespace {
 
 // Before the migration the image fails, listing what is left and not
-// installed; after it, it passes; then each damage is reported as exactly
+// installed, in text and in JSON; after it, it passes; then each damage is reported as exactly
 // the problem it is, and an unreadable manifest fails the verification.
 TEST(DevicegenVerify, UnmigratedFailsMigratedPassesAndEachDamageIsReportedPrecisely) {
   qstest::TempDir dir("devicegen-verify");
@@ -16,17 +16,20 @@ TEST(DevicegenVerify, UnmigratedFailsMigratedPassesAndEachDamageIsReportedPrecis
   ASSERT_EQ(createImage(root_).status, 0);
   auto verify = [&](int status, const std::vector<std::string>& lines) {
     const RunResult run = runTool("devicegen", {"verify", "--root", root_});
-    EXPECT_EQ(run.status, status) << run.out;
-    for (const std::string& line : lines) EXPECT_NE(run.out.find(line), std::string::npos) << line << "\n" << run.out;
+    EXPECT_THAT(run, exited(status));
+    for (const std::string& line : lines) EXPECT_THAT(run.out, HasSubstr(line));
   };
   verify(1, {"left behind: old applications directory " + root_ + kOldApplications,
              "registry: not installed: com.example.", "version: no last system version", "... and ", "FAILED"});
-  const RunResult absent = runTool("devicegen", {"verify", "--root", dir / "absent"});
-  EXPECT_EQ(absent.status, 1) << "a missing root is a failure, not a usage error";
-  EXPECT_NE(absent.err.find("realpath " + (dir / "absent")), std::string::npos) << absent.err;
+  EXPECT_THAT(runTool("devicegen", {"verify", "--json", "--root", root_}),  // the same verdict, as one document
+              exited(1, _,
+                     AllOf(StartsWith("{\"root\":\""), EndsWith("}\n"), Not(HasSubstr("\"left behind\":0")),
+                           HasSubstr("\"ok\":false,\"fatal\":null,\"summary\":{\"applications\":8,"))));
+  EXPECT_THAT(runTool("devicegen", {"verify", "--root", dir / "absent"}),  // a failure, not a usage error
+              exited(1, HasSubstr("realpath " + (dir / "absent"))));
 
   const RunResult migration = runTool("transvale", {"--root", root_, "--progress", "never", "--log", dir / "log"});
-  ASSERT_EQ(migration.status, 0) << migration.err << qstest::readFile(dir / "log");
+  ASSERT_THAT(migration, exited(0)) << qstest::readFile(dir / "log");
   verify(0, {"OK: "});
   auto registry = platform::SQLiteApplicationRegistry::open(root_);
   ASSERT_TRUE(registry);

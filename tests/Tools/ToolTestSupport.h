@@ -6,11 +6,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <openssl/evp.h>
+#include <gmock/gmock.h>
 
 #include <cstdlib>
 #include <map>
 
+#include "Platform/Digest.h"
+#include "Platform/Foundation/Text.h"
 #include "Platform/RegistryFixture.h"
 
 namespace tooltest {
@@ -20,6 +22,15 @@ using platform::Dictionary;
 using platform::Value;
 using qstest::entries;
 using qstest::exists;
+using testing::_;
+using testing::AllOf;
+using testing::EndsWith;
+using testing::Eq;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using testing::Not;
+using testing::PrintToString;
+using testing::StartsWith;
 
 // Layout of an image under its root, as the programs must produce it.
 inline constexpr char kOldApplications[] = "/private/var/mobile/Applications";
@@ -39,6 +50,15 @@ struct RunResult {
   int status = -1;  // exit status; -1 when the program did not exit normally
   std::string out, err;
 };
+inline void PrintTo(const RunResult& r, std::ostream* os) {
+  *os << "exit " << r.status << "\n--- stdout:\n" << r.out << "--- stderr:\n" << r.err;
+}
+// A run that exited with `status`, its standard error and output matching.
+inline testing::Matcher<const RunResult&> exited(int status, testing::Matcher<const std::string&> err = testing::_,
+                                                 testing::Matcher<const std::string&> out = testing::_) {
+  return testing::AllOf(testing::Field("status", &RunResult::status, status),
+                        testing::Field("err", &RunResult::err, err), testing::Field("out", &RunResult::out, out));
+}
 
 // Runs $QS_BUILD_DIR/bin/<program> with `args` and waits for it. The output
 // goes to files, which cannot fill up and stall the program.
@@ -88,13 +108,8 @@ inline std::map<std::string, std::string> snapshotTree(const std::string& root) 
 }
 
 inline std::string sha256Hex(const std::string& bytes) {
-  unsigned char digest[EVP_MAX_MD_SIZE];
-  unsigned int length = 0;
-  EVP_Digest(bytes.data(), bytes.size(), digest, &length, EVP_sha256(), nullptr);
-  std::string hex;
-  for (unsigned int i = 0; i < length; ++i)
-    hex += {"0123456789abcdef"[digest[i] >> 4], "0123456789abcdef"[digest[i] & 15]};
-  return hex;
+  const platform::SHA256Digest digest = platform::sha256(bytes.data(), bytes.size());
+  return platform::hexString(digest.data(), digest.size());
 }
 
 // The dictionary in the property list at `path`; an empty one (and a test

@@ -4,8 +4,8 @@
 
 #include <cstring>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
+
+#include "TestSupport.h"
 
 namespace qstest {
 
@@ -28,24 +28,16 @@ std::optional<platform::Image> decodePNG(const platform::Data& bytes) {
 
 std::optional<platform::Image> decodePNGFile(const std::string& path) {
   if (!std::filesystem::is_regular_file(path)) return std::nullopt;
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return std::nullopt;
-  platform::Data bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  return decodePNG(bytes);
+  const std::string bytes = readFile(path);
+  return decodePNG(platform::Data(bytes.begin(), bytes.end()));
 }
 
-namespace {
-
-bool writePNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA) {
+bool writeSplitPNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA) {
   std::vector<uint8_t> pixels(static_cast<size_t>(width) * height * 4);
   for (int y = 0; y < height; ++y) {
     for (int x = 0; x < width; ++x) {
       const uint32_t rgba = x < width / 2 ? leftRGBA : rightRGBA;
-      uint8_t* p = &pixels[(static_cast<size_t>(y) * width + x) * 4];
-      p[0] = rgba >> 24;
-      p[1] = (rgba >> 16) & 0xff;
-      p[2] = (rgba >> 8) & 0xff;
-      p[3] = rgba & 0xff;
+      for (int k = 0; k < 4; ++k) pixels[(static_cast<size_t>(y) * width + x) * 4 + k] = rgba >> (24 - 8 * k);
     }
   }
   png_image png;
@@ -55,16 +47,6 @@ bool writePNG(const std::string& path, int width, int height, uint32_t leftRGBA,
   png.height = static_cast<png_uint_32>(height);
   png.format = PNG_FORMAT_RGBA;
   return png_image_write_to_file(&png, path.c_str(), 0, pixels.data(), 0, nullptr) != 0;
-}
-
-}  // namespace
-
-bool writeSolidPNG(const std::string& path, int width, int height, uint32_t rgba) {
-  return writePNG(path, width, height, rgba, rgba);
-}
-
-bool writeSplitPNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA) {
-  return writePNG(path, width, height, leftRGBA, rightRGBA);
 }
 
 uint32_t pixelAt(const platform::Image& image, int x, int y) {

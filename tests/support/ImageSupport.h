@@ -16,11 +16,12 @@ namespace qstest {
 std::optional<platform::Image> decodePNG(const platform::Data& bytes);
 std::optional<platform::Image> decodePNGFile(const std::string& path);
 
-// Writes a width x height PNG file whose every pixel is `rgba`.
-bool writeSolidPNG(const std::string& path, int width, int height, uint32_t rgba);
 // Writes a width x height PNG whose left half is `leftRGBA` and right half
-// `rightRGBA`.
+// `rightRGBA`; a solid one when they are the same.
 bool writeSplitPNG(const std::string& path, int width, int height, uint32_t leftRGBA, uint32_t rightRGBA);
+inline bool writeSolidPNG(const std::string& path, int width, int height, uint32_t rgba) {
+  return writeSplitPNG(path, width, height, rgba, rgba);
+}
 
 // The pixel at (x, y) as 0xRRGGBBAA.
 uint32_t pixelAt(const platform::Image& image, int x, int y);

@@ -1,7 +1,6 @@
 // The main of every test binary: a private system root exported as
 // QS_SYSTEM_ROOT before anything can create the shared configuration, and a
 // check that no format string met an argument of the wrong kind.
-#include <ftw.h>
 #include <stdlib.h>
 #include <unistd.h>
 
@@ -11,13 +10,9 @@
 #include <gtest/gtest.h>
 
 #include "Platform/Foundation/Format.h"
+#include "TestSupport.h"
 
 namespace {
-
-int removeEntry(const char* path, const struct stat*, int type, struct FTW*) {
-  (type == FTW_DP) ? rmdir(path) : unlink(path);
-  return 0;
-}
 
 class FormatMismatchListener : public testing::EmptyTestEventListener {
   uint64_t before_ = 0;
@@ -46,6 +41,6 @@ int main(int argc, char** argv) {
   testing::UnitTest::GetInstance()->listeners().Append(new FormatMismatchListener);
   int rc = RUN_ALL_TESTS();
 
-  if (!getenv("QS_KEEP_TEST_ROOT")) nftw(buf.c_str(), removeEntry, 32, FTW_PHYS | FTW_DEPTH);
+  if (!getenv("QS_KEEP_TEST_ROOT")) (void)qstest::removeTree(buf);  // what a test left is its own failure
   return rc;
 }

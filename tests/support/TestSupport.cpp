@@ -9,14 +9,28 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 
 #include <gtest/gtest.h>
+
+namespace platform {
+void PrintTo(const Value& value, std::ostream* os) {
+  *os << value.description();
+}
+void PrintTo(const URL& url, std::ostream* os) {
+  *os << url.description();
+}
+void PrintTo(const Error& error, std::ostream* os) {
+  *os << error.description();
+}
+}  // namespace platform
 
 namespace qstest {
 
@@ -31,19 +45,18 @@ const std::string& systemRoot() {
 namespace {
 std::atomic<unsigned> gTempCounter{0};
 
-int clearFlagsAndRemove(const char* path, const struct stat* sb, int type, struct FTW*) {
-  if (type != FTW_SL && type != FTW_SLN) {
-    int fd = open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK);
-    if (fd >= 0) {
-      int flags = 0;
-      if (ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0 && (flags & FS_IMMUTABLE_FL)) {
-        flags &= ~FS_IMMUTABLE_FL;
-        ioctl(fd, FS_IOC_SETFLAGS, &flags);
-      }
-      close(fd);
-    }
-  }
-  (void)sb;
+// Sets or clears FS_IMMUTABLE_FL on an open descriptor.
+bool setImmutableFlag(int fd, bool on) {
+  int flags = 0;
+  if (ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0) return false;
+  flags = on ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+  return ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
+}
+
+int clearImmutable(const char* path, const struct stat*, int type, struct FTW*) {
+  if (type == FTW_SL || type == FTW_SLN) return 0;
+  const int fd = open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK);
+  if (fd >= 0) (void)setImmutableFlag(fd, false), close(fd);  // a flag it cannot clear fails the removal
   return 0;
 }
 
@@ -52,6 +65,11 @@ int removeOne(const char* path, const struct stat*, int type, struct FTW*) {
   return rc == 0 ? 0 : errno;
 }
 }  // namespace
+
+bool removeTree(const std::string& path) {
+  nftw(path.c_str(), clearImmutable, 32, FTW_PHYS);  // preorder: flags first
+  return nftw(path.c_str(), removeOne, 32, FTW_PHYS | FTW_DEPTH) == 0;
+}
 
 TempDir::TempDir(const std::string& prefix) {
   std::string parent = systemRoot() + "/tmp";
@@ -70,10 +88,7 @@ TempDir::TempDir(const std::string& prefix) {
 
 TempDir::~TempDir() {
   if (path_.empty()) return;
-  // Preorder pass clears immutable flags, postorder pass removes.
-  nftw(path_.c_str(), clearFlagsAndRemove, 32, FTW_PHYS);
-  int rc = nftw(path_.c_str(), removeOne, 32, FTW_PHYS | FTW_DEPTH);
-  EXPECT_EQ(rc, 0) << "could not remove test directory " << path_;
+  EXPECT_TRUE(removeTree(path_)) << "could not remove test directory " << path_;
 }
 
 LogCapture::LogCapture() {
@@ -102,16 +117,17 @@ std::vector<platform::HostLogLine> LogCapture::hostLines() const {
   return host_;
 }
 
-std::vector<std::string> LogCapture::systemMessages() const {
+template <class Line>
+std::vector<std::string> messagesOf(const std::vector<Line>& lines) {
   std::vector<std::string> out;
-  for (const auto& l : systemLines()) out.push_back(l.message);
+  for (const Line& l : lines) out.push_back(l.message);
   return out;
 }
-
+std::vector<std::string> LogCapture::systemMessages() const {
+  return messagesOf(systemLines());
+}
 std::vector<std::string> LogCapture::hostMessages() const {
-  std::vector<std::string> out;
-  for (const auto& l : hostLines()) out.push_back(l.message);
-  return out;
+  return messagesOf(hostLines());
 }
 
 size_t LogCapture::count(const std::string& text) const {
@@ -162,20 +178,20 @@ bool makeDirs(const std::string& path, unsigned mode) {
 }
 
 bool setImmutable(const std::string& path, bool on) {
-  int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK);
-  if (fd < 0) {
-    ADD_FAILURE() << "open " << path << ": " << strerror(errno);
-    return false;
-  }
-  int flags = 0;
-  bool ok = ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0;
-  if (ok) {
-    flags = on ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
-    ok = ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
-  }
-  if (!ok) ADD_FAILURE() << "FS_IOC_SETFLAGS " << path << ": " << strerror(errno);
-  close(fd);
+  const int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK);
+  const bool ok = fd >= 0 && setImmutableFlag(fd, on);
+  if (!ok) ADD_FAILURE() << "set immutable " << path << ": " << strerror(errno);
+  if (fd >= 0) close(fd);
   return ok;
+}
+
+std::vector<std::string> entries(const std::string& directory) {
+  std::vector<std::string> names;
+  std::error_code missing;
+  for (const auto& entry : std::filesystem::directory_iterator(directory, missing))
+    names.push_back(entry.path().filename());
+  std::sort(names.begin(), names.end());
+  return names;
 }
 
 int runAsNobody(const std::function<int()>& fn) {

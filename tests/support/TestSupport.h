@@ -11,8 +11,19 @@
 #include <string>
 #include <vector>
 
+#include "Platform/Foundation/Error.h"
+#include "Platform/Foundation/URL.h"
+#include "Platform/Foundation/Value.h"
 #include "Platform/Host/HostLog.h"
 #include "Platform/SystemLog.h"
+
+// Values, URLs and error records print as their descriptions in failed
+// assertions (containers of them too), instead of as raw bytes.
+namespace platform {
+void PrintTo(const Value& value, std::ostream* os);
+void PrintTo(const URL& url, std::ostream* os);
+void PrintTo(const Error& error, std::ostream* os);
+}  // namespace platform
 
 namespace qstest {
 
@@ -69,6 +80,11 @@ std::string readFile(const std::string& path);
 bool makeDirs(const std::string& path, unsigned mode = 0755);
 // Sets or clears the immutable flag (FS_IMMUTABLE_FL) on `path`.
 bool setImmutable(const std::string& path, bool on);
+// Removes the tree at `path`, not following links, immutable flags cleared
+// first; false when something remains. Reports no test failure itself.
+bool removeTree(const std::string& path);
+// The entries of a directory, sorted (none when it cannot be listed).
+std::vector<std::string> entries(const std::string& directory);
 // Runs `fn` in a forked child that has dropped to uid/gid 65534; returns the
 // child's exit status (fn's result), or -1 when the child died otherwise.
 int runAsNobody(const std::function<int()>& fn);
