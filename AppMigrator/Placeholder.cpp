@@ -25,7 +25,7 @@ using platform::kStoreMetadataFileName;
 constexpr const char* kBundleExtension = platform::kApplicationBundleExtension;
 constexpr size_t kSingleImage = 1;
 // The staged bundle's files are written whole (atomically) but not flushed:
-// the registry copies them, flushing its copy before it records it, and the
+// the registry copies them and makes its copy durable with its record, and the
 // staged directory is removed when the call ends. After a crash the staged
 // directory is reused and its files replaced, so nothing depends on them
 // surviving one.
