@@ -57,7 +57,9 @@ class TerminalRun {
  public:
   TerminalRun(const std::string& image, const std::string& dir, unsigned short columns) {
     master_ = ScopedFD(posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC));
-    EXPECT_TRUE(master_.get() >= 0 && grantpt(master_.get()) == 0 && unlockpt(master_.get()) == 0);
+    EXPECT_GE(master_.get(), 0) << std::strerror(errno);
+    EXPECT_EQ(grantpt(master_.get()), 0) << std::strerror(errno);
+    EXPECT_EQ(unlockpt(master_.get()), 0) << std::strerror(errno);
     const std::string terminal = ptsname(master_.get());
     // Held open so that the end of the output is the display's last newline,
     // never an error of a terminal nobody holds.
