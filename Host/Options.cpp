@@ -6,7 +6,7 @@
 
 #include <CLI/CLI.hpp>
 
-#include "Tools/ToolVersion.h"
+#include "Platform/Foundation/ProjectVersion.h"
 
 namespace transvale {
 
@@ -23,7 +23,7 @@ constexpr int kHighestLogLevel = 7;
 
 std::optional<Options> parseOptions(int argc, char** argv, int* exitCode) {
   CLI::App app(kProgramDescription, kProgramName);
-  app.set_version_flag("--version", tools::versionText(kProgramName));
+  app.set_version_flag("--version", platform::versionText(kProgramName));
   app.footer(
       "Exit status: 0 migration succeeded (or plan shown), 1 migration failed, 2 plug-in unusable, 64 usage "
       "error.");

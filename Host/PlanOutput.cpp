@@ -5,7 +5,7 @@
 
 #include "Host/Progress.h"
 #include "Platform/Foundation/Json.h"
-#include "Tools/UTF8.h"
+#include "Platform/Foundation/Text.h"
 
 namespace transvale {
 
@@ -31,7 +31,7 @@ std::string sizeText(const PlanSize& size) {
 }
 
 std::string destinationText(const PlanDestination& destination) {
-  return (destination.toBeMade ? "a new container in " : "") + tools::printable(destination.path) +
+  return (destination.toBeMade ? "a new container in " : "") + platform::printable(destination.path) +
          (destination.crossesFileSystem ? " (another file system: copied, then removed)" : " (same file system)");
 }
 
@@ -85,30 +85,30 @@ const char* discardName(platform::PlannedDiscardKind kind) {
 }
 
 std::string planText(const MigrationPlan& plan) {
-  std::string out = "Plan for " + tools::printable(plan.systemRoot) + " (nothing has been changed)\n";
+  std::string out = "Plan for " + platform::printable(plan.systemRoot) + " (nothing has been changed)\n";
   if (!plan.hasOldLayout) {
-    out += "No old application layout: " + tools::printable(plan.oldApplicationsPath) +
+    out += "No old application layout: " + platform::printable(plan.oldApplicationsPath) +
            " is missing or empty. A run only registers safe harbors and records the system version.\n";
   } else {
     out += printf("Old applications directory: %s (%" PRIu64 " entries)\n",
-                  tools::printable(plan.oldApplicationsPath).c_str(), plan.entries);
+                  platform::printable(plan.oldApplicationsPath).c_str(), plan.entries);
   }
 
   if (!plan.containers.empty()) out += "\nContainers, in the order the run takes them:\n";
   size_t number = 0;
   for (const platform::PlannedContainer& c : plan.containers) {
     out += printf("%4zu. %s: %s%s\n", ++number,
-                  c.identifier.empty() ? "(unknown)" : tools::printable(c.identifier).c_str(), actionName(c.action),
+                  c.identifier.empty() ? "(unknown)" : platform::printable(c.identifier).c_str(), actionName(c.action),
                   c.resumedFromMarker ? ", resumed from its migration marker" : "");
-    out += "      container: " + tools::printable(c.containerPath) + "\n";
+    out += "      container: " + platform::printable(c.containerPath) + "\n";
     if (c.action == PlannedAction::Kept) {
-      out += "      kept because " + tools::printable(c.reason) + "\n";
+      out += "      kept because " + platform::printable(c.reason) + "\n";
       continue;
     }
     out += "      data: " + sizeText(c.data) + " -> " + destinationText(c.dataDestination) + "\n";
     for (const platform::PlannedGroup& g : c.groups) {
-      out += "      group " + tools::printable(g.identifier) + ": " + sizeText(g.size) + " from " +
-             tools::printable(g.oldPath) + " -> " + destinationText(g.destination) + "\n";
+      out += "      group " + platform::printable(g.identifier) + ": " + sizeText(g.size) + " from " +
+             platform::printable(g.oldPath) + " -> " + destinationText(g.destination) + "\n";
     }
   }
 
@@ -116,21 +116,21 @@ std::string planText(const MigrationPlan& plan) {
   if (plan.discards.empty()) out += " nothing";
   out += "\n";
   for (const platform::PlannedDiscard& d : plan.discards) {
-    out += "  " + tools::printable(d.path) + ": " + discardName(d.kind) + ", " + sizeText(d.size);
+    out += "  " + platform::printable(d.path) + ": " + discardName(d.kind) + ", " + sizeText(d.size);
     if (!d.items.empty()) {
       out += "; items:";
-      for (const std::string& item : d.items) out += " " + tools::printable(item);
+      for (const std::string& item : d.items) out += " " + platform::printable(item);
     }
     if (!d.recoveredItems.empty()) {
-      out += "; moved first to a directory of its own in " + tools::printable(d.recoveryDirectory) + ":";
-      for (const std::string& item : d.recoveredItems) out += " " + tools::printable(item);
+      out += "; moved first to a directory of its own in " + platform::printable(d.recoveryDirectory) + ":";
+      for (const std::string& item : d.recoveredItems) out += " " + platform::printable(item);
     }
     out += "\n";
   }
 
   if (!plan.harbors.empty()) out += "\nSafe harbors to register:\n";
   for (const platform::PlannedHarbor& h : plan.harbors) {
-    out += "  " + tools::printable(h.identifier) + " -> " + tools::printable(h.path) +
+    out += "  " + platform::printable(h.identifier) + " -> " + platform::printable(h.path) +
            (h.problem.empty() ? "" : " (refused: " + h.problem + ")") + "\n";
   }
 
@@ -152,7 +152,7 @@ std::string planText(const MigrationPlan& plan) {
   for (const platform::PlannedFileSystem& f : plan.fileSystems) {
     const bool fits = f.neededBytes <= f.freeBytes;
     out += printf("  %s: %" PRIu64 " bytes needed (%s), %" PRIu64 " bytes free (%s): %s\n",
-                  tools::printable(f.path).c_str(), f.neededBytes, humanBytes(f.neededBytes).c_str(), f.freeBytes,
+                  platform::printable(f.path).c_str(), f.neededBytes, humanBytes(f.neededBytes).c_str(), f.freeBytes,
                   humanBytes(f.freeBytes).c_str(), fits ? "enough" : "NOT ENOUGH");
   }
   out += printf("\nEstimated duration: %.1f s\n", plan.estimatedSeconds);

@@ -8,6 +8,8 @@
 #include <atomic>
 #include <cmath>
 
+#include "Platform/Foundation/Text.h"
+
 namespace transvale {
 
 namespace {
@@ -124,7 +126,9 @@ std::string ProgressDisplay::barLine(const ProgressSample& sample, int columns) 
   const double elapsed = elapsedSeconds();
   const auto remaining = secondsRemaining(elapsed, workDone(sample, entries_));
   text += "  " + minutesAndSeconds(elapsed) + (remaining ? " (" + minutesAndSeconds(*remaining) + " left)" : "");
-  if (!sample.current.empty()) text += "  " + sample.current;
+  // The application's name comes from its bundle: escaped, it cannot move
+  // the cursor or change the terminal's state.
+  if (!sample.current.empty()) text += "  " + platform::printable(sample.current);
 
   // "[" bar "] " text, cut to the terminal's width. The bar keeps a third of
   // the width whatever the text, so that it does not jump as the text changes.
@@ -132,8 +136,9 @@ std::string ProgressDisplay::barLine(const ProgressSample& sample, int columns) 
   const int filled = known ? static_cast<int>(sample.fraction * static_cast<float>(width)) : 0;
   std::string line = "[" + std::string(static_cast<size_t>(filled), kBarDone) +
                      std::string(static_cast<size_t>(width - filled), kBarToDo) + "] " + text;
-  if (static_cast<int>(line.size()) > columns - 1) line.resize(static_cast<size_t>(std::max(columns - 1, 0)));
-  return line;
+  // One column stays free: a line that fills the last column makes some
+  // terminals wrap before the next "\r".
+  return std::string(platform::leadingColumns(line, static_cast<size_t>(std::max(columns - 1, 0))));
 }
 
 std::string ProgressDisplay::stepLine(const ProgressSample& sample) const {

@@ -4,6 +4,8 @@
 // --plan it asks the plug-in for a dry run instead and prints the plan.
 #include <fcntl.h>
 #include <malloc.h>
+#include <pthread.h>
+#include <signal.h>
 #include <stdlib.h>
 #include <unistd.h>
 
@@ -60,6 +62,13 @@ bool runMigration(platform::DataClassMigrator& migrator, ProgressDisplay& displa
   std::condition_variable ended;
   bool finished = false;
   bool result = false;
+  // The window-size signal is for this thread: its next redraw then has the
+  // new width, and no system call of the migration is interrupted by it. The
+  // worker, and every thread it starts, inherits the blocked signal.
+  sigset_t windowChange, previousMask;
+  sigemptyset(&windowChange);
+  sigaddset(&windowChange, SIGWINCH);
+  pthread_sigmask(SIG_BLOCK, &windowChange, &previousMask);
   std::thread worker([&] {
     const bool migrated = migrator.performMigration();
     std::lock_guard<std::mutex> lock(mutex);
@@ -67,6 +76,7 @@ bool runMigration(platform::DataClassMigrator& migrator, ProgressDisplay& displa
     finished = true;
     ended.notify_one();
   });
+  pthread_sigmask(SIG_SETMASK, &previousMask, nullptr);
   {
     std::unique_lock<std::mutex> lock(mutex);
     while (!finished) {

@@ -2,7 +2,7 @@
 # Installs the Debian packages the build needs, and nothing when all are there.
 set -euo pipefail
 packages=(cmake ninja-build g++ pkg-config libplist-dev libexpat1-dev libpng-dev libcairo2-dev libssl-dev libsqlite3-dev
-          libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev xfsprogs help2man python3 clang-14
+          libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev xfsprogs help2man python3 dpkg-dev file clang-14
           libclang-rt-14-dev)
 missing=()
 for p in "${packages[@]}"; do

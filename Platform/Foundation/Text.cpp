@@ -1,5 +1,9 @@
 #include "Platform/Foundation/Text.h"
 
+#include <algorithm>
+#include <cstdint>
+#include <utility>
+
 namespace platform {
 
 size_t utf8SequenceLength(std::string_view bytes, size_t at) {
@@ -37,6 +41,80 @@ bool isValidUTF8(std::string_view bytes) {
     at += length;
   }
   return true;
+}
+
+std::string printable(std::string_view bytes) {
+  std::string out;
+  out.reserve(bytes.size());
+  for (size_t at = 0; at < bytes.size();) {
+    const size_t length = utf8SequenceLength(bytes, at);
+    const auto byte = static_cast<unsigned char>(bytes[at]);
+    if (length == 0 || (length == 1 && (byte < 0x20 || byte == 0x7F || byte == '\\'))) {
+      if (byte == '\\') {
+        out += "\\\\";
+      } else {
+        out += "\\x";
+        appendHex(out, byte);
+      }
+      ++at;
+      continue;
+    }
+    out.append(bytes.substr(at, length));
+    at += length;
+  }
+  return out;
+}
+
+namespace {
+
+// The code point of the well-formed sequence of `length` bytes at bytes[at].
+uint32_t codePointAt(std::string_view bytes, size_t at, size_t length) {
+  static constexpr uint8_t kLeadMask[] = {0, 0x7F, 0x1F, 0x0F, 0x07};
+  uint32_t codePoint = static_cast<unsigned char>(bytes[at]) & kLeadMask[length];
+  for (size_t k = 1; k < length; ++k) codePoint = (codePoint << 6) | (static_cast<unsigned char>(bytes[at + k]) & 0x3F);
+  return codePoint;
+}
+
+// The blocks of characters a terminal shows two columns wide.
+struct CodePointRange {
+  uint32_t first, last;
+};
+constexpr CodePointRange kWideCharacters[] = {
+    {0x1100, 0x115F}, {0x2E80, 0x303E},   {0x3041, 0x33FF},   {0x3400, 0x4DBF},   {0x4E00, 0x9FFF},
+    {0xA000, 0xA4CF}, {0xAC00, 0xD7A3},   {0xF900, 0xFAFF},   {0xFE30, 0xFE4F},   {0xFF00, 0xFF60},
+    {0xFFE0, 0xFFE6}, {0x1F300, 0x1F64F}, {0x1F900, 0x1F9FF}, {0x20000, 0x2FFFD}, {0x30000, 0x3FFFD},
+};
+
+size_t columnsOf(uint32_t codePoint) {
+  for (const CodePointRange& range : kWideCharacters) {
+    if (codePoint >= range.first && codePoint <= range.last) return 2;
+  }
+  return 1;
+}
+
+// Walks `text` code point by code point (a byte that starts no well-formed
+// sequence counts as one) until the next one would pass `columns`; returns
+// the bytes walked and the columns they take.
+std::pair<size_t, size_t> walkColumns(std::string_view text, size_t columns) {
+  size_t at = 0, used = 0;
+  while (at < text.size()) {
+    const size_t length = std::max<size_t>(utf8SequenceLength(text, at), 1);
+    const size_t width = length == 1 ? 1 : columnsOf(codePointAt(text, at, length));
+    if (used + width > columns) break;
+    used += width;
+    at += length;
+  }
+  return {at, used};
+}
+
+}  // namespace
+
+size_t displayColumns(std::string_view text) {
+  return walkColumns(text, SIZE_MAX).second;
+}
+
+std::string_view leadingColumns(std::string_view text, size_t columns) {
+  return text.substr(0, walkColumns(text, columns).first);
 }
 
 void appendHex(std::string& out, uint8_t byte, HexCase letters) {

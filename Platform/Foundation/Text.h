@@ -1,4 +1,5 @@
-// Byte-string helpers: UTF-8 well-formedness and hexadecimal digits.
+// Byte-string helpers: UTF-8 well-formedness, printable forms and
+// hexadecimal digits.
 //
 // File-system names and property-list strings are bytes; these helpers say
 // which of them are well-formed UTF-8 and spell bytes in hexadecimal.
@@ -21,6 +22,20 @@ namespace platform {
 size_t utf8SequenceLength(std::string_view bytes, size_t at);
 
 bool isValidUTF8(std::string_view bytes);
+
+// `bytes` for a terminal or a log: well-formed UTF-8 passes unchanged except
+// control characters and backslashes; every other byte becomes "\xNN".
+std::string printable(std::string_view bytes);
+
+// Columns of a terminal that printable text (see printable) takes: two for
+// an East Asian wide or full-width character or an emoji, one for every
+// other code point (combining marks are rare in identifiers and paths; they
+// only make a line look a column shorter than it is).
+size_t displayColumns(std::string_view text);
+
+// The longest start of printable `text` that takes at most `columns`
+// columns, cut between code points.
+std::string_view leadingColumns(std::string_view text, size_t columns);
 
 enum class HexCase { Lower, Upper };
 

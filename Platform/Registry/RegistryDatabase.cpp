@@ -127,16 +127,11 @@ std::unique_ptr<Database> Database::open(const std::string& path, Error* error) 
   return db;
 }
 
-bool Database::createSchema(Error* error) {
-  // Read and set the version in the transaction that creates the tables, so
-  // that no other process can upgrade the database in between.
-  std::optional<Transaction> transaction = Transaction::begin(*this, error);
-  if (!transaction) return false;
+std::optional<int64_t> Database::readableSchemaVersion(Error* error) {
   std::optional<Statement> query = prepare("PRAGMA user_version;", error);
   bool failed = false;
-  if (!query || !query->step(&failed, error)) return false;
+  if (!query || !query->step(&failed, error)) return std::nullopt;
   const int64_t version = query->integer(0);
-  query.reset();
   if (version > kSchemaVersion) {
     if (error) {
       *error = Error(
@@ -146,10 +141,20 @@ bool Database::createSchema(Error* error) {
                                    "that this build reads; it is left untouched",
                                    path_, static_cast<long long>(version), static_cast<long long>(kSchemaVersion)))}});
     }
-    return false;
+    return std::nullopt;
   }
+  return version;
+}
+
+bool Database::createSchema(Error* error) {
+  // Read and set the version in the transaction that creates the tables, so
+  // that no other process can upgrade the database in between.
+  std::optional<Transaction> transaction = Transaction::begin(*this, error);
+  if (!transaction) return false;
+  const std::optional<int64_t> version = readableSchemaVersion(error);
+  if (!version) return false;
   if (!execute(kSchema, error)) return false;
-  if (version < kSchemaVersion &&
+  if (*version < kSchemaVersion &&
       !execute(Format("PRAGMA user_version=%lld;", static_cast<long long>(kSchemaVersion)).c_str(), error)) {
     return false;
   }
@@ -200,7 +205,9 @@ std::unique_ptr<Database> Database::openReadOnly(const std::string& path, Error*
   }
   sqlite3_extended_result_codes(handle, 1);
   sqlite3_busy_timeout(handle, kBusyTimeoutMilliseconds);
-  // Reading a table proves the file is a database of ours.
+  // A newer schema may mean something else by the same tables; reading one
+  // then proves the file is a database of ours.
+  if (!db->readableSchemaVersion(error)) return nullptr;
   auto check = db->prepare("SELECT count(*) FROM records;", error);
   bool failed = false;
   if (!check || (!check->step(&failed, error) && failed)) return nullptr;

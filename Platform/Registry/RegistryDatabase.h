@@ -51,7 +51,9 @@ class Database {
   // one, the database and its log are read from a private copy in the
   // process's temporary directory, removed when the database is closed (a
   // writer working at that moment may leave the copy unreadable: the open
-  // then fails). Null on failure, also when there is no database at `path`.
+  // then fails). Null on failure, also when there is no database at `path`;
+  // a database of a newer schema version fails with
+  // kRegistryErrorNewerDatabase, as with open().
   static std::unique_ptr<Database> openReadOnly(const std::string& path, Error* error);
   ~Database();
   Database(const Database&) = delete;
@@ -69,6 +71,9 @@ class Database {
  private:
   Database(sqlite3* handle, std::string path) : handle_(handle), path_(std::move(path)) {}
   [[nodiscard]] bool createSchema(Error* error);
+  // The schema version recorded in the database, or none with
+  // kRegistryErrorNewerDatabase when it is newer than this build reads.
+  std::optional<int64_t> readableSchemaVersion(Error* error);
   friend class Statement;
   sqlite3* handle_;
   std::string path_;

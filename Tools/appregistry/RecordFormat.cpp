@@ -3,7 +3,7 @@
 #include <algorithm>
 
 #include "Platform/Foundation/Json.h"
-#include "Tools/UTF8.h"
+#include "Platform/Foundation/Text.h"
 
 namespace appregistry {
 namespace {
@@ -19,34 +19,26 @@ std::string yesNo(bool value) {
   return value ? "yes" : "no";
 }
 
-// Columns of a terminal a printable string takes: one per code point (wide
-// characters are rare in identifiers and paths; they only misalign).
-size_t displayWidth(const std::string& text) {
-  size_t width = 0;
-  for (unsigned char c : text) width += (c & 0xC0) != 0x80;
-  return width;
-}
-
 // Rows of cells, rendered with every column as wide as its widest cell. The
 // last column is not padded.
 class TextTable {
  public:
   void add(std::vector<std::string> cells) {
-    for (auto& cell : cells) cell = tools::printable(cell);
+    for (auto& cell : cells) cell = platform::printable(cell);
     rows_.push_back(std::move(cells));
   }
   std::string render() const {
     std::vector<size_t> widths;
     for (const auto& row : rows_) {
       widths.resize(std::max(widths.size(), row.size()));
-      for (size_t c = 0; c < row.size(); ++c) widths[c] = std::max(widths[c], displayWidth(row[c]));
+      for (size_t c = 0; c < row.size(); ++c) widths[c] = std::max(widths[c], platform::displayColumns(row[c]));
     }
     std::string out;
     for (const auto& row : rows_) {
       std::string line;
       for (size_t c = 0; c < row.size(); ++c) {
         line += row[c];
-        if (c + 1 < row.size()) line += std::string(widths[c] - displayWidth(row[c]), ' ') + kColumnGap;
+        if (c + 1 < row.size()) line += std::string(widths[c] - platform::displayColumns(row[c]), ' ') + kColumnGap;
       }
       out += line + "\n";
     }

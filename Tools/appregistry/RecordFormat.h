@@ -2,7 +2,7 @@
 // table (list), a block of labelled lines (show), or JSON (--json, see
 // Platform/Foundation/Json.h for how bytes that are not UTF-8 are written).
 //
-// Every name printed as text goes through tools::printable, so a file name
+// Every name printed as text goes through platform::printable, so a file name
 // with control characters or invalid bytes cannot disturb the terminal.
 // Thread safety: pure functions.
 #pragma once

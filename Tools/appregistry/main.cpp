@@ -18,8 +18,8 @@
 #include <CLI/CLI.hpp>
 
 #include "Platform/Registry/RegistryReader.h"
-#include "Tools/ToolVersion.h"
-#include "Tools/UTF8.h"
+#include "Platform/Foundation/ProjectVersion.h"
+#include "Platform/Foundation/Text.h"
 #include "Tools/appregistry/RecordFormat.h"
 
 namespace {
@@ -29,7 +29,7 @@ constexpr int kExitFailure = 1;
 constexpr int kExitUsage = 64;
 
 int fail(const std::string& message) {
-  fprintf(stderr, "appregistry: %s\n", tools::printable(message).c_str());
+  fprintf(stderr, "appregistry: %s\n", platform::printable(message).c_str());
   return kExitFailure;
 }
 
@@ -43,7 +43,7 @@ int main(int argc, char** argv) {
   CLI::App app{"Shows the records and safe harbors of the application registry of a system root, without changing "
                "anything there.",
                "appregistry"};
-  app.set_version_flag("--version", tools::versionText("appregistry"));
+  app.set_version_flag("--version", platform::versionText("appregistry"));
   app.require_subcommand(1);
   std::string root;
   bool json = false;

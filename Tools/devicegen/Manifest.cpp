@@ -3,7 +3,6 @@
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Foundation/Text.h"
 #include "Platform/Foundation/URL.h"
-#include "Tools/UTF8.h"
 
 namespace devicegen {
 namespace {
@@ -52,7 +51,7 @@ constexpr char kItemDirectory[] = "Directory";
 constexpr char kItemLink[] = "Link";
 
 void putBytes(Dictionary& d, const std::string& key, const std::string& bytes) {
-  if (tools::isValidUTF8(bytes)) {
+  if (platform::isValidUTF8(bytes)) {
     d[key] = Value(bytes);
   } else {
     d[key + kBytesSuffix] = Value(platform::Data(bytes.begin(), bytes.end()));

@@ -9,7 +9,6 @@
 #include "Platform/Foundation/PropertyList.h"
 #include "Platform/Foundation/Text.h"
 #include "Platform/Registry/SQLiteRegistry.h"
-#include "Tools/UTF8.h"
 #include "Tools/devicegen/FileOps.h"
 #include "Tools/devicegen/Layout.h"
 #include "Tools/devicegen/Manifest.h"
@@ -26,7 +25,7 @@ constexpr const char* kProblemKindNames[] = {"missing", "changed", "left behind"
 static_assert(std::size(kProblemKindNames) == static_cast<size_t>(ProblemKind::Count));
 
 std::string show(const std::string& bytes) {
-  return tools::printable(bytes);
+  return platform::printable(bytes);
 }
 
 class ImageVerifier {
@@ -288,12 +287,12 @@ VerifyResult verifyImage(const std::string& root) {
 
 void printVerifyResult(const std::string& root, const VerifyResult& result, FILE* out) {
   if (!result.fatal.empty()) {
-    fprintf(out, "devicegen verify: %s\nFAILED: %s\n", tools::printable(root).c_str(),
-            tools::printable(result.fatal).c_str());
+    fprintf(out, "devicegen verify: %s\nFAILED: %s\n", platform::printable(root).c_str(),
+            platform::printable(result.fatal).c_str());
     return;
   }
   const VerifySummary& s = result.summary;
-  fprintf(out, "devicegen verify: %s\n", tools::printable(root).c_str());
+  fprintf(out, "devicegen verify: %s\n", platform::printable(root).c_str());
   fprintf(out,
           "  applications: %llu (%llu placeholders, %llu kept as built-in), VPN-only containers: %llu, groups: %llu, "
           "safe harbors: %llu\n",

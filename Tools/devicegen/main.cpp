@@ -13,8 +13,8 @@
 
 #include <CLI/CLI.hpp>
 
-#include "Tools/ToolVersion.h"
-#include "Tools/UTF8.h"
+#include "Platform/Foundation/ProjectVersion.h"
+#include "Platform/Foundation/Text.h"
 #include "Tools/devicegen/FileOps.h"
 #include "Tools/devicegen/Generator.h"
 #include "Tools/devicegen/Layout.h"
@@ -27,7 +27,7 @@ constexpr int kExitFailure = 1;
 constexpr int kExitUsage = 64;
 
 int fail(const std::string& message) {
-  fprintf(stderr, "devicegen: %s\n", tools::printable(message).c_str());
+  fprintf(stderr, "devicegen: %s\n", platform::printable(message).c_str());
   return kExitFailure;
 }
 
@@ -52,7 +52,7 @@ int runCreate(devicegen::ImageOptions options) {
   devicegen::Manifest manifest;
   if (!devicegen::createImage(options, &manifest, &why)) return fail(why);
   const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-  printf("devicegen create: %s\n", tools::printable(*root).c_str());
+  printf("devicegen create: %s\n", platform::printable(*root).c_str());
   printf(
       "  applications: %llu (%llu placeholders, %llu with a newer built-in copy), VPN-only containers: %llu, "
       "groups: %llu, safe harbors: %llu\n",
@@ -82,7 +82,7 @@ int runVerify(const std::string& rootArgument, bool json) {
 
 int main(int argc, char** argv) {
   CLI::App app{"Makes old-layout device images and verifies migrated ones.", "devicegen"};
-  app.set_version_flag("--version", tools::versionText("devicegen"));
+  app.set_version_flag("--version", platform::versionText("devicegen"));
   app.footer("Exit status: 0 success, 1 failure (create could not write the image, or verify found problems), 64 "
              "usage error.");
   app.require_subcommand(1);

@@ -7,8 +7,10 @@
 #include <sqlite3.h>
 
 #include <atomic>
+#include <functional>
 
 #include "Platform/Registry/RegistryDatabase.h"
+#include "Platform/Registry/RegistryReader.h"
 #include "Platform/RegistryFixture.h"
 
 namespace qstest {
@@ -215,7 +217,7 @@ int64_t userVersion(const std::string& path, std::optional<int> set = std::nullo
 
 // A new database records its schema version; one of an older version (0: made
 // before versions were kept) is brought up to it; one of a newer version is
-// refused, naming both versions, and left as it was.
+// refused, naming both versions, and left as it was, also by a read-only open.
 TEST_F(RegistryRecovery, DatabaseOfANewerSchemaVersionIsRefusedAndLeftUntouched) {
   const std::string database = at("private/var/db/appregistry/registry.sqlite");
   openRegistry().reset();
@@ -225,12 +227,20 @@ TEST_F(RegistryRecovery, DatabaseOfANewerSchemaVersionIsRefusedAndLeftUntouched)
   EXPECT_EQ(userVersion(database), 1);
 
   ASSERT_EQ(userVersion(database, 7), 7);
-  Error error;
-  EXPECT_FALSE(SQLiteApplicationRegistry::open(base_, &error));
-  EXPECT_EQ(registryCode(error), kRegistryErrorNewerDatabase) << error.description();
-  EXPECT_EQ(error.localizedDescription(), "registry database " + database +
-                                              " has schema version 7, newer than version 1 that this build reads; "
-                                              "it is left untouched");
+  // The read-only open (appregistry, the plan) refuses it alike.
+  const std::pair<const char*, std::function<bool(Error*)>> opens[] = {
+      {"read-write", [&](Error* e) { return SQLiteApplicationRegistry::open(base_, e) != nullptr; }},
+      {"read-only", [&](Error* e) { return platform::RegistryReader::open(base_, false, e) != nullptr; }},
+  };
+  for (const auto& [name, open] : opens) {
+    Error error;
+    EXPECT_FALSE(open(&error)) << name;
+    EXPECT_EQ(registryCode(error), kRegistryErrorNewerDatabase) << name << ": " << error.description();
+    EXPECT_EQ(error.localizedDescription(), "registry database " + database +
+                                                " has schema version 7, newer than version 1 that this build "
+                                                "reads; it is left untouched")
+        << name;
+  }
   EXPECT_EQ(userVersion(database), 7);
 }
 

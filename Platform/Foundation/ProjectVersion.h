@@ -1,9 +1,10 @@
-// The version line every program of the project prints for --version.
+// The version line every program of the project (the host and the tools)
+// prints for --version.
 #pragma once
 
 #include <string>
 
-namespace tools {
+namespace platform {
 
 // The project's version, set by the build.
 #ifndef QS_PROJECT_VERSION
@@ -17,4 +18,4 @@ inline std::string versionText(const std::string& program) {
   return program + " (" + kProjectName + ") " + kProjectVersion;
 }
 
-}  // namespace tools
+}  // namespace platform
