@@ -36,6 +36,10 @@ bool QSAppMigrator::_migrateDataContainerForIdentifier(const std::string& identi
                                                        const URL& toURL) {
   if (!_dataFitsInContainer(identifier, fromURL, toURL)) return false;
   const QSFileManager& fileManager = QSFileManager::defaultManager();
+  // The items move as one group: names of one file in two items stay one
+  // file, and what the moves need flushed is flushed once, at the end.
+  QSMoveGroup moves;
+  bool moved = true;
   for (const std::string& name : QSGlobalConfiguration::sharedInstance().appUserDataItemNames()) {
     const URL source = fromURL.appending(name, true);
     const URL destination = toURL.appending(name, true);
@@ -47,17 +51,27 @@ bool QSAppMigrator::_migrateDataContainerForIdentifier(const std::string& identi
     // Replace, never merge: whatever the new container holds under this name
     // goes first, unless another container moved it there in this run. A
     // removal that fails leaves the move below to report it.
-    if (!_mayReplaceItemAtURL(destination)) return false;
+    if (!_mayReplaceItemAtURL(destination)) {
+      moved = false;
+      break;
+    }
     (void)fileManager.removeItemAtURL(destination);
     Error error;
-    if (!fileManager.moveItemIfExistsAtURL(source, destination, &error)) {
+    if (!fileManager.moveItemIfExistsAtURL(source, destination, moves, &error)) {
       QSAM_LOG(kQSLogLevelError, kMigrateDataContainerFunction,
                "QSAppMigrator: Failed to move %@ to %@ migrating for %@ : %@", source, destination, identifier, error);
-      return false;
+      moved = false;
+      break;
     }
     _noteItemMovedInRun(destination);
   }
-  return true;
+  Error error;
+  if (!fileManager.finishMoveGroup(moves, &error)) {
+    QSAM_LOG(kQSLogLevelError, kMigrateDataContainerFunction,
+             "QSAppMigrator: Failed to flush the data moved to %@ migrating for %@ : %@", toURL, identifier, error);
+    return false;
+  }
+  return moved;
 }
 
 bool QSAppMigrator::_containerHasMissedItems(const URL& container, const std::string& withIdentifier) {

@@ -1,6 +1,8 @@
 // Group containers: the old container of each application group, recorded in
 // the old install map, is emptied into the new group container that the
 // registry reports for the installed application, then removed.
+#include <algorithm>
+
 #include "AppMigrator/QSAppMigrator.h"
 #include "Platform/Host/HostLog.h"
 #include "Shared/FileManager/QSFileManager.h"
@@ -14,26 +16,64 @@ namespace {
 constexpr char kMigrateFunction[] = "-[QSAppMigrator _migrateGroupContainersForIdentifier:]";
 constexpr char kMoveAllFunction[] = "-[QSAppMigrator _moveAllItemsInGroupContainerURL:toGroupContainerURL:]";
 
+// The order in which the items of a group container move: an item named
+// like the aside of another (an application's own, or the aside of an
+// interrupted move) before the others, so that it is resolved before the
+// item whose aside name it holds moves; an item named like the hidden copy of
+// another after all others, and only once that other has left (see
+// moveAllItems).
+int moveRank(const std::string& name) {
+  if (name.starts_with(kQSMoveOutgoingPrefix)) return 0;
+  if (name.starts_with(kQSMoveIncomingPrefix)) return 2;
+  return 1;
+}
+
 // Moves every item of `source` into `destination`, replacing (never merging)
 // an item of the same name. False only when `source` cannot be listed;
 // otherwise *failedItems is the number of items that could not be moved.
 bool moveAllItems(const URL& source, const URL& destination, size_t* failedItems) {
   const QSFileManager& fm = QSFileManager::defaultManager();
   Error error;
-  const auto items = fm.urlsForItemsInDirectoryAtURL(source, false, &error);
+  auto items = fm.urlsForItemsInDirectoryAtURL(source, false, &error);
   if (!items) {
     QSAM_LOG(kQSLogLevelError, kMoveAllFunction,
              "QSAppMigrator: Failed to get all urls in source group container %@ : %@", source.path(), error);
     return false;
   }
+  std::stable_sort(items->begin(), items->end(), [](const URL& a, const URL& b) {
+    return moveRank(a.lastPathComponent()) < moveRank(b.lastPathComponent());
+  });
   *failedItems = 0;
+  // Items an interrupted run moved before it could take the move's ticket
+  // off their copy: only the new container still has them.
+  if (const auto moved = fm.urlsForItemsInDirectoryAtURL(destination, false)) {
+    for (const URL& item : *moved) {
+      const std::string name = item.lastPathComponent();
+      if (std::none_of(items->begin(), items->end(), [&](const URL& old) { return old.lastPathComponent() == name; })) {
+        (void)fm.finishInterruptedMoveOfItemAtURL(source.appending(name), item);
+      }
+    }
+  }
+  // Names of one file in two items stay one file; the flushes the moves
+  // need are made once, at the end.
+  QSMoveGroup moves;
   for (const URL& item : *items) {
     const std::string name = item.lastPathComponent();
     if (name.starts_with(kQSMoveOutgoingPrefix)) {
       // An item an interrupted run had already moved, set aside for removal:
       // it goes once its copy is found in the new container, else it stays.
+      // An item of that name that no move set aside moves like any other.
       const std::string moved = name.substr(std::string_view(kQSMoveOutgoingPrefix).size());
-      if (!fm.finishInterruptedMoveOfItemAtURL(source.appending(moved), destination.appending(moved))) ++*failedItems;
+      if (!fm.finishInterruptedMoveOfItemAtURL(source.appending(moved), destination.appending(moved))) {
+        ++*failedItems;
+        continue;
+      }
+      if (!fm.itemExistsAtURL(item)) continue;
+    } else if (name.starts_with(kQSMoveIncomingPrefix) &&
+               fm.itemExistsAtURL(source.appending(name.substr(std::string_view(kQSMoveIncomingPrefix).size())))) {
+      // In the new container it would pass for the unfinished copy of that
+      // item, which a later attempt removes: it waits until the item left.
+      ++*failedItems;
       continue;
     }
     const URL target = destination.appending(name);
@@ -41,7 +81,7 @@ bool moveAllItems(const URL& source, const URL& destination, size_t* failedItems
     // The outcome is not tested: the move that follows fails if the old item
     // is still in the way.
     (void)fm.removeItemAtURL(target);
-    if (!fm.moveItemIfExistsAtURL(item, target, &error)) {
+    if (!fm.moveItemIfExistsAtURL(item, target, moves, &error)) {
       QSAM_LOG(kQSLogLevelError, kMoveAllFunction, "QSAppMigrator: Failed to move item %@ to %@ : %@", item.path(),
                target.path(), error);
       ++*failedItems;
@@ -50,6 +90,11 @@ bool moveAllItems(const URL& source, const URL& destination, size_t* failedItems
       // aside: it is still the item of the old container.
       ++*failedItems;
     }
+  }
+  if (!fm.finishMoveGroup(moves, &error)) {
+    QSAM_LOG(kQSLogLevelError, kMoveAllFunction, "QSAppMigrator: Failed to flush the items moved to %@ : %@",
+             destination.path(), error);
+    ++*failedItems;
   }
   return true;
 }

@@ -6,24 +6,34 @@
 // new one:
 //
 //   1. copy the source into a hidden sibling of the destination
-//      (kQSMoveIncomingPrefix + name);
+//      (kQSMoveIncomingPrefix + name) and give the copy a ticket: an
+//      attribute holding a token new to this move;
 //   2. make that copy durable with one flush of the destination's file system;
 //   3. rename it into place and flush the destination's directory;
-//   4. rename the source aside under a hidden name in its own directory
-//      (kQSMoveOutgoingPrefix + name) and flush that directory;
-//   5. remove the source set aside.
+//   4. mark the source with the same token and rename it aside under a
+//      hidden name in its own directory (kQSMoveOutgoingPrefix + name), then
+//      flush that directory;
+//   5. remove the source set aside; once that removal is durable (a flush of
+//      its directory, or of a whole QSMoveGroup's), take the ticket off.
 //
 // A hidden copy therefore only exists while the source is still in place, and
-// a source set aside only once its complete copy is durable at the
-// destination. finishInterruptedMoveOfItemAtURL relies on exactly that to
-// clean what an interrupted move left.
+// a source set aside only once its complete copy, ticket included, is durable
+// at the destination. finishInterruptedMoveOfItemAtURL relies on exactly that
+// to clean what an interrupted move left: an item at the aside's name is the
+// source of a move only when it carries the mark, and its copy is the
+// destination that carries the same token. Both attributes are in the
+// trusted namespace, which only a privileged process can write, and copies
+// never carry them over (see CopyTree.h).
 #include <fcntl.h>
 #include <stdio.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
+#include <random>
 
 #include "Shared/FileManager/CopyTree.h"
 #include "Shared/FileManager/PosixHandles.h"
@@ -39,6 +49,14 @@ namespace {
 constexpr char kCopyItemFn[] = "-[QSFileManager _copyItemAtURL:toURL:failIfSrcMissing:error:]";
 constexpr char kMoveItemFn[] = "-[QSFileManager _moveItemAtURL:toURL:failIfSrcMissing:error:]";
 constexpr char kFinishMoveFn[] = "-[QSFileManager finishInterruptedMoveOfItemAtURL:toURL:error:]";
+constexpr char kFinishGroupFn[] = "-[QSFileManager finishMoveGroup:error:]";
+
+// The token of a move across file systems: the ticket on its copy, the mark
+// on its source once it is set aside.
+const std::string kTicketAttribute = std::string(qsfs::kMoveAttributePrefix) + "ticket";
+const std::string kAsideAttribute = std::string(qsfs::kMoveAttributePrefix) + "aside";
+constexpr size_t kTokenWords = 4;  // of 32 bits
+constexpr size_t kAttributeValueLimit = 64;
 
 enum class SourceState { Present, Missing, Failed };
 
@@ -81,6 +99,36 @@ int flushDirectory(const std::string& directory) {
   return fsync(fd.get()) == 0 || errno == EINVAL ? 0 : errno;
 }
 
+// A token no other move has: random, as hexadecimal text.
+std::string newToken() {
+  static constexpr char kDigits[] = "0123456789abcdef";
+  std::random_device random;
+  std::string token;
+  for (size_t word = 0; word < kTokenWords; ++word) {
+    for (uint32_t value = random(), digit = 0; digit < 8; ++digit, value >>= 4) token += kDigits[value & 0xf];
+  }
+  return token;
+}
+
+// The value of the move's attribute `name` on the item at `path` (a final
+// link not followed), or "" when it has none.
+std::string moveAttributeOf(const std::string& path, const std::string& name) {
+  char value[kAttributeValueLimit];
+  ssize_t size = lgetxattr(path.c_str(), name.c_str(), value, sizeof value);
+  return size > 0 ? std::string(value, static_cast<size_t>(size)) : std::string();
+}
+
+int setMoveAttribute(const std::string& path, const std::string& name, const std::string& value) {
+  return lsetxattr(path.c_str(), name.c_str(), value.data(), value.size(), 0) == 0 ? 0 : errno;
+}
+
+// Takes the ticket off a copy whose source set aside is gone, once that
+// removal is durable: were the ticket's removal to persist without it, the
+// aside could no longer be told from an item of its own.
+void removeTicketAfterFlushing(const std::string& sourceDirectory, const std::string& copy) {
+  if (flushDirectory(sourceDirectory) == 0) (void)lremovexattr(copy.c_str(), kTicketAttribute.c_str());
+}
+
 // The removal of an item this file layer made itself (a hidden copy, a
 // source set aside): 0, or the error number of the first item that stayed.
 int removeHidden(const std::string& path) {
@@ -103,7 +151,15 @@ bool QSFileManager::_copyItemAtURL(const URL& src, const URL& dst, bool failIfSr
   return true;
 }
 
+QSMoveGroup::QSMoveGroup() : links_(std::make_unique<qsfs::CopyLinkTable>()) {}
+QSMoveGroup::~QSMoveGroup() = default;
+
 bool QSFileManager::_moveItemAtURL(const URL& src, const URL& dst, bool failIfSrcMissing, Error* error) const {
+  return _moveItem(src, dst, failIfSrcMissing, nullptr, error);
+}
+
+bool QSFileManager::_moveItem(const URL& src, const URL& dst, bool failIfSrcMissing, QSMoveGroup* group,
+                              Error* error) const {
   if (!failIfSrcMissing) {
     SourceState state = examineSource(kMoveItemFn, src, error);
     if (state != SourceState::Present) return state == SourceState::Missing;
@@ -114,13 +170,15 @@ bool QSFileManager::_moveItemAtURL(const URL& src, const URL& dst, bool failIfSr
     return QSFail(error, QSPOSIXError(kMoveItemFn, __LINE__, errnum, "rename of %@ to %@ failed: %s", src, dst,
                                       QSErrorText(errnum)));
   }
-  return _moveItemAcrossFileSystems(src, dst, error);
+  return _moveItemAcrossFileSystems(src, dst, group, error);
 }
 
-bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, Error* error) const {
+bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, QSMoveGroup* group,
+                                               Error* error) const {
   const std::string incoming = hiddenSibling(dst, kQSMoveIncomingPrefix);
   const std::string outgoing = hiddenSibling(src, kQSMoveOutgoingPrefix);
   const std::string dstDirectory = dst.deletingLastPathComponent().path();
+  const std::string srcDirectory = src.deletingLastPathComponent().path();
   const auto copyFailure = [&](int errnum) {
     return QSFail(error, QSPOSIXError(kCopyItemFn, __LINE__, errnum, "copyfile of %@ to %@ failed: %s", src, dst,
                                       QSErrorText(errnum)));
@@ -128,13 +186,22 @@ bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, E
   if (incoming.empty() || outgoing.empty()) return copyFailure(ENAMETOOLONG);
   // rename reports EXDEV before it looks for the source.
   if (!present(src.path())) return copyFailure(ENOENT);
+  // The source's aside name must be free: whatever has that name (an item
+  // of the application's own) is neither replaced nor taken for an aside.
+  if (present(outgoing)) {
+    return QSFail(error, QSPOSIXError(kMoveItemFn, __LINE__, EEXIST, "rename of %@ to %s failed: %s", src,
+                                      outgoing.c_str(), QSErrorText(EEXIST)));
+  }
   // A copy that an interrupted attempt left is incomplete: the source is
   // still here, so it is started again.
   if (int errnum = removeHidden(incoming); errnum != 0) return copyFailure(errnum);
 
   // Steps 1 to 3. A copy that fails or cannot be made durable is removed, so
   // that nothing of it takes space on the destination.
-  int errnum = qsfs::copyTree(src.fileSystemRepresentation(), incoming.c_str());
+  qsfs::CopyLinkTable* links = group != nullptr ? group->links_.get() : nullptr;
+  const std::string token = newToken();
+  int errnum = qsfs::copyTree(src.fileSystemRepresentation(), incoming.c_str(), links);
+  if (errnum == 0) errnum = setMoveAttribute(incoming, kTicketAttribute, token);
   if (errnum == 0) errnum = flushFileSystemOf(dstDirectory);
   if (errnum == 0) {
     // Nothing is replaced: what is at the destination stays.
@@ -144,8 +211,10 @@ bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, E
   }
   if (errnum != 0) {
     (void)removeHidden(incoming);
+    if (links != nullptr) links->topRemoved(incoming);
     return copyFailure(errnum);
   }
+  if (links != nullptr) links->topRenamed(incoming, dst.path());
   if (errnum = flushDirectory(dstDirectory); errnum != 0) {
     // The copy is in place but may not survive a power cut: the source
     // stays where it is, and the move fails.
@@ -156,17 +225,30 @@ bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, E
   // Steps 4 and 5. From here on the destination is complete: whatever fails
   // leaves the source (or what is left of it) beside it, as a removal of the
   // source that fails always has.
+  // The mark goes on before the rename, in the same file system: an aside
+  // never exists without it.
   Error removalError;
-  if (renameat2(AT_FDCWD, src.fileSystemRepresentation(), AT_FDCWD, outgoing.c_str(), RENAME_NOREPLACE) != 0) {
+  if (errnum = setMoveAttribute(src.path(), kAsideAttribute, token); errnum != 0) {
+    removalError = QSPOSIXError(kMoveItemFn, __LINE__, errnum, "setxattr of %@ failed: %s", src,
+                                QSErrorText(errnum));
+  } else if (renameat2(AT_FDCWD, src.fileSystemRepresentation(), AT_FDCWD, outgoing.c_str(), RENAME_NOREPLACE) !=
+             0) {
     errnum = errno;
     removalError = QSPOSIXError(kMoveItemFn, __LINE__, errnum, "rename of %@ to %s failed: %s", src,
                                 outgoing.c_str(), QSErrorText(errnum));
-  } else if (errnum = flushDirectory(src.deletingLastPathComponent().path()); errnum != 0) {
-    removalError = QSPOSIXError(kMoveItemFn, __LINE__, errnum, "fsync of %@ failed: %s",
-                                src.deletingLastPathComponent(), QSErrorText(errnum));
+    (void)lremovexattr(src.fileSystemRepresentation(), kAsideAttribute.c_str());
+  } else if (errnum = flushDirectory(srcDirectory); errnum != 0) {
+    removalError = QSPOSIXError(kMoveItemFn, __LINE__, errnum, "fsync of %s failed: %s", srcDirectory.c_str(),
+                                QSErrorText(errnum));
   } else if (!removeItemAtURL(URL::fileURL(outgoing, src.isDirectory()), &removalError)) {
-    // removeItemAtURL wrote the record.
+    // removeItemAtURL wrote the record; the aside keeps its mark, the copy
+    // its ticket.
+  } else if (group != nullptr) {
+    group->sourceDirectories_.push_back(srcDirectory);
+    group->ticketedCopies_.push_back(dst.path());
+    return true;
   } else {
+    removeTicketAfterFlushing(srcDirectory, dst.path());
     return true;
   }
   QS_SYSLOG(kQSLogLevelError, kMoveItemFn, "Failed to remove move source after copy at %@ : %@", src.path(),
@@ -177,10 +259,13 @@ bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, E
 bool QSFileManager::finishInterruptedMoveOfItemAtURL(const URL& src, const URL& dst, Error* error) const {
   const std::string incoming = hiddenSibling(dst, kQSMoveIncomingPrefix);
   const std::string outgoing = hiddenSibling(src, kQSMoveOutgoingPrefix);
-  if (!outgoing.empty() && present(outgoing)) {
-    // Set aside only once its copy was durable at the destination: while
-    // that copy is there, the source set aside is a second one.
-    if (!present(dst.path())) {
+  const std::string srcDirectory = src.deletingLastPathComponent().path();
+  const std::string mark = outgoing.empty() ? std::string() : moveAttributeOf(outgoing, kAsideAttribute);
+  if (!mark.empty()) {
+    // Set aside only once its copy, with the same token, was durable at the
+    // destination: while that copy is there, the source set aside is a
+    // second one.
+    if (!present(dst.path()) || moveAttributeOf(dst.path(), kTicketAttribute) != mark) {
       QS_SYSLOG(kQSLogLevelError, kFinishMoveFn, "Keeping %s : the move it was set aside for left nothing at %@",
                 outgoing.c_str(), dst.path());
       return QSFail(error, QSPOSIXError(kFinishMoveFn, __LINE__, ENOENT, "no copy of %s at %@", outgoing.c_str(),
@@ -192,7 +277,12 @@ bool QSFileManager::finishInterruptedMoveOfItemAtURL(const URL& src, const URL& 
       return QSFail(error, QSPOSIXError(kFinishMoveFn, __LINE__, errnum, "removefile of %s failed: %s",
                                         outgoing.c_str(), QSErrorText(errnum)));
     }
+    removeTicketAfterFlushing(srcDirectory, dst.path());
+  } else if (!moveAttributeOf(dst.path(), kTicketAttribute).empty()) {
+    // A move whose aside is gone, ended before its ticket came off.
+    removeTicketAfterFlushing(srcDirectory, dst.path());
   }
+  // An item at the aside's name without the mark is no aside: it stays.
   // A hidden copy exists only while its source is in place; without the
   // source it is left alone.
   if (!incoming.empty() && present(incoming) && present(src.path())) {
@@ -201,6 +291,35 @@ bool QSFileManager::finishInterruptedMoveOfItemAtURL(const URL& src, const URL& 
     if (int errnum = removeHidden(incoming); errnum != 0) {
       return QSFail(error, QSPOSIXError(kFinishMoveFn, __LINE__, errnum, "removefile of %s failed: %s",
                                         incoming.c_str(), QSErrorText(errnum)));
+    }
+  }
+  return true;
+}
+
+bool QSFileManager::finishMoveGroup(QSMoveGroup& group, Error* error) const {
+  if (group.ticketedCopies_.empty()) return true;
+  const auto unique = [](std::vector<std::string> paths) {
+    std::sort(paths.begin(), paths.end());
+    paths.erase(std::unique(paths.begin(), paths.end()), paths.end());
+    return paths;
+  };
+  for (const std::string& directory : unique(std::move(group.sourceDirectories_))) {
+    if (int errnum = flushDirectory(directory); errnum != 0) {
+      return QSFail(error, QSPOSIXError(kFinishGroupFn, __LINE__, errnum, "fsync of %s failed: %s", directory.c_str(),
+                                        QSErrorText(errnum)));
+    }
+  }
+  std::vector<std::string> copyDirectories;
+  for (const std::string& copy : group.ticketedCopies_) {
+    (void)lremovexattr(copy.c_str(), kTicketAttribute.c_str());
+    copyDirectories.push_back(URL::fileURL(copy).deletingLastPathComponent().path());
+  }
+  group.sourceDirectories_.clear();
+  group.ticketedCopies_.clear();
+  for (const std::string& directory : unique(std::move(copyDirectories))) {
+    if (int errnum = flushFileSystemOf(directory); errnum != 0) {
+      return QSFail(error, QSPOSIXError(kFinishGroupFn, __LINE__, errnum, "syncfs of %s failed: %s",
+                                        directory.c_str(), QSErrorText(errnum)));
     }
   }
   return true;
@@ -224,4 +343,8 @@ bool QSFileManager::moveItemIfExistsAtURL(const URL& src, const URL& dst, Error*
 
 bool QSFileManager::moveItemAtURL(const URL& src, const URL& dst, Error* error) const {
   return _moveItemAtURL(src, dst, true, error);
+}
+
+bool QSFileManager::moveItemIfExistsAtURL(const URL& src, const URL& dst, QSMoveGroup& group, Error* error) const {
+  return _moveItem(src, dst, false, &group, error);
 }

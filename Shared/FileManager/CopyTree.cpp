@@ -13,6 +13,7 @@
 #include <cerrno>
 #include <map>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -88,6 +89,7 @@ int copyExtendedAttributes(const AttributeTarget& from, const AttributeTarget& t
   std::vector<char> value;
   for (size_t at = 0; at < names.size(); at += std::char_traits<char>::length(&names[at]) + 1) {
     const char* name = &names[at];
+    if (std::string_view(name).starts_with(kMoveAttributePrefix)) continue;  // a move's own mark
     errnum = readSized(value, [&](char* b, size_t s) { return from.get(name, b, s); });
     if (errnum == ENODATA) continue;  // removed since it was listed
     if (errnum != 0) return errnum;
@@ -291,28 +293,47 @@ struct Frame {
   size_t next = 0;
 };
 
-// The copy of an item with several names, met under one of them: its further
-// names in the tree are made links to it.
-struct LinkedCopy {
-  std::vector<std::string> path;  // names from the top directory down to the copy's own
-  dev_t device = 0;               // of the copy
-  ino_t inode = 0;
-  nlink_t namesLeft = 0;  // names of the source not met yet
-};
-
 class TreeCopier {
  public:
+  explicit TreeCopier(CopyLinkTable& links) : links_(links) {}
+
   int run(const char* source, const char* destination) {
     struct stat status {};
     if (fstatat(AT_FDCWD, source, &status, AT_SYMLINK_NOFOLLOW) != 0) return errno;
     destinationPath_ = destination;
-    int errnum = copyItem({AT_FDCWD, source}, {AT_FDCWD, destination}, status);
+    top_ = links_.tops.size();
+    links_.tops.emplace_back(destination);
+    int errnum = copyOrLink({AT_FDCWD, source}, {AT_FDCWD, destination}, status);
     while (errnum == 0 && !frames_.empty()) errnum = step();
     return errnum;
   }
 
  private:
   using ItemKey = std::pair<dev_t, ino_t>;
+
+  // An item with several names is copied once: a name met later, in this
+  // tree or in another of the table, is linked to that copy.
+  int copyOrLink(const Location& from, const Location& to, const struct stat& status) {
+    if (S_ISDIR(status.st_mode)) return copyItem(from, to, status);
+    const ItemKey key{status.st_dev, status.st_ino};
+    auto found = links_.copies.find(key);
+    if (found != links_.copies.end() && (found->second.sourceSize != status.st_size ||
+                                         found->second.sourceModified.tv_sec != status.st_mtim.tv_sec ||
+                                         found->second.sourceModified.tv_nsec != status.st_mtim.tv_nsec)) {
+      links_.copies.erase(found);  // another item on a reused inode, or one changed since its copy
+      found = links_.copies.end();
+    }
+    if (found != links_.copies.end()) {
+      if (linkToCopy(found->second, to) == 0) {
+        if (--found->second.namesLeft == 0) links_.copies.erase(found);
+        return 0;
+      }
+      return copyItem(from, to, status);  // a copy of its own, like the first
+    }
+    if (int errnum = copyItem(from, to, status); errnum != 0) return errnum;
+    if (status.st_nlink > 1) rememberCopy(key, to, status);
+    return 0;
+  }
 
   int step() {
     Frame& top = frames_.back();
@@ -325,19 +346,7 @@ class TreeCopier {
     if (S_ISDIR(status.st_mode) && status.st_dev == copyRoot_.st_dev && status.st_ino == copyRoot_.st_ino) {
       return EINVAL;  // the copy's own destination, inside its source
     }
-    const Location from{top.source.get(), name}, to{top.destination.get(), name};
-    if (S_ISDIR(status.st_mode) || status.st_nlink < 2) return copyItem(from, to, status);
-    const ItemKey key{status.st_dev, status.st_ino};
-    if (auto found = linkedCopies_.find(key); found != linkedCopies_.end()) {
-      if (linkToCopy(found->second, to) == 0) {
-        if (--found->second.namesLeft == 0) linkedCopies_.erase(found);
-        return 0;
-      }
-      return copyItem(from, to, status);  // a copy of its own, like the first
-    }
-    if (int errnum = copyItem(from, to, status); errnum != 0) return errnum;
-    rememberCopy(key, to, status.st_nlink - 1);
-    return 0;
+    return copyOrLink({top.source.get(), name}, {top.destination.get(), name}, status);
   }
 
   int copyItem(const Location& from, const Location& to, const struct stat& status) {
@@ -385,15 +394,19 @@ class TreeCopier {
 
   // Records the copy just made at `to` (an entry of the top directory) as the
   // one further names of its source are linked to.
-  void rememberCopy(const ItemKey& key, const Location& to, nlink_t namesLeft) {
+  void rememberCopy(const ItemKey& key, const Location& to, const struct stat& source) {
     struct stat copy {};
     if (fstatat(to.directoryFD, to.name.c_str(), &copy, AT_SYMLINK_NOFOLLOW) != 0) return;  // no links to it then
-    LinkedCopy& linked = linkedCopies_[key];
+    LinkedCopy linked;
+    linked.top = top_;
     for (size_t level = 1; level < frames_.size(); ++level) linked.path.push_back(frames_[level].name);
-    linked.path.push_back(to.name);
+    if (!frames_.empty()) linked.path.push_back(to.name);
     linked.device = copy.st_dev;
     linked.inode = copy.st_ino;
-    linked.namesLeft = namesLeft;
+    linked.sourceSize = source.st_size;
+    linked.sourceModified = source.st_mtim;
+    linked.namesLeft = source.st_nlink - 1;
+    links_.copies[key] = std::move(linked);
   }
 
   // Makes `to` another name of `copy`. Its directory is reached from the
@@ -402,6 +415,7 @@ class TreeCopier {
   // ever used, however deep the tree. 0, or an error number when the link
   // could not be made (nothing was made then).
   int linkToCopy(const LinkedCopy& copy, const Location& to) {
+    if (copy.top != top_ || copy.path.empty()) return linkToCopyInAnotherTree(copy, to);
     size_t level = 0;  // of the deepest directory on both paths
     while (level + 1 < frames_.size() && level + 1 < copy.path.size() && frames_[level + 1].name == copy.path[level]) {
       ++level;
@@ -420,7 +434,25 @@ class TreeCopier {
       if (!opened.valid()) return errno;
       directoryFD = opened.get();
     }
-    if (linkat(directoryFD, copy.path.back().c_str(), to.directoryFD, to.name.c_str(), 0) != 0) return errno;
+    return linkAndCheck(copy, directoryFD, copy.path.back(), to);
+  }
+
+  // The same for a copy made by an earlier call: its tree is reached from
+  // its top's recorded path, one name at a time.
+  int linkToCopyInAnotherTree(const LinkedCopy& copy, const Location& to) {
+    const std::string& top = links_.tops.at(copy.top);
+    if (top.empty()) return ENOENT;
+    if (copy.path.empty()) return linkAndCheck(copy, AT_FDCWD, top, to);
+    ScopedFD opened(open(top.c_str(), kOpenDirectoryFlags));
+    for (size_t level = 0; opened.valid() && level + 1 < copy.path.size(); ++level) {
+      opened.reset(openat(opened.get(), copy.path[level].c_str(), kOpenDirectoryFlags));
+    }
+    if (!opened.valid()) return errno;
+    return linkAndCheck(copy, opened.get(), copy.path.back(), to);
+  }
+
+  int linkAndCheck(const LinkedCopy& copy, int directoryFD, const std::string& name, const Location& to) {
+    if (linkat(directoryFD, name.c_str(), to.directoryFD, to.name.c_str(), 0) != 0) return errno;
     // The copy's directories could have been renamed meanwhile: the new name
     // must be the copy, or it goes again.
     struct stat linked {};
@@ -483,17 +515,27 @@ class TreeCopier {
   std::vector<Frame> frames_;
   struct stat copyRoot_ {};  // the destination's top directory
   std::string destinationPath_;
-  std::map<ItemKey, LinkedCopy> linkedCopies_;  // by the source's device and inode
+  CopyLinkTable& links_;
+  size_t top_ = 0;  // this tree's index in links_.tops
   std::vector<DataRoute> routes_;
   std::vector<char> buffer_;  // of the read and write copies
 };
 
 }  // namespace
 
-int copyTree(const char* source, const char* destination) {
+int copyTree(const char* source, const char* destination, CopyLinkTable* links) {
   if (source == nullptr || destination == nullptr) return EFAULT;
-  TreeCopier copier;
+  CopyLinkTable own;
+  TreeCopier copier(links != nullptr ? *links : own);
   return copier.run(source, destination);
 }
+
+void CopyLinkTable::topRenamed(const std::string& from, const std::string& to) {
+  for (std::string& top : tops) {
+    if (top == from) top = to;
+  }
+}
+
+void CopyLinkTable::topRemoved(const std::string& top) { topRenamed(top, ""); }
 
 }  // namespace qsfs

@@ -17,6 +17,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -81,6 +82,32 @@ inline constexpr char kQSInstallTypeAttributeName[] = "user.com.vantrel.quilld.i
 inline constexpr char kQSMoveIncomingPrefix[] = ".qs-move-incoming.";
 inline constexpr char kQSMoveOutgoingPrefix[] = ".qs-move-outgoing.";
 
+namespace qsfs {
+struct CopyLinkTable;
+}  // namespace qsfs
+
+// The moves of the items of one container, made one after the other as a
+// set: names of one inode in different items stay names of one inode when
+// they move to another file system, and QSFileManager::finishMoveGroup ends
+// the set with one flush of each file system involved instead of one per
+// item. Not shared between threads.
+class QSMoveGroup {
+ public:
+  QSMoveGroup();
+  ~QSMoveGroup();
+  QSMoveGroup(const QSMoveGroup&) = delete;
+  QSMoveGroup& operator=(const QSMoveGroup&) = delete;
+
+ private:
+  friend class QSFileManager;
+  std::unique_ptr<qsfs::CopyLinkTable> links_;
+  // Moves across file systems whose source set aside is gone: the
+  // directories it was removed from, and the copies that still carry the
+  // move's ticket.
+  std::vector<std::string> sourceDirectories_;
+  std::vector<std::string> ticketedCopies_;
+};
+
 class QSFileManager {
  public:
   static QSFileManager& defaultManager();
@@ -122,12 +149,20 @@ class QSFileManager {
   [[nodiscard]] bool moveItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst,
                              platform::Error* error = nullptr) const;
   [[nodiscard]] bool moveItemAtURL(const platform::URL& src, const platform::URL& dst, platform::Error* error = nullptr) const;
+  // The same as a member of `group` (see QSMoveGroup).
+  [[nodiscard]] bool moveItemIfExistsAtURL(const platform::URL& src, const platform::URL& dst, QSMoveGroup& group,
+                                           platform::Error* error = nullptr) const;
+  // Ends the moves of `group`: when some went to another file system, makes
+  // the removal of their sources durable, takes the move's ticket off their
+  // copies and flushes the file system of those. False when a flush fails.
+  [[nodiscard]] bool finishMoveGroup(QSMoveGroup& group, platform::Error* error = nullptr) const;
   // Cleans what an interrupted move of `src` to `dst` across file systems
-  // left: the source set aside is removed when the destination exists (its
-  // complete copy), kept otherwise (false, with a level-3 line); an
-  // unfinished hidden copy is removed while the source is in place. Callers
-  // run it before they look at `src`; without leftovers it only tests two
-  // names.
+  // left: the source set aside (recognised by the mark the move gave it,
+  // which names the ticket of its copy) is removed when the destination is
+  // that copy, kept otherwise (false, with a level-3 line); an item of that
+  // name without the mark is not a leftover and stays. An unfinished hidden
+  // copy is removed while the source is in place. Callers run it before they
+  // look at `src`; without leftovers it only looks at three names.
   [[nodiscard]] bool finishInterruptedMoveOfItemAtURL(const platform::URL& src, const platform::URL& dst,
                                         platform::Error* error = nullptr) const;
   // Whether `name` is one that a move across file systems gives an item
@@ -221,5 +256,8 @@ class QSFileManager {
 
  private:
   QSFileManager() = default;
-  bool _moveItemAcrossFileSystems(const platform::URL& src, const platform::URL& dst, platform::Error* error) const;
+  bool _moveItem(const platform::URL& src, const platform::URL& dst, bool failIfSrcMissing, QSMoveGroup* group,
+                 platform::Error* error) const;
+  bool _moveItemAcrossFileSystems(const platform::URL& src, const platform::URL& dst, QSMoveGroup* group,
+                                  platform::Error* error) const;
 };

@@ -1,6 +1,9 @@
 // Group containers: emptied into the new ones the registry names, removed, and
 // dropped from the map, without ever losing an item that could not be moved.
+#include <sys/xattr.h>
+
 #include "FakePlatform.h"
+#include "Shared/FileManager/CopyTree.h"
 #include "Shared/FileManager/QSFileManager.h"
 
 namespace qstest {
@@ -88,14 +91,19 @@ TEST_F(GroupContainerMigration, ItemThatCannotMoveKeepsTheGroupRecordedUntilALat
   // What a move killed after it set its source aside leaves: the aside, and
   // its complete copy in the new container.
   const std::string fresh = newGroups_ + "/group.a";
-  ASSERT_TRUE(writeFile(old + "/" + kQSMoveOutgoingPrefix + "done", "old done") &&
-              writeFile(fresh + "/done", "old done"));
+  const std::string aside = old + "/" + kQSMoveOutgoingPrefix + "done";
+  ASSERT_TRUE(writeFile(aside, "old done") && writeFile(fresh + "/done", "old done"));
+  const std::string token = "t1", mark = std::string(qsfs::kMoveAttributePrefix) + "aside",
+                    ticket = std::string(qsfs::kMoveAttributePrefix) + "ticket";
+  ASSERT_EQ(lsetxattr(aside.c_str(), mark.c_str(), token.data(), token.size(), 0), 0) << strerror(errno);
+  ASSERT_EQ(lsetxattr((fresh + "/done").c_str(), ticket.c_str(), token.data(), token.size(), 0), 0);
   ASSERT_TRUE(setImmutable(old + "/stuck", true));  // cleared below, or by the scratch directory
   EXPECT_FALSE(migrate("com.example.a"));
   EXPECT_EQ(readFile(fresh + "/movable"), "old movable");
   EXPECT_EQ(readFile(old + "/stuck"), "old stuck");
   EXPECT_EQ(directoryNames(old), std::vector<std::string>{"stuck"});
   EXPECT_EQ(readFile(fresh + "/done"), "old done");
+  EXPECT_FALSE(pathExists(fresh + "/" + kQSMoveOutgoingPrefix + "done"));
   EXPECT_TRUE(mapHas("group.a"));
   EXPECT_TRUE(loggedOnce(
       "QSAppMigrator: Failed to move item " + old + "/stuck to " + fresh + "/stuck : Error Domain=", true));

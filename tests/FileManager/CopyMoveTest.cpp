@@ -7,6 +7,7 @@
 #include <tuple>
 
 #include "FileLayerTestSupport.h"
+#include "Shared/FileManager/CopyTree.h"
 #include "Shared/FileManager/TreeWalk.h"
 
 namespace {
@@ -195,20 +196,32 @@ TEST_F(FileManagerMove, CrossDeviceMoveThatRunsOutOfSpaceLeavesTheSourceWholeAnd
 }
 
 // What an interrupted move can leave, and what the next attempt makes of it:
-// a leftover goes only when the item is provably complete elsewhere.
+// a leftover goes only when the item is provably complete elsewhere. An item
+// at the aside's name is an aside only with the move's mark, and its copy is
+// the destination only with the same token as ticket; a ticket whose aside
+// is gone comes off.
 TEST_F(FileManagerMove, LeftoversOfAnInterruptedMoveGoOnlyWhenTheItemIsCompleteElsewhere) {
+  const std::string ticket = std::string(qsfs::kMoveAttributePrefix) + "ticket";
+  const std::string mark = std::string(qsfs::kMoveAttributePrefix) + "aside";
   struct Case {
     const char* name;
-    std::vector<std::string> before;  // "s": source, "d": destination, "in": hidden copy, "out": source aside
+    // "s": source, "d": destination, "in": hidden copy, "out": item at the
+    // aside's name; the token of the destination's ticket and of the mark.
+    std::vector<std::string> before;
+    const char *ticketToken, *markToken;
     bool finished;
     std::vector<std::string> after;
   };
   const Case cases[] = {
-      {"aside beside its copy", {"d", "out"}, true, {"d"}},
-      {"aside without a copy", {"out"}, false, {"out"}},
-      {"unfinished copy while the source is in place", {"s", "in"}, true, {"s"}},
-      {"hidden copy without its source", {"in"}, true, {"in"}},
-      {"a copy replaced by the source again", {"s", "d"}, true, {"s", "d"}},
+      {"aside beside its copy", {"d", "out"}, "t1", "t1", true, {"d"}},
+      {"aside without a copy", {"out"}, nullptr, "t1", false, {"out"}},
+      {"aside beside another copy", {"d", "out"}, "t2", "t1", false, {"d", "out"}},
+      {"aside beside a copy without a ticket", {"d", "out"}, nullptr, "t1", false, {"d", "out"}},
+      {"an application's own item at the aside's name", {"d", "out"}, "t1", nullptr, true, {"d", "out"}},
+      {"ticket of a move that ended", {"d"}, "t1", nullptr, true, {"d"}},
+      {"unfinished copy while the source is in place", {"s", "in"}, nullptr, nullptr, true, {"s"}},
+      {"hidden copy without its source", {"in"}, nullptr, nullptr, true, {"in"}},
+      {"a copy replaced by the source again", {"s", "d"}, nullptr, nullptr, true, {"s", "d"}},
   };
   qstest::ShmDir shm;
   const std::map<std::string, std::string> paths{{"s", dir / "item"},
@@ -220,14 +233,55 @@ TEST_F(FileManagerMove, LeftoversOfAnInterruptedMoveGoOnlyWhenTheItemIsCompleteE
     for (const std::string& item : c.before) {
       ASSERT_TRUE(qstest::makeDirs(paths.at(item)) && qstest::writeFile(paths.at(item) + "/f", item));
     }
+    if (c.ticketToken) qstest::setXattr(paths.at("d"), ticket.c_str(), c.ticketToken);
+    if (c.markToken) qstest::setXattr(paths.at("out"), mark.c_str(), c.markToken);
     EXPECT_EQ(fm.finishInterruptedMoveOfItemAtURL(fileURL(paths.at("s"), true), fileURL(paths.at("d"), true)),
               c.finished);
+    const bool ticketStays = c.ticketToken && c.markToken && !c.finished;
+    EXPECT_EQ(qstest::xattrOf(paths.at("d"), ticket.c_str()).value_or(""), ticketStays ? c.ticketToken : "");
     for (const auto& [item, path] : paths) {
       const bool kept = std::find(c.after.begin(), c.after.end(), item) != c.after.end();
       EXPECT_EQ(qstest::readFile(path + "/f"), kept ? item : "") << item;
       ASSERT_TRUE(fm.removeItemAtURL(fileURL(path, true)));
     }
   }
+}
+
+// The items of one container moved as a group: names of one file in several
+// items (a top-level file among them) arrive as names of one file. An item
+// whose move fails after its copy linked to an earlier item's file (the name
+// is taken at the destination) takes only its own name away with its copy.
+TEST_F(FileManagerMove, NamesOfOneFileInSeveralItemsOfAGroupStayOneFileAcrossDevices) {
+  const std::string src = dir / "container";
+  ASSERT_NO_FATAL_FAILURE(qstest::makeTree(src, {"Documents/a", "Library/x", "Blocked/y"}));
+  ASSERT_TRUE(qstest::writeFile(src + "/Documents/a", "shared"));
+  for (const char* name : {"/Documents/b", "/Library/c", "/top", "/Blocked/e"}) {
+    ASSERT_EQ(link((src + "/Documents/a").c_str(), (src + name).c_str()), 0) << name;
+  }
+  qstest::ShmDir shm;
+  ASSERT_TRUE(qstest::makeDirs(shm / "Blocked"));
+  QSMoveGroup group;
+  for (const char* item : {"Documents", "Blocked", "Library", "top"}) {
+    Error error;
+    EXPECT_EQ(fm.moveItemIfExistsAtURL(fileURL(src + "/" + item), fileURL(shm / item), group, &error),
+              std::string(item) != "Blocked")
+        << item << ": " << error.description();
+  }
+  EXPECT_TRUE(fm.finishMoveGroup(group));
+  const auto first = qstest::lstatOf(shm / "Documents/a");
+  ASSERT_TRUE(first);
+  EXPECT_EQ(first->st_nlink, 4u);
+  for (const char* name : {"Documents/b", "Library/c", "top"}) {
+    const auto other = qstest::lstatOf(shm / name);
+    ASSERT_TRUE(other) << name;
+    EXPECT_EQ(other->st_ino, first->st_ino) << name;
+  }
+  EXPECT_EQ(qstest::readFile(shm / "top"), "shared");
+  EXPECT_EQ(qstest::readFile(src + "/Blocked/e"), "shared");
+  EXPECT_FALSE(exists(src + "/Documents") || exists(shm / "Blocked/e"));
+  // The moves' ticket is off every copy once the group is finished.
+  const std::string ticket = std::string(qsfs::kMoveAttributePrefix) + "ticket";
+  for (const char* item : {"Documents", "Library", "top"}) EXPECT_FALSE(qstest::xattrOf(shm / item, ticket.c_str())) << item;
 }
 
 // --- Capture of the store items ------------------------------------------------

@@ -27,6 +27,7 @@
 #include <gtest/gtest.h>
 
 #include "AppMigrator/QSAppMigrator.h"
+#include "Shared/FileManager/CopyTree.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "e2e/Programs.h"
 #include "support/TestSupport.h"
@@ -237,7 +238,46 @@ class World : public testing::Test {
     std::vector<std::string> argv{"devicegen", "create", "--root", image()};
     argv.insert(argv.end(), options.begin(), options.end());
     ASSERT_EQ(run(argv), 0);
+    if (options == kSmallImage) {
+      ASSERT_NO_FATAL_FAILURE(linkAcrossItems());
+    }
     ASSERT_EQ(run({"/bin/cp", "-a", world() + "/.", dir_ / "pristine"}), 0);
+  }
+  // Gives a file of the old container's Documents a second name there and a
+  // third in its Library: three names of one file in two items.
+  void linkAcrossItems() {
+    for (const auto& entry : fs::recursive_directory_iterator(world() + kOldApplications)) {
+      const std::string path = entry.path().string();
+      if (fs::is_regular_file(entry.symlink_status()) && path.find("/Documents/") != std::string::npos &&
+          fs::file_size(path) > 0) {
+        const std::string documents = path.substr(0, path.find("/Documents/") + 10);
+        ASSERT_EQ(link(path.c_str(), (documents + "/" + kLinkedNames[0]).c_str()), 0) << strerror(errno);
+        ASSERT_EQ(link(path.c_str(), (documents + "/../Library/" + kLinkedNames[1]).c_str()), 0) << strerror(errno);
+        linkedNames_ = {entry.path().filename().string(), kLinkedNames[0], kLinkedNames[1]};
+        linkedContents_ = readFile(path);
+        return;
+      }
+    }
+    FAIL() << "no file in Documents";
+  }
+  // The three names of linkAcrossItems in the new data container, with the
+  // file's contents, and names of one file when `oneFile`: "" or what is
+  // wrong.
+  std::string checkLinkedNames(bool oneFile) const {
+    if (linkedContents_.empty()) return "";
+    std::set<uint64_t> inodes;
+    size_t found = 0;
+    for (const auto& entry : fs::recursive_directory_iterator(world() + kContainers + "/Data")) {
+      const std::string name = entry.path().filename().string();
+      if (std::find(linkedNames_.begin(), linkedNames_.end(), name) == linkedNames_.end()) continue;
+      ++found;
+      if (readFile(entry.path().string()) != linkedContents_) return "contents of " + entry.path().string();
+      struct stat status {};
+      if (lstat(entry.path().c_str(), &status) == 0) inodes.insert(status.st_ino);
+    }
+    if (found != linkedNames_.size()) return std::to_string(found) + " of the linked names in the new container";
+    if (oneFile && inodes.size() != 1) return "the linked names arrived as " + std::to_string(inodes.size()) + " files";
+    return "";
   }
   // Back to the world devicegen made, mount points kept.
   void restore() {
@@ -290,11 +330,20 @@ class World : public testing::Test {
       return "verify: " + tail(report);
     }
     if (std::string left = hiddenLeftover(); !left.empty()) return "left behind: " + left;
-    return "";
+    return checkLinkedNames(false);
   }
+  // A hidden name of a move, or an item that still carries a move's ticket
+  // or mark.
   std::string hiddenLeftover() const {
+    char value[64];
     for (const auto& entry : fs::recursive_directory_iterator(image())) {
       if (QSFileManager::isInterruptedMoveItemName(entry.path().filename().string())) return entry.path().string();
+      for (const char* attribute : {"ticket", "aside"}) {
+        const std::string name = std::string(qsfs::kMoveAttributePrefix) + attribute;
+        if (lgetxattr(entry.path().c_str(), name.c_str(), value, sizeof value) >= 0) {
+          return entry.path().string() + " (" + name + ")";
+        }
+      }
     }
     return "";
   }
@@ -303,10 +352,14 @@ class World : public testing::Test {
     std::vector<std::pair<std::string, std::string>> env{{"QS_TRAP_COUNT", dir_ / "count"}};
     if (!record.empty()) env.emplace_back("QS_TRAP_RECORD", record);
     EXPECT_EQ(migrate(env), 0);
+    EXPECT_EQ(checkLinkedNames(true), "");
     return std::stol(readFile(dir_ / "count"));
   }
 
+  static constexpr const char* kLinkedNames[] = {"second name", "third name"};
   const Layout layout_;
+  std::vector<std::string> linkedNames_;
+  std::string linkedContents_;
   size_t mapsLeft_ = 0;
   TempDir dir_{"crash"};
   std::unique_ptr<Tmpfs> world_, containers_;
@@ -471,6 +524,55 @@ TEST_F(Faults, SourceFileThatCannotBeRemovedEndsWithEveryFileSafe) {
     }
   }
   EXPECT_EQ(finishAndVerify(), "");
+}
+
+// Items an application named like the hidden names of a move: a
+// ".qs-move-outgoing.Documents" in its container beside Documents, and in its
+// group container a ".qs-move-outgoing.<item>" beside <item> and a
+// ".qs-move-incoming.<item>". However many runs follow, every file of the
+// image (planted ones included) is still somewhere with its contents; once the
+// item in Documents' way is gone, a run finishes.
+TEST_F(Faults, ItemsNamedLikeAMovesHiddenNamesAreNeverTakenForLeftovers) {
+  ASSERT_NO_FATAL_FAILURE(createImage(kSmallImage));
+  std::string container, group;
+  for (const auto& entry : fs::directory_iterator(world() + kOldApplications)) {
+    if (entry.is_directory()) container = entry.path().string();
+  }
+  for (const auto& entry : fs::directory_iterator(image() + "/private/var/mobile/Library/AppGroups")) {
+    group = entry.path().string();
+  }
+  ASSERT_FALSE(container.empty() || group.empty());
+  const std::string plantedAside = container + "/" + kQSMoveOutgoingPrefix + "Documents";
+  ASSERT_TRUE(makeDirs(plantedAside) && writeFile(plantedAside + "/planted-documents", "documents aside"));
+  ASSERT_TRUE(writeFile(group + "/" + kQSMoveOutgoingPrefix + "Shared", "group aside"));
+  ASSERT_TRUE(writeFile(group + "/" + kQSMoveIncomingPrefix + "Library", "group incoming"));
+  // Every regular file under `roots` by name and contents.
+  const auto files = [&](const std::vector<std::string>& roots) {
+    std::multiset<std::pair<std::string, std::string>> found;
+    for (const std::string& root : roots) {
+      for (const auto& entry : fs::recursive_directory_iterator(root)) {
+        if (fs::is_regular_file(entry.symlink_status())) {
+          found.emplace(entry.path().filename().string(), readFile(entry.path().string()));
+        }
+      }
+    }
+    return found;
+  };
+  const auto before = files({container, group});
+  const auto everywhere = [&] { return files({image()}); };
+  for (int attempt = 1; attempt <= 4; ++attempt) {
+    EXPECT_EQ(migrate(), 1) << "run " << attempt;
+    const auto after = everywhere();
+    for (const auto& file : before) EXPECT_GE(after.count(file), before.count(file)) << "run " << attempt << ": " << file.first;
+  }
+  EXPECT_EQ(readFile(plantedAside + "/planted-documents"), "documents aside");
+  std::error_code renamed;
+  fs::rename(plantedAside, container + "/Documents/planted", renamed);
+  ASSERT_FALSE(renamed) << renamed.message();
+  EXPECT_EQ(migrate(), 0);
+  EXPECT_EQ(run({"devicegen", "verify", "--root", image()}), 0) << readFile(dir_ / "stdout");
+  const auto finished = everywhere();
+  for (const auto& file : before) EXPECT_GE(finished.count(file), before.count(file)) << file.first;
 }
 
 INSTANTIATE_TEST_SUITE_P(Layouts, CrashSafety, testing::Values(Layout::SameFileSystem, Layout::ContainersOnTmpfs),
