@@ -253,6 +253,9 @@ PlannedContainer QSAppMigrator::_planContainer(const Dictionary& info, bool from
     const platform::Value* path = entry ? entry->get(kQSGroupContainerPathKey) : nullptr;
     if (!path || !path->isString()) continue;
     const URL oldContainer = URL::fileURL(*path->asString(), true);
+    // A container that the run leaves where it is (its refusal is logged
+    // then) is neither measured nor planned.
+    if (_groupContainerRefusal(oldContainer, group)) continue;
     if (QSFileManager::defaultManager().itemDoesNotExistAtURL(oldContainer)) continue;
     platform::PlannedGroup plannedGroup{group, oldContainer.path(), _measureItem(oldContainer), {}};
     const std::optional<URL> existing = forecast.groupContainerForGroup(group);

@@ -212,8 +212,9 @@ std::deque<Dictionary> QSAppMigrator::_introspectItemsToMigrate() {
     }
     if (_groupContainerMap) {
       for (const auto& [group, entry] : *_groupContainerMap) {
-        const Value* path = entry.get(kQSGroupContainerPathKey);
-        if (path && path->isString()) bytes += _measureItem(URL::fileURL(*path->asString(), true)).bytes;
+        if (const std::optional<URL> oldContainer = _movableOldGroupContainer(group)) {
+          bytes += _measureItem(*oldContainer).bytes;
+        }
       }
     }
     services_.observer->migrationPlanned(workList.size(), bytes);

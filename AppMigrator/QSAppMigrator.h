@@ -163,6 +163,12 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   // application's container, built-in bundle or system directory, and holds
   // no other group's container. False with a level-3 line otherwise.
   bool _groupContainerPathIsAcceptable(const platform::URL& oldContainer, const std::string& group);
+  // Why `group`'s old container at `oldContainer` must stay where it is (no
+  // log line), or none when it may move. Everything that measures or moves an
+  // old group container asks first: a map entry may name any directory.
+  const char* _groupContainerRefusal(const platform::URL& oldContainer, const std::string& group) const;
+  // `group`'s old container as the map names it, when it may move.
+  std::optional<platform::URL> _movableOldGroupContainer(const std::string& group) const;
   // True the first time an identifier is claimed in this run; false, with a
   // level-3 line, when another container was already migrated as it.
   bool _claimIdentifierForRun(const platform::Dictionary& info);

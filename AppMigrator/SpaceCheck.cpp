@@ -93,13 +93,11 @@ bool QSAppMigrator::_groupContainersFitForIdentifier(const std::string& identifi
                                                      const std::map<std::string, URL>& newContainers) {
   if (!_groupContainerMap) return true;
   for (const auto& [group, newContainer] : newContainers) {
-    const platform::Value* entry = QSValueForKey(*_groupContainerMap, group);
-    const platform::Value* path = entry ? entry->get(kQSGroupContainerPathKey) : nullptr;
-    if (!path || !path->isString()) continue;  // the group step says why it moves nothing
-    const URL oldContainer = URL::fileURL(*path->asString(), true);
+    const std::optional<URL> oldContainer = _movableOldGroupContainer(group);
+    if (!oldContainer) continue;  // the group step says why it moves nothing
     std::vector<URL> items;
     Error error;
-    if (auto listed = QSFileManager::defaultManager().urlsForItemsInDirectoryAtURL(oldContainer, false, &error)) {
+    if (auto listed = QSFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*oldContainer, false, &error)) {
       items = std::move(*listed);
     }
     if (!_destinationHasRoomForItems(items, newContainer, identifier + "[" + group + "]")) return false;
@@ -131,9 +129,9 @@ std::map<std::string, platform::PlanSize> QSAppMigrator::_measureGroupsForIdenti
   const std::optional<platform::BundleRecord> record = services_.registry->recordForIdentifier(identifier);
   if (!record || !record->groupContainerURLs) return sizes;
   for (const auto& [group, newContainer] : *record->groupContainerURLs) {
-    const platform::Value* entry = QSValueForKey(*_groupContainerMap, group);
-    const platform::Value* path = entry ? entry->get(kQSGroupContainerPathKey) : nullptr;
-    if (path && path->isString()) sizes[group] = _measureItem(URL::fileURL(*path->asString(), true));
+    if (const std::optional<URL> oldContainer = _movableOldGroupContainer(group)) {
+      sizes[group] = _measureItem(*oldContainer);
+    }
   }
   return sizes;
 }

@@ -60,13 +60,17 @@ bool QSAppMigrator::_identifierIsBuiltIn(const std::string& identifier) {
 }
 
 bool QSAppMigrator::_groupContainerPathIsAcceptable(const URL& oldContainer, const std::string& group) {
+  const char* reason = _groupContainerRefusal(oldContainer, group);
+  if (!reason) return true;
+  QSAM_LOG(kQSLogLevelError, kGroupCheckFunction, "QSAppMigrator: Not migrating group container %@ at %@ : %s", group,
+           oldContainer.path(), reason);
+  return false;
+}
+
+const char* QSAppMigrator::_groupContainerRefusal(const URL& oldContainer, const std::string& group) const {
   QSGlobalConfiguration& configuration = QSGlobalConfiguration::sharedInstance();
   const QSFileManager& fm = QSFileManager::defaultManager();
-  auto refuse = [&](const char* reason) {
-    QSAM_LOG(kQSLogLevelError, kGroupCheckFunction, "QSAppMigrator: Not migrating group container %@ at %@ : %s",
-             group, oldContainer.path(), reason);
-    return false;
-  };
+  auto refuse = [](const char* reason) { return reason; };
   if (!fm.urlLiesInsideURL(oldContainer, configuration.rootPath())) {
     return refuse("the path does not lie inside the system root");
   }
@@ -88,13 +92,24 @@ bool QSAppMigrator::_groupContainerPathIsAcceptable(const URL& oldContainer, con
     // layout with them.
     if (fm.urlLiesInsideURL(area, oldContainer)) return refuse("the path holds directories of the system's layout");
   }
+  if (!_groupContainerMap) return nullptr;
   for (const auto& [other, entry] : *_groupContainerMap) {
     const platform::Value* path = other == group ? nullptr : entry.get(kQSGroupContainerPathKey);
     if (path && path->isString() && fm.urlLiesInsideURL(URL::fileURL(*path->asString(), true), oldContainer)) {
       return refuse("the path holds another group's container");
     }
   }
-  return true;
+  return nullptr;
+}
+
+std::optional<URL> QSAppMigrator::_movableOldGroupContainer(const std::string& group) const {
+  if (!_groupContainerMap) return std::nullopt;
+  const platform::Value* entry = QSValueForKey(*_groupContainerMap, group);
+  const platform::Value* path = entry ? entry->get(kQSGroupContainerPathKey) : nullptr;
+  if (!path || !path->isString()) return std::nullopt;
+  URL oldContainer = URL::fileURL(*path->asString(), true);
+  if (_groupContainerRefusal(oldContainer, group)) return std::nullopt;
+  return oldContainer;
 }
 
 bool QSAppMigrator::_claimIdentifierForRun(const Dictionary& info) {

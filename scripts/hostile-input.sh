@@ -39,6 +39,7 @@ with open(c + "/com.vantrel.quill.set.container_migrator.plist", 'wb') as f: pli
 PY
 }
 group_container() {  # group_container PATH: every group of the install map points at PATH
+  refused_group=$1
   python3 - "$root/private/var/mobile/Library/Caches/com.vantrel.quill.set.plist" "$1" <<'PY'
 import plistlib, sys
 path, target = sys.argv[1:3]
@@ -193,11 +194,30 @@ for entry in "${cases[@]}"; do
     --seed 7 >/dev/null || { echo "FAIL $name: devicegen"; failed=$((failed + 1)); continue; }
   before=$(user_digests)
   outside_before=$(snapshot "$sentinel")
+  refused_group=
   "mutate_$name" || { echo "FAIL $name: could not make the case"; failed=$((failed + 1)); continue; }
+  # A group container the run refuses is neither measured nor planned: the
+  # plan must not list it (measuring / would walk the whole machine).
+  planned_refused=
+  if [[ -n "$refused_group" ]]; then
+    TMPDIR="$dir/tmp" timeout "$limit" "$bin/transvale" --root "$root" --plan --json >"$dir/plan.json" 2>/dev/null
+    python3 - "$dir/plan.json" "$refused_group" <<'PY' || planned_refused=1
+import json, sys
+plan = json.load(open(sys.argv[1]))
+def groups(node):
+    if isinstance(node, dict):
+        if "oldPath" in node and "identifier" in node and "destination" in node: yield node["oldPath"]
+        for value in node.values(): yield from groups(value)
+    elif isinstance(node, list):
+        for value in node: yield from groups(value)
+sys.exit(1 if sys.argv[2] in set(groups(plan)) else 0)
+PY
+  fi
   TMPDIR="$dir/tmp" timeout "$limit" "$bin/transvale" --root "$root" --log "$dir/log" --progress never \
     >"$dir/out" 2>&1 </dev/null
   status=$?
   problems=()
+  [[ -n "$planned_refused" ]] && problems+=("the plan measures the refused group container $refused_group")
   if ((status == 124)); then problems+=("hang"); hangs=$((hangs + 1)); fi
   ((status > 128 && status != 124)) && problems+=("crashed with status $status")
   ((status != 124 && status <= 128 && status != expect)) && problems+=("exit $status, expected $expect")
