@@ -207,13 +207,20 @@ std::deque<Dictionary> QSAppMigrator::_introspectItemsToMigrate() {
     uint64_t bytes = 0;
     for (const Dictionary& info : workList) {
       if (const std::string* container = QSStringForKey(info, kQSContainerPathKey)) {
-        bytes += _measureUserData(URL::fileURL(*container, true)).bytes;
+        const URL containerURL = URL::fileURL(*container, true);
+        const platform::PlanSize size = _measureUserData(containerURL);
+        _measuredInIntrospection[containerURL.path()] = size;
+        bytes += size.bytes;
       }
     }
     if (_groupContainerMap) {
       for (const auto& [group, entry] : *_groupContainerMap) {
         const Value* path = entry.get(kQSGroupContainerPathKey);
-        if (path && path->isString()) bytes += _measureItem(URL::fileURL(*path->asString(), true)).bytes;
+        if (!path || !path->isString()) continue;
+        const URL groupURL = URL::fileURL(*path->asString(), true);
+        const platform::PlanSize size = _measureItem(groupURL);
+        _measuredInIntrospection[groupURL.path()] = size;
+        bytes += size.bytes;
       }
     }
     services_.observer->migrationPlanned(workList.size(), bytes);
