@@ -69,7 +69,11 @@ bool QSAppMigrator::_migrateContainerWithInfo(const Dictionary& info) {
   if (!dataContainer) return false;
   QSAM_LOG(kQSLogLevelNotice, kFunction, "QSAppMigrator: Moving data from container %@ to %@", in->container.path(),
            dataContainer->path());
-  const platform::PlanSize data = services_.observer ? _measureUserData(in->container) : platform::PlanSize{};
+  platform::PlanSize data;
+  if (services_.observer) {
+    const std::optional<platform::PlanSize> measured = _takeMeasured(in->container);
+    data = measured ? *measured : _measureUserData(in->container);
+  }
   if (!_migrateDataContainerForIdentifier(in->identifier, in->container, *dataContainer)) return false;
   if (services_.observer) services_.observer->itemsMoved(data.files, data.bytes);
 

@@ -207,14 +207,19 @@ std::deque<Dictionary> QSAppMigrator::_introspectItemsToMigrate() {
     uint64_t bytes = 0;
     for (const Dictionary& info : workList) {
       if (const std::string* container = QSStringForKey(info, kQSContainerPathKey)) {
-        bytes += _measureUserData(URL::fileURL(*container, true)).bytes;
+        const URL containerURL = URL::fileURL(*container, true);
+        const platform::PlanSize size = _measureUserData(containerURL);
+        _measuredInIntrospection[containerURL.path()] = size;
+        bytes += size.bytes;
       }
     }
     if (_groupContainerMap) {
       for (const auto& [group, entry] : *_groupContainerMap) {
-        if (const std::optional<URL> oldContainer = _movableOldGroupContainer(group)) {
-          bytes += _measureItem(*oldContainer).bytes;
-        }
+        const std::optional<URL> oldContainer = _movableOldGroupContainer(group);
+        if (!oldContainer) continue;
+        const platform::PlanSize size = _measureItem(*oldContainer);
+        _measuredInIntrospection[oldContainer->path()] = size;
+        bytes += size.bytes;
       }
     }
     services_.observer->migrationPlanned(workList.size(), bytes);

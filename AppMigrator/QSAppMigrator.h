@@ -209,6 +209,9 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   void _reportEntry(platform::EntryOutcome outcome, const std::string& reason);
   platform::PlanSize _measureUserData(const platform::URL& container);
   static platform::PlanSize _measureItem(const platform::URL& item);
+  // What introspection measured at `url` (a container's user data or an old
+  // group container), handed out once; none when it measured nothing there.
+  std::optional<platform::PlanSize> _takeMeasured(const platform::URL& url);
   // The old group containers that `identifier`'s record names and the map
   // still holds, with their sizes.
   std::map<std::string, platform::PlanSize> _measureGroupsForIdentifier(const std::string& identifier);
@@ -258,6 +261,9 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   // new containers.
   std::set<std::string> _identifiersMigratedInRun;
   std::set<std::string> _itemsMovedInRun;
+  // Sizes introspection measured for the observer, by path, until the step
+  // that moves the items reports them: each tree is walked once per run.
+  std::map<std::string, platform::PlanSize> _measuredInIntrospection;
 };
 
 // Names and keys of the migrator's files and dictionaries.

@@ -42,10 +42,13 @@ bool QSAppMigrator::_destinationHasRoomForItems(const std::vector<URL>& items, c
   const uint64_t blockSize = target.blockSize ? target.blockSize : 1;
   uint64_t needed = 0;
   for (const URL& item : items) {
-    QSFileSystemSpace source;
-    if (fm.itemDoesNotExistAtURL(item)) continue;
-    if (!fm.fileSystemSpaceForURL(item, &source, &error)) return false;
-    if (source.device == target.device) continue;  // renamed in place: takes no new room
+    std::optional<uint64_t> device;
+    if (!fm.deviceOfItemAtURL(item, &device, &error)) {
+      QSAM_LOG(kQSLogLevelError, kFunction, "QSAppMigrator: Cannot measure %@ for %@ : %@", item.path(), identifier,
+               error);
+      return false;
+    }
+    if (!device || *device == target.device) continue;  // missing, or renamed in place: takes no new room
     uint64_t fileBlocks = 0;
     QSItemSize size;
     const bool walked = fm._traverseDirectory(item, &error, [&](const QSTraversalEntry& entry, Error*) {
@@ -129,11 +132,20 @@ std::map<std::string, platform::PlanSize> QSAppMigrator::_measureGroupsForIdenti
   const std::optional<platform::BundleRecord> record = services_.registry->recordForIdentifier(identifier);
   if (!record || !record->groupContainerURLs) return sizes;
   for (const auto& [group, newContainer] : *record->groupContainerURLs) {
-    if (const std::optional<URL> oldContainer = _movableOldGroupContainer(group)) {
-      sizes[group] = _measureItem(*oldContainer);
-    }
+    const std::optional<URL> oldContainer = _movableOldGroupContainer(group);
+    if (!oldContainer) continue;
+    const std::optional<platform::PlanSize> measured = _takeMeasured(*oldContainer);
+    sizes[group] = measured ? *measured : _measureItem(*oldContainer);
   }
   return sizes;
+}
+
+std::optional<platform::PlanSize> QSAppMigrator::_takeMeasured(const URL& url) {
+  const auto found = _measuredInIntrospection.find(url.path());
+  if (found == _measuredInIntrospection.end()) return std::nullopt;
+  const platform::PlanSize size = found->second;
+  _measuredInIntrospection.erase(found);
+  return size;
 }
 
 void QSAppMigrator::_reportEntry(platform::EntryOutcome outcome, const std::string& reason) {

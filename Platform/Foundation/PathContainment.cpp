@@ -1,12 +1,16 @@
 #include "Platform/Foundation/PathContainment.h"
 
+#include <fcntl.h>
 #include <limits.h>
 #include <stdlib.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <cstdio>
 #include <vector>
 
 #include "Platform/Foundation/URL.h"
+#include "Platform/PosixHandles.h"
 
 namespace platform::path {
 
@@ -35,7 +39,29 @@ std::string joined(const std::vector<std::string>& parts, size_t count) {
   return out.empty() ? std::string(kRoot) : out;
 }
 
+constexpr char kDescriptorLinkFormat[] = "/proc/self/fd/%d";
+constexpr std::string_view kDeletedSuffix = " (deleted)";
+
+// The kernel's own name for an open descriptor's file: one lookup of the
+// whole path, where realpath(3) reads each leading part as a possible link
+// (a path of n parts costs n lookups of 1..n parts each).
+std::optional<std::string> kernelPath(int fd) {
+  char link[sizeof(kDescriptorLinkFormat) + 16];
+  std::snprintf(link, sizeof link, kDescriptorLinkFormat, fd);
+  char resolved[PATH_MAX];
+  const ssize_t length = ::readlink(link, resolved, sizeof resolved);
+  if (length <= 0 || static_cast<size_t>(length) >= sizeof resolved || resolved[0] != '/') return std::nullopt;
+  std::string out(resolved, static_cast<size_t>(length));
+  // A file removed meanwhile is named with a suffix that is not in any path.
+  if (out.ends_with(kDeletedSuffix)) return std::nullopt;
+  return out;
+}
+
 std::optional<std::string> realPath(const std::string& path) {
+  const ScopedFD fd(::open(path.c_str(), O_PATH | O_CLOEXEC));
+  if (!fd.valid()) return std::nullopt;  // missing, a dangling or looping link: as realpath(3)
+  if (std::optional<std::string> named = kernelPath(fd.get())) return named;
+  // No /proc, or a name that cannot be told apart: the C library's walk.
   char resolved[PATH_MAX] = {};
   if (!::realpath(path.c_str(), resolved)) return std::nullopt;
   return std::string(resolved);
@@ -61,17 +87,40 @@ std::optional<std::string> resolvedAsFarAsExists(std::string_view path) {
   return std::nullopt;
 }
 
-Placement placementOf(std::string_view candidate, std::string_view base) {
-  const std::optional<std::string> realCandidate = resolvedAsFarAsExists(candidate);
-  const std::optional<std::string> realBase = resolvedAsFarAsExists(base);
-  if (!realCandidate || !realBase) return Placement::Unusable;
-  const std::vector<std::string> c = *names(*realCandidate);
-  const std::vector<std::string> b = *names(*realBase);
+namespace {
+
+// Where resolved names `c` lie against resolved names `b`.
+Placement compareResolved(const std::vector<std::string>& c, const std::vector<std::string>& b) {
   if (c.size() < b.size()) return Placement::Outside;
   for (size_t i = 0; i < b.size(); ++i) {
     if (c[i] != b[i]) return Placement::Outside;
   }
   return c.size() == b.size() ? Placement::Same : Placement::Inside;
+}
+
+std::optional<std::vector<std::string>> resolvedNames(std::string_view path) {
+  const std::optional<std::string> real = resolvedAsFarAsExists(path);
+  if (!real) return std::nullopt;
+  return names(*real);
+}
+
+}  // namespace
+
+Placement placementOf(std::string_view candidate, std::string_view base) {
+  const std::optional<std::vector<std::string>> c = resolvedNames(candidate);
+  const std::optional<std::vector<std::string>> b = resolvedNames(base);
+  if (!c || !b) return Placement::Unusable;
+  return compareResolved(*c, *b);
+}
+
+bool liesInsideAny(std::string_view candidate, std::initializer_list<std::string_view> bases) {
+  const std::optional<std::vector<std::string>> c = resolvedNames(candidate);
+  if (!c) return false;
+  for (std::string_view base : bases) {
+    const std::optional<std::vector<std::string>> b = resolvedNames(base);
+    if (b && compareResolved(*c, *b) == Placement::Inside) return true;
+  }
+  return false;
 }
 
 bool liesInside(std::string_view candidate, std::string_view base) {

@@ -16,6 +16,7 @@
 // Thread safety: pure functions of the file system's state.
 #pragma once
 
+#include <initializer_list>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -35,6 +36,9 @@ Placement placementOf(std::string_view candidate, std::string_view base);
 bool liesInside(std::string_view candidate, std::string_view base);
 // Inside or Same.
 bool liesInsideOrAt(std::string_view candidate, std::string_view base);
+// liesInside(candidate, base) for at least one of `bases`; the candidate is
+// resolved once.
+bool liesInsideAny(std::string_view candidate, std::initializer_list<std::string_view> bases);
 
 // The path with every existing leading part resolved (realpath) and the
 // missing rest appended; "." and empty components dropped. None when the path

@@ -28,18 +28,15 @@ Error outside(const std::string& message) {
   return registryError(kRegistryErrorOutsideAreas, message + "; refused and left for a person");
 }
 
-bool insideAny(const std::string& path, std::initializer_list<const std::string*> areas) {
-  for (const std::string* area : areas) {
-    if (path::liesInside(path, *area)) return true;
-  }
-  return false;
+bool insideAny(const std::string& path, std::initializer_list<std::string_view> areas) {
+  return path::liesInsideAny(path, areas);
 }
 
 // A directory the caller handed in as a package: inside the root, outside the
 // registry's own places, holding a "Payload" directory.
 bool isPackageDirectory(const RegistryLayout& layout, const std::string& path) {
   return path::liesInside(path, layout.systemRoot) &&
-         !insideAny(path, {&layout.databaseDirectory, &layout.systemApplications}) &&
+         !insideAny(path, {layout.databaseDirectory, layout.systemApplications}) &&
          isDirectoryNoFollow(path) && isDirectoryNoFollow(path::join(path, kPayloadDirectoryName));
 }
 
@@ -52,8 +49,8 @@ bool checkContainerPath(const std::string& path, const std::string& area, const 
 
 bool checkPackagePath(const RegistryLayout& layout, const std::string& package, Error* error) {
   if (path::liesInside(package, layout.systemRoot) &&
-      !insideAny(package, {&layout.databaseDirectory, &layout.systemApplications, &layout.bundleContainers,
-                           &layout.applicationDataContainers, &layout.pluginDataContainers, &layout.groupContainers})) {
+      !insideAny(package, {layout.databaseDirectory, layout.systemApplications, layout.bundleContainers,
+                           layout.applicationDataContainers, layout.pluginDataContainers, layout.groupContainers})) {
     return true;
   }
   return failWith(error, outside(Format("The package %s does not lie in the system root %s, outside the registry's "
@@ -63,8 +60,8 @@ bool checkPackagePath(const RegistryLayout& layout, const std::string& package, 
 
 bool checkJournalEntry(const RegistryLayout& layout, const JournalEntry& entry, Error* error) {
   auto inContainerArea = [&](const std::string& path) {
-    return insideAny(path, {&layout.bundleContainers, &layout.applicationDataContainers, &layout.pluginDataContainers,
-                            &layout.groupContainers});
+    return insideAny(path, {layout.bundleContainers, layout.applicationDataContainers, layout.pluginDataContainers,
+                            layout.groupContainers});
   };
   bool fine = false;
   switch (entry.kind) {
@@ -74,7 +71,7 @@ bool checkJournalEntry(const RegistryLayout& layout, const JournalEntry& entry, 
     case JournalKind::Move:
       fine = path::liesInside(entry.destination, layout.bundleContainers) &&
              path::liesInside(entry.source, layout.systemRoot) &&
-             !insideAny(entry.source, {&layout.databaseDirectory, &layout.systemApplications});
+             !insideAny(entry.source, {layout.databaseDirectory, layout.systemApplications});
       break;
     case JournalKind::Remove:
       fine = inContainerArea(entry.destination) || isPackageDirectory(layout, entry.destination);

@@ -14,6 +14,7 @@ using platform::URL;
 namespace {
 constexpr char kSizeFn[] = "-[QSFileManager sizeOfItemAtURL:size:error:]";
 constexpr char kSpaceFn[] = "-[QSFileManager fileSystemSpaceForURL:space:error:]";
+constexpr char kDeviceFn[] = "-[QSFileManager deviceOfItemAtURL:device:error:]";
 }  // namespace
 
 bool QSFileManager::sizeOfItemAtURL(const URL& url, QSItemSize* size, Error* error) const {
@@ -46,6 +47,20 @@ bool QSFileManager::sizeOfItemAtURL(const URL& url, QSItemSize* size, Error* err
   if (!walked) return false;
   *size = counted;
   return true;
+}
+
+bool QSFileManager::deviceOfItemAtURL(const URL& url, std::optional<uint64_t>* device, Error* error) const {
+  struct stat status;
+  if (::lstat(url.fileSystemRepresentation(), &status) == 0) {
+    *device = static_cast<uint64_t>(status.st_dev);
+    return true;
+  }
+  const int err = errno;
+  if (err == ENOENT) {
+    device->reset();
+    return true;
+  }
+  return QSFail(error, QSPOSIXError(kDeviceFn, __LINE__, err, "lstat of %s failed: %s", url.path(), QSErrorText(err)));
 }
 
 bool QSFileManager::fileSystemSpaceForURL(const URL& url, QSFileSystemSpace* space, Error* error) const {

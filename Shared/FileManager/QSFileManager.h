@@ -212,6 +212,10 @@ class QSFileManager {
   // does not exist yet, with its free room.
   bool fileSystemSpaceForURL(const platform::URL& url, QSFileSystemSpace* space,
                              platform::Error* error = nullptr) const;
+  // The device `url` itself lies on (links not followed): true with none when
+  // nothing is there, false with `error` when its status cannot be read.
+  bool deviceOfItemAtURL(const platform::URL& url, std::optional<uint64_t>* device,
+                         platform::Error* error = nullptr) const;
 
   // --- Path containment ---------------------------------------------------------
   // The real path of `url` when it lies inside `ifChildOfURL` (links resolved,
