@@ -215,6 +215,7 @@ std::unique_ptr<Database> Database::openReadOnly(const std::string& path, Error*
 }
 
 Database::~Database() {
+  for (auto& [text, stmt] : kept_) sqlite3_finalize(stmt);
   sqlite3_close_v2(handle_);
   if (!privateCopy_.empty()) {
     std::error_code ec;
@@ -223,12 +224,18 @@ Database::~Database() {
 }
 
 bool Database::execute(const char* sql, Error* error) {
-  char* message = nullptr;
-  int rc = sqlite3_exec(handle_, sql, nullptr, nullptr, &message);
-  if (rc == SQLITE_OK) return true;
-  if (error) *error = sqliteFailure(path_, Format("run \"%s\"", sql), rc, message);
-  sqlite3_free(message);
-  return false;
+  const char* next = sql;
+  while (*next) {
+    const char* tail = nullptr;
+    sqlite3_stmt* stmt = compiled(next, &tail, error);
+    if (!stmt) {
+      if (tail == nullptr) return false;  // it did not compile
+      break;                              // only white space or comments were left
+    }
+    next = tail;
+    if (!Statement(this, stmt).run(error)) return false;
+  }
+  return true;
 }
 
 // A checkpoint flushes the log before it copies it into the database, which
@@ -247,14 +254,44 @@ bool Database::setCommitDurability(CommitDurability durability, Error* error) {
 }
 
 std::optional<Statement> Database::prepare(const char* sql, Error* error) {
-  sqlite3_stmt* stmt = nullptr;
-  int rc = sqlite3_prepare_v2(handle_, sql, -1, &stmt, nullptr);
-  if (rc != SQLITE_OK) {
-    if (error) *error = failure(Format("prepare \"%s\"", sql));
-    sqlite3_finalize(stmt);
+  const char* tail = nullptr;
+  sqlite3_stmt* stmt = compiled(sql, &tail, error);
+  if (!stmt) {
+    if (tail != nullptr && error) *error = sqliteFailure(path_, Format("prepare \"%s\"", sql), SQLITE_MISUSE, "no statement");
     return std::nullopt;
   }
   return Statement(this, stmt);
+}
+
+sqlite3_stmt* Database::compiled(std::string_view sql, const char** tail, Error* error) {
+  // A kept statement's text runs to its closing ';' (or to the end of the
+  // text), so it is found by the text's first statement up to there; a ';'
+  // inside a literal only costs a fresh compilation.
+  const size_t end = sql.find(';');
+  const auto found = kept_.find(std::string(end == std::string_view::npos ? sql : sql.substr(0, end + 1)));
+  if (found != kept_.end()) {
+    sqlite3_stmt* stmt = found->second;
+    *tail = sql.data() + found->first.size();
+    kept_.erase(found);
+    return stmt;
+  }
+  sqlite3_stmt* stmt = nullptr;
+  const int rc = sqlite3_prepare_v2(handle_, sql.data(), static_cast<int>(sql.size()), &stmt, tail);
+  if (rc != SQLITE_OK) {
+    if (error) *error = failure(Format("prepare \"%s\"", std::string(sql)));
+    sqlite3_finalize(stmt);
+    *tail = nullptr;
+    return nullptr;
+  }
+  return stmt;
+}
+
+void Database::keep(sqlite3_stmt* stmt) {
+  sqlite3_reset(stmt);
+  sqlite3_clear_bindings(stmt);
+  // A second statement of the same text (one that ran while the first was
+  // still stepping) is not kept.
+  if (!kept_.emplace(sqlite3_sql(stmt), stmt).second) sqlite3_finalize(stmt);
 }
 
 Error Database::failure(const std::string& what) const {
@@ -262,7 +299,7 @@ Error Database::failure(const std::string& what) const {
 }
 
 Statement::~Statement() {
-  sqlite3_finalize(stmt_);
+  if (stmt_) db_->keep(stmt_);
 }
 
 Statement& Statement::bind(int index, const std::string& text) {

@@ -16,6 +16,8 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <unordered_map>
 
 #include "Platform/Foundation/Error.h"
 
@@ -63,6 +65,8 @@ class Database {
   [[nodiscard]] bool execute(const char* sql, Error* error);
   // How the following commits reach the disk; Immediate after open().
   [[nodiscard]] bool setCommitDurability(CommitDurability durability, Error* error);
+  // A statement is compiled once per connection: when a Statement ends it is
+  // reset and kept for the next prepare() of the same text.
   std::optional<Statement> prepare(const char* sql, Error* error);
   const std::string& path() const { return path_; }
   // The record for the connection's last failure while `what`.
@@ -74,8 +78,17 @@ class Database {
   // The schema version recorded in the database, or none with
   // kRegistryErrorNewerDatabase when it is newer than this build reads.
   std::optional<int64_t> readableSchemaVersion(Error* error);
+  // The compiled statement for the first statement of `sql`, from the kept
+  // ones or newly compiled; *tail is where the next statement begins. Null
+  // with *error on failure, null without one when `sql` holds no statement.
+  sqlite3_stmt* compiled(std::string_view sql, const char** tail, Error* error);
+  // Takes back a statement whose Statement ended.
+  void keep(sqlite3_stmt* stmt);
   friend class Statement;
   sqlite3* handle_;
+  // Compiled statements not in use, by their text. The texts are the code's
+  // own constants, so this holds a few dozen at most.
+  std::unordered_map<std::string, sqlite3_stmt*> kept_;
   std::string path_;
   std::string privateCopy_;  // directory of the private copy, "" when there is none
   CommitDurability durability_ = CommitDurability::Immediate;
