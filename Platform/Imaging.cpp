@@ -117,7 +117,10 @@ SurfacePtr renderMasked(cairo_surface_t* source, int size) {
   cairo_matrix_init_scale(&matrix, static_cast<double>(cairo_image_surface_get_width(source)) / size,
                           static_cast<double>(cairo_image_surface_get_height(source)) / size);
   cairo_pattern_set_matrix(pattern.get(), &matrix);
-  cairo_pattern_set_filter(pattern.get(), CAIRO_FILTER_BEST);
+  // GOOD averages over the source pixels a target pixel covers when it
+  // shrinks (no aliasing) and interpolates when it enlarges; BEST's wider
+  // kernel costs three to four times as much for no visible gain at this size.
+  cairo_pattern_set_filter(pattern.get(), CAIRO_FILTER_GOOD);
   // Padding keeps the edge pixels from blending with transparent black.
   cairo_pattern_set_extend(pattern.get(), CAIRO_EXTEND_PAD);
 
