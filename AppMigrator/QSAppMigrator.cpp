@@ -90,6 +90,7 @@ void QSAppMigrator::_loadInstallMap() {
     return;
   }
   _installMap = std::move(*installMap);
+  _resolvedPathsInRun.clear();
   const Value* groups = QSValueForKey(*_installMap, kQSInstallMapGroupContainersKey);
   if (groups && groups->isDictionary()) {
     _groupContainerMap = *groups->asDictionary();

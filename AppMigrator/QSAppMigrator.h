@@ -167,6 +167,8 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   // log line), or none when it may move. Everything that measures or moves an
   // old group container asks first: a map entry may name any directory.
   const char* _groupContainerRefusal(const platform::URL& oldContainer, const std::string& group) const;
+  // A system directory or a path of the install map, resolved once per run.
+  const std::optional<std::string>& _resolvedInRun(const platform::URL& url) const;
   // `group`'s old container as the map names it, when it may move.
   std::optional<platform::URL> _movableOldGroupContainer(const std::string& group) const;
   // True the first time an identifier is claimed in this run; false, with a
@@ -264,6 +266,14 @@ class QSAppMigrator final : public platform::DataClassMigrator {
   // Sizes introspection measured for the observer, by path, until the step
   // that moves the items reports them: each tree is walked once per run.
   std::map<std::string, platform::PlanSize> _measuredInIntrospection;
+  // The system's directories and the install map's group paths resolved, by
+  // path: every group container is held against all of them, so resolving
+  // them anew each time would cost the square of the number of groups. While
+  // the run lasts nothing else changes the device, and the run itself only
+  // moves items out of old containers and into new ones: a path whose
+  // resolution passed through such an item lies in an area the check refuses
+  // anyway.
+  mutable std::map<std::string, std::optional<std::string>> _resolvedPathsInRun;
 };
 
 // Names and keys of the migrator's files and dictionaries.

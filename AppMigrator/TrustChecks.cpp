@@ -67,16 +67,26 @@ bool QSAppMigrator::_groupContainerPathIsAcceptable(const URL& oldContainer, con
   return false;
 }
 
+const std::optional<std::string>& QSAppMigrator::_resolvedInRun(const URL& url) const {
+  auto found = _resolvedPathsInRun.find(url.path());
+  if (found == _resolvedPathsInRun.end()) {
+    found = _resolvedPathsInRun.emplace(url.path(), QSFileManager::defaultManager().resolvedPathOfURL(url)).first;
+  }
+  return found->second;
+}
+
 const char* QSAppMigrator::_groupContainerRefusal(const URL& oldContainer, const std::string& group) const {
   QSGlobalConfiguration& configuration = QSGlobalConfiguration::sharedInstance();
   const QSFileManager& fm = QSFileManager::defaultManager();
   auto refuse = [](const char* reason) { return reason; };
-  if (!fm.urlLiesInsideURL(oldContainer, configuration.rootPath())) {
+  // The container itself is resolved as it is now: it is what will be moved.
+  const std::optional<std::string> container = fm.resolvedPathOfURL(oldContainer);
+  if (!fm.resolvedPathLiesInside(container, _resolvedInRun(configuration.rootPath()))) {
     return refuse("the path does not lie inside the system root");
   }
   // Places whose contents belong to others: applications old and new,
   // built-in bundles and the system's own directories, the migrator's own.
-  const std::vector<URL> areas = {
+  const URL areas[] = {
       configuration.oldContainerPath(),          configuration.bundleContainersPath(),
       configuration.dataContainersPath(),        configuration.systemAppsDirectory(),
       configuration.internalAppsDirectory(),     configuration.developerAppsDirectory(),
@@ -85,17 +95,21 @@ const char* QSAppMigrator::_groupContainerRefusal(const URL& oldContainer, const
       configuration.oldInstallMapPath().deletingLastPathComponent(),
   };
   for (const URL& area : areas) {
-    if (fm.urlLiesInsideURL(oldContainer, area, true)) {
+    const std::optional<std::string>& resolvedArea = _resolvedInRun(area);
+    if (fm.resolvedPathLiesInside(container, resolvedArea, true)) {
       return refuse("the path lies inside an application's container, a built-in bundle or a system directory");
     }
     // The root, /private/var and the like: emptying them would take the
     // layout with them.
-    if (fm.urlLiesInsideURL(area, oldContainer)) return refuse("the path holds directories of the system's layout");
+    if (fm.resolvedPathLiesInside(resolvedArea, container)) {
+      return refuse("the path holds directories of the system's layout");
+    }
   }
   if (!_groupContainerMap) return nullptr;
   for (const auto& [other, entry] : *_groupContainerMap) {
     const platform::Value* path = other == group ? nullptr : entry.get(kQSGroupContainerPathKey);
-    if (path && path->isString() && fm.urlLiesInsideURL(URL::fileURL(*path->asString(), true), oldContainer)) {
+    if (path && path->isString() &&
+        fm.resolvedPathLiesInside(_resolvedInRun(URL::fileURL(*path->asString(), true)), container)) {
       return refuse("the path holds another group's container");
     }
   }

@@ -113,6 +113,13 @@ Placement placementOf(std::string_view candidate, std::string_view base) {
   return compareResolved(*c, *b);
 }
 
+Placement placementOfResolved(const std::optional<std::string>& candidate, const std::optional<std::string>& base) {
+  const std::optional<std::vector<std::string>> c = candidate ? names(*candidate) : std::nullopt;
+  const std::optional<std::vector<std::string>> b = base ? names(*base) : std::nullopt;
+  if (!c || !b) return Placement::Unusable;
+  return compareResolved(*c, *b);
+}
+
 bool liesInsideAny(std::string_view candidate, std::initializer_list<std::string_view> bases) {
   const std::optional<std::vector<std::string>> c = resolvedNames(candidate);
   if (!c) return false;

@@ -40,6 +40,11 @@ bool liesInsideOrAt(std::string_view candidate, std::string_view base);
 // resolved once.
 bool liesInsideAny(std::string_view candidate, std::initializer_list<std::string_view> bases);
 
+// placementOf() for paths that resolvedAsFarAsExists() gave, for a caller
+// that holds a path against many and resolves each once. Unusable when either
+// is none.
+Placement placementOfResolved(const std::optional<std::string>& candidate, const std::optional<std::string>& base);
+
 // The path with every existing leading part resolved (realpath) and the
 // missing rest appended; "." and empty components dropped. None when the path
 // is unusable as above.

@@ -182,6 +182,16 @@ bool QSFileManager::urlLiesInsideURL(const URL& url, const URL& base, bool orIsB
                   : platform::path::liesInside(url.path(), base.path());
 }
 
+std::optional<std::string> QSFileManager::resolvedPathOfURL(const URL& url) const {
+  return platform::path::resolvedAsFarAsExists(url.path());
+}
+
+bool QSFileManager::resolvedPathLiesInside(const std::optional<std::string>& path,
+                                           const std::optional<std::string>& base, bool orIsBase) const {
+  const platform::path::Placement placement = platform::path::placementOfResolved(path, base);
+  return placement == platform::path::Placement::Inside || (orIsBase && placement == platform::path::Placement::Same);
+}
+
 std::optional<URL> QSFileManager::_realPathForURL(const URL& url, bool allowNonExistentPathComponents) const {
   // glibc's realpath writes up to PATH_MAX bytes into the buffer it is given,
   // so the buffer must be that large; it is zeroed so that what the resolver

@@ -230,6 +230,12 @@ class QSFileManager {
   // paths with a ".." component are refused. Nothing is logged: the caller
   // says what the path was for.
   [[nodiscard]] bool urlLiesInsideURL(const platform::URL& url, const platform::URL& base, bool orIsBase = false) const;
+  // The two halves of urlLiesInsideURL, for a caller that holds one path
+  // against many: the path resolved as it does (none when unusable), and the
+  // comparison of two such paths (false when either is none).
+  [[nodiscard]] std::optional<std::string> resolvedPathOfURL(const platform::URL& url) const;
+  [[nodiscard]] bool resolvedPathLiesInside(const std::optional<std::string>& path,
+                                            const std::optional<std::string>& base, bool orIsBase = false) const;
   // A null path pointer stands for a missing path.
   [[nodiscard]] bool _validateSymlink(const std::string* path, uint32_t withStartingDepth, uint32_t* andEndingDepth) const;
 
