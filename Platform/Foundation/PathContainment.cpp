@@ -120,14 +120,20 @@ Placement placementOfResolved(const std::optional<std::string>& candidate, const
   return compareResolved(*c, *b);
 }
 
-bool liesInsideAny(std::string_view candidate, std::initializer_list<std::string_view> bases) {
-  const std::optional<std::vector<std::string>> c = resolvedNames(candidate);
-  if (!c) return false;
-  for (std::string_view base : bases) {
-    const std::optional<std::vector<std::string>> b = resolvedNames(base);
-    if (b && compareResolved(*c, *b) == Placement::Inside) return true;
-  }
-  return false;
+const std::optional<std::string>& ResolvedDirectories::operator()(const std::string& directory) {
+  std::lock_guard lock(mutex_);
+  auto found = resolved_.find(directory);
+  if (found == resolved_.end()) found = resolved_.emplace(directory, resolvedAsFarAsExists(directory)).first;
+  return found->second;
+}
+
+bool ResolvedDirectories::holdsInside(std::string_view candidate, const std::string& directory) {
+  return placementOfResolved(resolvedAsFarAsExists(candidate), (*this)(directory)) == Placement::Inside;
+}
+
+void ResolvedDirectories::clear() {
+  std::lock_guard lock(mutex_);
+  resolved_.clear();
 }
 
 bool liesInside(std::string_view candidate, std::string_view base) {

@@ -13,10 +13,12 @@
 // directory for a link meanwhile (the places checked here are written by the
 // system, or by nobody during a run).
 //
-// Thread safety: pure functions of the file system's state.
+// Thread safety: pure functions of the file system's state, except
+// ResolvedDirectories, which locks its own cache.
 #pragma once
 
-#include <initializer_list>
+#include <map>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -36,14 +38,28 @@ Placement placementOf(std::string_view candidate, std::string_view base);
 bool liesInside(std::string_view candidate, std::string_view base);
 // Inside or Same.
 bool liesInsideOrAt(std::string_view candidate, std::string_view base);
-// liesInside(candidate, base) for at least one of `bases`; the candidate is
-// resolved once.
-bool liesInsideAny(std::string_view candidate, std::initializer_list<std::string_view> bases);
 
 // placementOf() for paths that resolvedAsFarAsExists() gave, for a caller
 // that holds a path against many and resolves each once. Unusable when either
 // is none.
 Placement placementOfResolved(const std::optional<std::string>& candidate, const std::optional<std::string>& base);
+
+// Directories resolved once, on first use, and kept: for a caller that holds
+// many paths against the same few directories, which only it changes, and
+// only by making them (a directory made where a path did not exist yet
+// resolves to the same name). Each path is resolved by resolvedAsFarAsExists().
+class ResolvedDirectories {
+ public:
+  // The kept resolution of `directory`; the reference stays valid until clear().
+  const std::optional<std::string>& operator()(const std::string& directory);
+  // Whether `candidate`, resolved now, lies strictly inside `directory`.
+  bool holdsInside(std::string_view candidate, const std::string& directory);
+  void clear();
+
+ private:
+  std::mutex mutex_;
+  std::map<std::string, std::optional<std::string>> resolved_;
+};
 
 // The path with every existing leading part resolved (realpath) and the
 // missing rest appended; "." and empty components dropped. None when the path

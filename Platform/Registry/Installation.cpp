@@ -166,7 +166,7 @@ bool Installation::addBundle(const std::string& source, BundleInfo info, const c
   plan.bundlePath = path::join(plan.container, lastComponent(source));
   planCreation(plan.container);
   if (existing) {
-    if (!checkContainerPath(existing->bundleContainer, state_.layout.bundleContainers, "bundle container", error)) {
+    if (!checkContainerPath(state_.layout, existing->bundleContainer, state_.layout.bundleContainers, "bundle container", error)) {
       return false;
     }
     plan.replacedContainer = existing->bundleContainer;
@@ -189,8 +189,8 @@ bool Installation::planDataContainer(BundlePlan* plan, const std::optional<Store
   if (kept) {
     // An identifier may have changed kind between installations: either data
     // area is the registry's own.
-    if (!path::liesInside(*kept, state_.layout.pluginDataContainers) &&
-        !checkContainerPath(*kept, state_.layout.applicationDataContainers, "data container", error)) {
+    if (!liesInArea(state_.layout, *kept, state_.layout.pluginDataContainers) &&
+        !checkContainerPath(state_.layout, *kept, state_.layout.applicationDataContainers, "data container", error)) {
       return false;
     }
     plan->dataContainer = *kept;
@@ -218,7 +218,7 @@ bool Installation::planGroups(BundlePlan* plan, Error* error) {
       path = newContainerPath(state_.layout.groupContainers, error);
       if (!path) return false;
       newGroups_[group] = *path;
-    } else if (!checkContainerPath(*path, state_.layout.groupContainers, "group container", error)) {
+    } else if (!checkContainerPath(state_.layout, *path, state_.layout.groupContainers, "group container", error)) {
       return false;
     }
     if (!isDirectory(*path)) planCreation(*path);

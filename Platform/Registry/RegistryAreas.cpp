@@ -28,29 +28,39 @@ Error outside(const std::string& message) {
   return registryError(kRegistryErrorOutsideAreas, message + "; refused and left for a person");
 }
 
-bool insideAny(const std::string& path, std::initializer_list<std::string_view> areas) {
-  return path::liesInsideAny(path, areas);
+bool insideAny(const RegistryLayout& layout, const std::string& path, std::initializer_list<const std::string*> areas) {
+  const std::optional<std::string> resolved = path::resolvedAsFarAsExists(path);
+  for (const std::string* area : areas) {
+    if (path::placementOfResolved(resolved, (*layout.resolved)(*area)) == path::Placement::Inside) return true;
+  }
+  return false;
 }
 
 // A directory the caller handed in as a package: inside the root, outside the
 // registry's own places, holding a "Payload" directory.
 bool isPackageDirectory(const RegistryLayout& layout, const std::string& path) {
-  return path::liesInside(path, layout.systemRoot) &&
-         !insideAny(path, {layout.databaseDirectory, layout.systemApplications}) &&
+  return liesInArea(layout, path, layout.systemRoot) &&
+         !insideAny(layout, path, {&layout.databaseDirectory, &layout.systemApplications}) &&
          isDirectoryNoFollow(path) && isDirectoryNoFollow(path::join(path, kPayloadDirectoryName));
 }
 
 }  // namespace
 
-bool checkContainerPath(const std::string& path, const std::string& area, const char* what, Error* error) {
-  if (path::liesInside(path, area)) return true;
+bool liesInArea(const RegistryLayout& layout, const std::string& path, const std::string& area) {
+  return layout.resolved->holdsInside(path, area);
+}
+
+bool checkContainerPath(const RegistryLayout& layout, const std::string& path, const std::string& area,
+                        const char* what, Error* error) {
+  if (liesInArea(layout, path, area)) return true;
   return failWith(error, outside(Format("The recorded %s %s does not lie inside %s", what, path, area)));
 }
 
 bool checkPackagePath(const RegistryLayout& layout, const std::string& package, Error* error) {
-  if (path::liesInside(package, layout.systemRoot) &&
-      !insideAny(package, {layout.databaseDirectory, layout.systemApplications, layout.bundleContainers,
-                           layout.applicationDataContainers, layout.pluginDataContainers, layout.groupContainers})) {
+  if (liesInArea(layout, package, layout.systemRoot) &&
+      !insideAny(layout, package,
+                 {&layout.databaseDirectory, &layout.systemApplications, &layout.bundleContainers,
+                  &layout.applicationDataContainers, &layout.pluginDataContainers, &layout.groupContainers})) {
     return true;
   }
   return failWith(error, outside(Format("The package %s does not lie in the system root %s, outside the registry's "
@@ -60,8 +70,9 @@ bool checkPackagePath(const RegistryLayout& layout, const std::string& package, 
 
 bool checkJournalEntry(const RegistryLayout& layout, const JournalEntry& entry, Error* error) {
   auto inContainerArea = [&](const std::string& path) {
-    return insideAny(path, {layout.bundleContainers, layout.applicationDataContainers, layout.pluginDataContainers,
-                            layout.groupContainers});
+    return insideAny(layout, path,
+                     {&layout.bundleContainers, &layout.applicationDataContainers, &layout.pluginDataContainers,
+                      &layout.groupContainers});
   };
   bool fine = false;
   switch (entry.kind) {
@@ -69,9 +80,9 @@ bool checkJournalEntry(const RegistryLayout& layout, const JournalEntry& entry, 
       fine = inContainerArea(entry.destination);
       break;
     case JournalKind::Move:
-      fine = path::liesInside(entry.destination, layout.bundleContainers) &&
-             path::liesInside(entry.source, layout.systemRoot) &&
-             !insideAny(entry.source, {layout.databaseDirectory, layout.systemApplications});
+      fine = liesInArea(layout, entry.destination, layout.bundleContainers) &&
+             liesInArea(layout, entry.source, layout.systemRoot) &&
+             !insideAny(layout, entry.source, {&layout.databaseDirectory, &layout.systemApplications});
       break;
     case JournalKind::Remove:
       fine = inContainerArea(entry.destination) || isPackageDirectory(layout, entry.destination);

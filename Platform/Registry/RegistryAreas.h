@@ -15,10 +15,15 @@
 
 namespace platform::registry {
 
+// Whether `path` lies strictly inside `area`, one of the layout's directories
+// (resolved once for the layout's life: the registry alone makes them).
+bool liesInArea(const RegistryLayout& layout, const std::string& path, const std::string& area);
+
 // A container the registry made: strictly inside `area` (one of the layout's
 // container directories). Otherwise false with kRegistryErrorOutsideAreas
 // naming `what` and the path.
-bool checkContainerPath(const std::string& path, const std::string& area, const char* what, Error* error);
+bool checkContainerPath(const RegistryLayout& layout, const std::string& path, const std::string& area,
+                        const char* what, Error* error);
 
 // A package the registry may install from (and so journal moves out of and
 // remove): inside the system root, outside the database directory, the

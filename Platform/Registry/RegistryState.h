@@ -14,6 +14,7 @@
 #include <mutex>
 #include <string>
 
+#include "Platform/Foundation/PathContainment.h"
 #include "Platform/Registry/BuiltInApplications.h"
 #include "Platform/Registry/RegistryDatabase.h"
 #include "Platform/Registry/RegistryTables.h"
@@ -32,6 +33,9 @@ struct RegistryLayout {
   std::string pluginDataContainers;
   std::string groupContainers;
   std::string systemApplications;
+  // The directories above as they resolve, for the checks of where the
+  // registry may act (shared by the copies of a layout).
+  std::shared_ptr<path::ResolvedDirectories> resolved = std::make_shared<path::ResolvedDirectories>();
 };
 
 struct RegistryState {

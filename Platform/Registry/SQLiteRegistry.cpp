@@ -45,7 +45,7 @@ std::optional<std::string> ensureContainer(RegistryState& state, const std::stri
     if (!load(*state.db, &recorded, error)) return std::nullopt;
   }
   if (recorded) {
-    if (!checkContainerPath(*recorded, parent, "container", error) || !makeDirectories(*recorded, error)) {
+    if (!checkContainerPath(state.layout, *recorded, parent, "container", error) || !makeDirectories(*recorded, error)) {
       return std::nullopt;
     }
     return recorded;

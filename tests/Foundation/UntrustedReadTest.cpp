@@ -47,7 +47,24 @@ TEST(PathContainment, JudgesWhereEveryExistingPartLeads) {
       {"", Placement::Unusable},
       {base + "/dangling/x", Placement::Unusable},
   };
-  for (const auto& c : kCases) EXPECT_EQ(path::placementOf(c.candidate, base), c.placement) << c.candidate;
+  path::ResolvedDirectories kept;
+  for (const auto& c : kCases) {
+    EXPECT_EQ(path::placementOf(c.candidate, base), c.placement) << c.candidate;
+    EXPECT_EQ(path::placementOfResolved(path::resolvedAsFarAsExists(c.candidate), kept(base)), c.placement)
+        << c.candidate;
+    EXPECT_EQ(kept.holdsInside(c.candidate, base), c.placement == Placement::Inside) << c.candidate;
+  }
+  // The candidate is resolved at each check, so a link made since is judged
+  // by where it leads now; a kept directory keeps its first resolution, so
+  // one swapped for a link since holds nothing (the check fails closed).
+  const std::string moved = dir / "moved";
+  ASSERT_TRUE(makeDirs(moved) && kept(dir / "later"));
+  ASSERT_EQ(symlink(moved.c_str(), (dir / "later").c_str()), 0);
+  ASSERT_EQ(symlink("../outside", (base + "/inner/new").c_str()), 0);
+  EXPECT_FALSE(kept.holdsInside(base + "/inner/new/file", base));
+  for (const std::string& candidate : {dir / "later/x", moved + "/x"}) {
+    EXPECT_FALSE(kept.holdsInside(candidate, dir / "later")) << candidate;
+  }
 }
 
 }  // namespace
