@@ -149,8 +149,11 @@ Image toStraightRGBA(cairo_surface_t* surface) {
       const uint32_t a = pixel >> 24;
       const uint32_t channels[3] = {(pixel >> 16) & 0xff, (pixel >> 8) & 0xff, pixel & 0xff};
       for (uint32_t c : channels) {
-        // Undo the premultiplication, rounding to nearest.
-        *out++ = a == 0 ? 0 : static_cast<uint8_t>((c * kOpaqueAlpha + a / 2) / a);
+        // Undo the premultiplication, rounding to nearest; most of an icon is
+        // opaque, where there is nothing to undo.
+        *out++ = a == kOpaqueAlpha ? static_cast<uint8_t>(c)
+                 : a == 0          ? 0
+                                   : static_cast<uint8_t>((c * kOpaqueAlpha + a / 2) / a);
       }
       *out++ = static_cast<uint8_t>(a);
     }
