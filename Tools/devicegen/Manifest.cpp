@@ -11,6 +11,11 @@ using platform::Array;
 using platform::Dictionary;
 using platform::Value;
 
+// The manifest lists every item of the image, about 9 KB per application,
+// so it outgrows the property-list reader's default limit (meant for files
+// of unknown origin) at about 3,500 applications. It is devicegen's own
+// file; this limit covers 100,000 applications.
+constexpr size_t kManifestFileSizeLimit = size_t{1} << 30;
 constexpr char kFormatVersionKey[] = "FormatVersion";
 constexpr char kSeedKey[] = "Seed";
 constexpr char kSystemVersionKey[] = "SystemVersion";
@@ -359,7 +364,8 @@ bool writeManifest(const Manifest& manifest, const std::string& path, std::strin
 
 std::optional<Manifest> readManifest(const std::string& path, std::string* why) {
   platform::Error error;
-  std::optional<Value> value = platform::plist::readFile(platform::URL::fileURL(path), &error);
+  std::optional<Value> value = platform::plist::readFile(
+      platform::URL::fileURL(path), platform::plist::ReadOptions{.sizeLimit = kManifestFileSizeLimit}, &error);
   if (!value) {
     if (why) *why = "cannot read the manifest " + path + ": " + error.description();
     return std::nullopt;
