@@ -8,7 +8,7 @@
 #include <cstdint>
 
 #include "Shared/FileManager/DataProtection.h"
-#include "Shared/FileManager/PosixHandles.h"
+#include "Platform/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
@@ -37,8 +37,8 @@ constexpr size_t kInstallTypeSize = sizeof(uint64_t);
 constexpr int kClassOpenFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
 
 // Opens `url` for a class operation; on failure writes the open's record.
-qsfs::ScopedFD openForClass(const URL& url, const char* function, Error* error) {
-  qsfs::ScopedFD fd(open(url.fileSystemRepresentation(), kClassOpenFlags));
+platform::ScopedFD openForClass(const URL& url, const char* function, Error* error) {
+  platform::ScopedFD fd(open(url.fileSystemRepresentation(), kClassOpenFlags));
   if (!fd.valid()) {
     int err = errno;
     QSFail(error, QSPOSIXError(function, __LINE__, err, "Failed to open %s : %s", url.path(), QSErrorText(err)));
@@ -48,7 +48,7 @@ qsfs::ScopedFD openForClass(const URL& url, const char* function, Error* error) 
 
 // Reads the class through `fd`; on failure writes the read's record.
 bool readClass(int fd, const URL& url, const char* function, int32_t* dataProtectionClass, Error* error) {
-  if (int err = qsfs::getDataProtectionClass(fd, dataProtectionClass); err != 0) {
+  if (int err = platform::fs::getDataProtectionClass(fd, dataProtectionClass); err != 0) {
     return QSFail(error, QSPOSIXError(function, __LINE__, err, "Failed to getclass of file %s: %s", url.path(),
                                       QSErrorText(err)));
   }
@@ -67,7 +67,7 @@ Error attributeError(const char* function, int32_t line, int err, const char* fo
 }  // namespace
 
 bool QSFileManager::dataProtectionClassOfItemAtURL(const URL& url, int32_t* dataProtectionClass, Error* error) const {
-  qsfs::ScopedFD fd = openForClass(url, kClassOfItemFn, error);
+  platform::ScopedFD fd = openForClass(url, kClassOfItemFn, error);
   if (!fd.valid()) return false;
   int32_t current = 0;
   if (!readClass(fd.get(), url, kClassOfItemFn, &current, error)) return false;
@@ -78,14 +78,14 @@ bool QSFileManager::dataProtectionClassOfItemAtURL(const URL& url, int32_t* data
 bool QSFileManager::setDataProtectionClassOfItemAtURL(const URL& url, int32_t toClass,
                                                       const QSDataProtectionPredicate& ifPredicate,
                                                       Error* error) const {
-  qsfs::ScopedFD fd = openForClass(url, kSetClassOfItemFn, error);
+  platform::ScopedFD fd = openForClass(url, kSetClassOfItemFn, error);
   if (!fd.valid()) return false;
   if (ifPredicate) {
     int32_t current = 0;
     if (!readClass(fd.get(), url, kSetClassOfItemFn, &current, error)) return false;
     if (!ifPredicate(current)) return true;
   }
-  if (int err = qsfs::setDataProtectionClass(fd.get(), toClass); err != 0) {
+  if (int err = platform::fs::setDataProtectionClass(fd.get(), toClass); err != 0) {
     return QSFail(error, QSPOSIXError(kSetClassOfItemFn, __LINE__, err, "Failed to setclass(%d) on file %s: %s",
                                       toClass, url.path(), QSErrorText(err)));
   }

@@ -15,7 +15,7 @@
 #include "Platform/Foundation/PathContainment.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
-#include "Shared/FileManager/SymlinkText.h"
+#include "Platform/FileTree/SymlinkText.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -76,7 +76,7 @@ enum class LinkCheck { NotALink, AcceptedLink, Rejected };
 // text is relative and never climbs above the base directory.
 LinkCheck checkLink(const QSFileManager& fm, const std::string& suspicious, const std::string& base) {
   std::string linkText;
-  if (int err = qsfs::readSymlinkText(suspicious.c_str(), &linkText); err != 0) {
+  if (int err = platform::fs::readSymlinkText(suspicious.c_str(), &linkText); err != 0) {
     if (err == EINVAL || err == ENOENT) return LinkCheck::NotALink;
     QS_SYSLOG(kQSLogLevelError, kRealPathForURLFn, "Readlink failed: %s", QSErrorText(err));
     return LinkCheck::Rejected;

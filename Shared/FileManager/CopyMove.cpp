@@ -35,8 +35,8 @@
 #include <climits>
 #include <random>
 
-#include "Shared/FileManager/CopyTree.h"
-#include "Shared/FileManager/PosixHandles.h"
+#include "Platform/FileTree/CopyTree.h"
+#include "Platform/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
@@ -53,8 +53,8 @@ constexpr char kFinishGroupFn[] = "-[QSFileManager finishMoveGroup:error:]";
 
 // The token of a move across file systems: the ticket on its copy, the mark
 // on its source once it is set aside.
-const std::string kTicketAttribute = std::string(qsfs::kMoveAttributePrefix) + "ticket";
-const std::string kAsideAttribute = std::string(qsfs::kMoveAttributePrefix) + "aside";
+const std::string kTicketAttribute = std::string(platform::fs::kMoveAttributePrefix) + "ticket";
+const std::string kAsideAttribute = std::string(platform::fs::kMoveAttributePrefix) + "aside";
 constexpr size_t kTokenWords = 4;  // of 32 bits
 constexpr size_t kAttributeValueLimit = 64;
 
@@ -86,7 +86,7 @@ std::string hiddenSibling(const URL& url, const char* prefix) {
 // Makes the data and metadata of every file of the file system that holds
 // `directory` durable (the copy just written among them), or 0.
 int flushFileSystemOf(const std::string& directory) {
-  qsfs::ScopedFD fd(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  platform::ScopedFD fd(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd.valid()) return errno;
   return syncfs(fd.get()) == 0 ? 0 : errno;
 }
@@ -94,7 +94,7 @@ int flushFileSystemOf(const std::string& directory) {
 // Makes the entries of `directory` durable, or 0. A file system that cannot
 // flush directories (EINVAL) has nothing to flush.
 int flushDirectory(const std::string& directory) {
-  qsfs::ScopedFD fd(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  platform::ScopedFD fd(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd.valid()) return errno;
   return fsync(fd.get()) == 0 || errno == EINVAL ? 0 : errno;
 }
@@ -144,14 +144,14 @@ bool QSFileManager::_copyItemAtURL(const URL& src, const URL& dst, bool failIfSr
     SourceState state = examineSource(kCopyItemFn, src, error);
     if (state != SourceState::Present) return state == SourceState::Missing;
   }
-  if (int errnum = qsfs::copyTree(src.fileSystemRepresentation(), dst.fileSystemRepresentation()); errnum != 0) {
+  if (int errnum = platform::fs::copyTree(src.fileSystemRepresentation(), dst.fileSystemRepresentation()); errnum != 0) {
     return QSFail(error, QSPOSIXError(kCopyItemFn, __LINE__, errnum, "copyfile of %@ to %@ failed: %s", src, dst,
                                       QSErrorText(errnum)));
   }
   return true;
 }
 
-QSMoveGroup::QSMoveGroup() : links_(std::make_unique<qsfs::CopyLinkTable>()) {}
+QSMoveGroup::QSMoveGroup() : links_(std::make_unique<platform::fs::CopyLinkTable>()) {}
 QSMoveGroup::~QSMoveGroup() = default;
 
 bool QSFileManager::_moveItemAtURL(const URL& src, const URL& dst, bool failIfSrcMissing, Error* error) const {
@@ -198,9 +198,9 @@ bool QSFileManager::_moveItemAcrossFileSystems(const URL& src, const URL& dst, Q
 
   // Steps 1 to 3. A copy that fails or cannot be made durable is removed, so
   // that nothing of it takes space on the destination.
-  qsfs::CopyLinkTable* links = group != nullptr ? group->links_.get() : nullptr;
+  platform::fs::CopyLinkTable* links = group != nullptr ? group->links_.get() : nullptr;
   const std::string token = newToken();
-  int errnum = qsfs::copyTree(src.fileSystemRepresentation(), incoming.c_str(), links);
+  int errnum = platform::fs::copyTree(src.fileSystemRepresentation(), incoming.c_str(), links);
   if (errnum == 0) errnum = setMoveAttribute(incoming, kTicketAttribute, token);
   if (errnum == 0) errnum = flushFileSystemOf(dstDirectory);
   if (errnum == 0) {

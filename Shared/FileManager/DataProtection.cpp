@@ -7,7 +7,7 @@
 
 #include "Shared/FileManager/QSFileManager.h"
 
-namespace qsfs {
+namespace platform::fs {
 
 int getDataProtectionClass(int fd, int32_t* dataProtectionClass) {
   int32_t stored = 0;
@@ -31,4 +31,4 @@ int setDataProtectionClass(int fd, int32_t dataProtectionClass) {
   return 0;
 }
 
-}  // namespace qsfs
+}  // namespace platform::fs

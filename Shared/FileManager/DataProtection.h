@@ -14,7 +14,7 @@
 
 #include <cstdint>
 
-namespace qsfs {
+namespace platform::fs {
 
 inline constexpr char kDataProtectionClassAttributeName[] = "user.com.vantrel.quilld.protection-class";
 // The class of an item that was never given one.
@@ -32,4 +32,4 @@ inline constexpr int32_t kUnsetDataProtectionClass = 0;
 // class as it was.
 [[nodiscard]] int setDataProtectionClass(int fd, int32_t dataProtectionClass);
 
-}  // namespace qsfs
+}  // namespace platform::fs

@@ -8,7 +8,7 @@
 
 #include "Platform/FileSystem.h"
 #include "Shared/FileManager/DataProtection.h"
-#include "Shared/FileManager/PosixHandles.h"
+#include "Platform/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
@@ -42,13 +42,13 @@ bool QSFileManager::createDirectoryAtURL(const URL& url, bool withIntermediateDi
   }
   if (dataProtectionClass == kQSNoDataProtectionClass) return true;
 
-  qsfs::ScopedDIR directory(opendir(url.fileSystemRepresentation()));
+  platform::ScopedDIR directory(opendir(url.fileSystemRepresentation()));
   if (!directory.valid()) {
     int errnum = errno;
     return QSFail(error, QSPOSIXError(kCreateDirectoryFn, __LINE__, errnum, "opendir of %@ failed: %s", path,
                                       QSErrorText(errnum)));
   }
-  if (int errnum = qsfs::setDataProtectionClass(dirfd(directory.get()), dataProtectionClass); errnum != 0) {
+  if (int errnum = platform::fs::setDataProtectionClass(dirfd(directory.get()), dataProtectionClass); errnum != 0) {
     return QSFail(error,
                   QSPOSIXError(kCreateDirectoryFn, __LINE__, errnum, "Failed to setclass(%d) on directory %@: %s",
                                dataProtectionClass, path, QSErrorText(errnum)));

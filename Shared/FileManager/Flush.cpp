@@ -5,7 +5,7 @@
 
 #include <cerrno>
 
-#include "Shared/FileManager/PosixHandles.h"
+#include "Platform/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
 
@@ -17,7 +17,7 @@ constexpr char kSynchronizeFn[] = "-[QSFileManager synchronizeDirectoryAtURL:err
 }  // namespace
 
 bool QSFileManager::synchronizeDirectoryAtURL(const URL& url, Error* error) const {
-  qsfs::ScopedFD fd(open(url.fileSystemRepresentation(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  platform::ScopedFD fd(open(url.fileSystemRepresentation(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (fd.get() < 0) {
     const int err = errno;
     return QSFail(error, QSPOSIXError(kSynchronizeFn, __LINE__, err, "Failed to open %s : %s", url.path(),

@@ -8,9 +8,9 @@
 #include <cerrno>
 #include <cstring>
 
-#include "Shared/FileManager/PosixHandles.h"
+#include "Platform/PosixHandles.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/FileTree/TreeWalk.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -45,7 +45,7 @@ unsigned char resolvedEntryType(const URL& directory, const dirent& entry) {
 // Per-entry step of the listing: skips "." and "..", and links when asked.
 void addListedEntry(const URL& directory, const dirent& entry, unsigned char type, bool ignoringSymlinks,
                     std::vector<URL>& list) {
-  if (qsfs::isDotOrDotDot(entry.d_name)) return;
+  if (platform::fs::isDotOrDotDot(entry.d_name)) return;
   if (type == DT_LNK && ignoringSymlinks) {
     QS_SYSLOG(kQSLogLevelNotice, kListDirectoryFn, "Ignoring symlink at %s/%s", directory.path(), entry.d_name);
     return;
@@ -57,9 +57,9 @@ void addListedEntry(const URL& directory, const dirent& entry, unsigned char typ
 // Reads every entry of the directory at `directory` into `list`. Returns 0 or
 // the error number that ended the iteration.
 int _IterateDirectory(const URL& directory, bool ignoringSymlinks, std::vector<URL>& list) {
-  qsfs::ScopedFD fd(open(directory.fileSystemRepresentation(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  platform::ScopedFD fd(open(directory.fileSystemRepresentation(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (!fd.valid()) return errno;
-  qsfs::ScopedDIR stream(fdopendir(fd.get()));
+  platform::ScopedDIR stream(fdopendir(fd.get()));
   if (!stream.valid()) return errno;
   fd.release();  // the stream owns the descriptor now
   for (;;) {

@@ -82,9 +82,9 @@ inline constexpr char kQSInstallTypeAttributeName[] = "user.com.vantrel.quilld.i
 inline constexpr char kQSMoveIncomingPrefix[] = ".qs-move-incoming.";
 inline constexpr char kQSMoveOutgoingPrefix[] = ".qs-move-outgoing.";
 
-namespace qsfs {
+namespace platform::fs {
 struct CopyLinkTable;
-}  // namespace qsfs
+}  // namespace platform::fs
 
 // The moves of the items of one container, made one after the other as a
 // set: names of one inode in different items stay names of one inode when
@@ -100,7 +100,7 @@ class QSMoveGroup {
 
  private:
   friend class QSFileManager;
-  std::unique_ptr<qsfs::CopyLinkTable> links_;
+  std::unique_ptr<platform::fs::CopyLinkTable> links_;
   // Moves across file systems whose source set aside is gone: the
   // directories it was removed from, and the copies that still carry the
   // move's ticket.

@@ -2,7 +2,7 @@
 
 #include <cstring>
 
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/FileTree/TreeWalk.h"
 
 namespace QuillsetAdditions {
 
@@ -27,7 +27,7 @@ bool containsDotDotPathComponents(std::string_view path) {
   while (start <= path.size()) {
     size_t end = path.find(kPathSeparator, start);
     if (end == std::string_view::npos) end = path.size();
-    if (path.substr(start, end - start) == qsfs::kParentDirectoryName) return true;
+    if (path.substr(start, end - start) == platform::fs::kParentDirectoryName) return true;
     start = end + 1;
   }
   return false;

@@ -2,7 +2,7 @@
 #include <cerrno>
 
 #include "Shared/FileManager/QSFileManager.h"
-#include "Shared/FileManager/RemoveTree.h"
+#include "Platform/FileTree/RemoveTree.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -17,7 +17,7 @@ constexpr char kRemoveErrorCallbackFn[] = "_removefile_error_callback";
 // Called for every item the removal could not remove. Logs the failure and
 // keeps the first error number in the int that `context` points at (ENOENT
 // counts as a first error too); the removal always goes on.
-qsfs::RemovalDecision _removefile_error_callback(const qsfs::RemovalState& state, const char* path, void* context) {
+platform::fs::RemovalDecision _removefile_error_callback(const platform::fs::RemovalState& state, const char* path, void* context) {
   int errnum = 0;
   if (state.errorNumber(&errnum) != 0) {
     QS_SYSLOG(kQSLogLevelError, kRemoveErrorCallbackFn,
@@ -28,7 +28,7 @@ qsfs::RemovalDecision _removefile_error_callback(const qsfs::RemovalState& state
   }
   int* firstError = static_cast<int*>(context);
   if (firstError != nullptr && *firstError == 0) *firstError = errnum;
-  return qsfs::RemovalDecision::Proceed;
+  return platform::fs::RemovalDecision::Proceed;
 }
 
 }  // namespace
@@ -38,7 +38,7 @@ bool QSFileManager::removeItemAtURL(const URL& url, Error* error) const {
     return QSFail(error, QSPOSIXError(kRemoveItemFn, __LINE__, EFAULT, "nil url passed to -removeItemAtURL:error:"));
   }
   int firstError = 0;
-  qsfs::RemovalState state;
+  platform::fs::RemovalState state;
   if (int failure = state.setErrorCallback(_removefile_error_callback); failure != 0) {
     QS_SYSLOG(kQSLogLevelError, kRemoveItemFn, "removefile_state_set REMOVEFILE_STATE_ERROR_CALLBACK failed: %s",
               QSErrorText(failure));
@@ -47,7 +47,7 @@ bool QSFileManager::removeItemAtURL(const URL& url, Error* error) const {
     QS_SYSLOG(kQSLogLevelError, kRemoveItemFn, "removefile_state_set REMOVEFILE_STATE_ERROR_CONTEXT failed: %s",
               QSErrorText(failure));
   }
-  int result = qsfs::removeTree(url.fileSystemRepresentation(), state);
+  int result = platform::fs::removeTree(url.fileSystemRepresentation(), state);
   if (result != 0 && result != ENOENT) {
     return QSFail(
         error, QSPOSIXError(kRemoveItemFn, __LINE__, result, "removefile of %@ failed: %s", url, QSErrorText(result)));

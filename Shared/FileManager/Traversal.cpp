@@ -10,7 +10,7 @@
 
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/FileManager/QuillsetAdditions.h"
-#include "Shared/FileManager/SymlinkText.h"
+#include "Platform/FileTree/SymlinkText.h"
 #include "Shared/Support/QSError.h"
 #include "Shared/Support/QSLog.h"
 
@@ -196,7 +196,7 @@ bool QSFileManager::createSymbolicLinkAtURL(const URL& url, const URL& withDesti
 
 std::optional<URL> QSFileManager::destinationOfSymbolicLinkAtURL(const URL& url, Error* error) const {
   std::string text;
-  if (int err = qsfs::readSymlinkText(url.fileSystemRepresentation(), &text); err != 0) {
+  if (int err = platform::fs::readSymlinkText(url.fileSystemRepresentation(), &text); err != 0) {
     QSFail(error, QSPOSIXError(kDestinationOfSymlinkFn, __LINE__, err, "Could not readlink %s : %s", url.path(),
                                QSErrorText(err)));
     return std::nullopt;

@@ -3,7 +3,7 @@
 #include <sys/xattr.h>
 
 #include "FakePlatform.h"
-#include "Shared/FileManager/CopyTree.h"
+#include "Platform/FileTree/CopyTree.h"
 #include "Shared/FileManager/QSFileManager.h"
 
 namespace qstest {
@@ -93,8 +93,8 @@ TEST_F(GroupContainerMigration, ItemThatCannotMoveKeepsTheGroupRecordedUntilALat
   const std::string fresh = newGroups_ + "/group.a";
   const std::string aside = old + "/" + kQSMoveOutgoingPrefix + "done";
   ASSERT_TRUE(writeFile(aside, "old done") && writeFile(fresh + "/done", "old done"));
-  const std::string token = "t1", mark = std::string(qsfs::kMoveAttributePrefix) + "aside",
-                    ticket = std::string(qsfs::kMoveAttributePrefix) + "ticket";
+  const std::string token = "t1", mark = std::string(platform::fs::kMoveAttributePrefix) + "aside",
+                    ticket = std::string(platform::fs::kMoveAttributePrefix) + "ticket";
   ASSERT_EQ(lsetxattr(aside.c_str(), mark.c_str(), token.data(), token.size(), 0), 0) << strerror(errno);
   ASSERT_EQ(lsetxattr((fresh + "/done").c_str(), ticket.c_str(), token.data(), token.size(), 0), 0);
   ASSERT_TRUE(setImmutable(old + "/stuck", true));  // cleared below, or by the scratch directory

@@ -55,7 +55,7 @@ TEST_F(Attributes, ClassesReadBackAndFailedOrRefusedChangesKeepTheClass) {
   EXPECT_EQ(classOf(file_), -2);
   // A stored class of the wrong size fails the read and a guarded change; a
   // change without a predicate never reads it.
-  qstest::setXattr(file_, qsfs::kDataProtectionClassAttributeName, std::string(2, '\1'));
+  qstest::setXattr(file_, platform::fs::kDataProtectionClassAttributeName, std::string(2, '\1'));
   EXPECT_FALSE(fm.dataProtectionClassOfItemAtURL(fileURL(file_), nullptr, &readError));
   EXPECT_FALSE(fm.setDataProtectionClassOfItemAtURL(fileURL(file_), 1, [](int32_t) { return true; }, &setError));
   EXPECT_TRUE(readError.isPOSIX(ERANGE) && setError.isPOSIX(ERANGE)) << readError.description();
@@ -69,7 +69,7 @@ TEST_F(FileManagerDirectories, IntermediatesGetTheModeAndTheLastOneTheClass) {
   EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a/b/c", true), true, kMode, kClass));
   for (const char* p : {"a", "a/b", "a/b/c"}) EXPECT_EQ(qstest::lstatOf(dir / p)->st_mode, S_IFDIR | kMode) << p;
   EXPECT_EQ(classOf(dir / "a/b/c"), kClass);
-  EXPECT_FALSE(qstest::xattrOf(dir / "a/b", qsfs::kDataProtectionClassAttributeName));
+  EXPECT_FALSE(qstest::xattrOf(dir / "a/b", platform::fs::kDataProtectionClassAttributeName));
   // An existing directory keeps its mode and gets the class.
   ASSERT_EQ(chmod((dir / "a").c_str(), 0750), 0);
   EXPECT_TRUE(fm.createDirectoryAtURL(fileURL(dir / "a", true), true, kMode, kClass));
@@ -93,7 +93,7 @@ TEST_F(FileManagerDirectories, FailuresKeepWhatIsInThePath) {
     EXPECT_TRUE(error.isPOSIX(code)) << error.description();
   }
   EXPECT_EQ(qstest::readFile(file_), "x");
-  EXPECT_FALSE(qstest::xattrOf(dir / "locked", qsfs::kDataProtectionClassAttributeName));
+  EXPECT_FALSE(qstest::xattrOf(dir / "locked", platform::fs::kDataProtectionClassAttributeName));
 }
 
 TEST_F(FileManagerDirectories, TemporaryDirectoryIsPrivateOrAnInstallerErrorWithTheTemplate) {

@@ -10,11 +10,11 @@
 #include <vector>
 
 #include "FileLayerTestSupport.h"
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/FileTree/TreeWalk.h"
 
 namespace {
 
-using qsfs::ScopedFD;
+using platform::ScopedFD;
 using qstest::fileURL;
 using qstest::lstatOf;
 
@@ -160,7 +160,7 @@ TEST_F(CopyFidelity, HardLinksInTheTreeStayLinksAtAnyDepth) {
   }
   ASSERT_EQ(link((src + "/Documents/once").c_str(), (dir / "elsewhere").c_str()), 0);
   const std::string longName(40, 'n');
-  constexpr int kDepth = static_cast<int>(qsfs::kMaxOpenDirectories) + 2;  // 130 x 41 bytes: beyond PATH_MAX
+  constexpr int kDepth = static_cast<int>(platform::fs::kMaxOpenDirectories) + 2;  // 130 x 41 bytes: beyond PATH_MAX
   ASSERT_NO_FATAL_FAILURE(qstest::makeTree(src, {"deep1/", "deep2/"}));
   {
     ScopedFD one = openChain(src + "/deep1", longName, kDepth, true),

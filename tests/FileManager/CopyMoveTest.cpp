@@ -7,8 +7,8 @@
 #include <tuple>
 
 #include "FileLayerTestSupport.h"
-#include "Shared/FileManager/CopyTree.h"
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/FileTree/CopyTree.h"
+#include "Platform/FileTree/TreeWalk.h"
 
 namespace {
 
@@ -114,7 +114,7 @@ TEST_F(FileManagerCopy, TreeDeeperThanTheDescriptorLimitAndPathMaxIsCopiedAndRem
   constexpr int kDepth = 2100;  // more than PATH_MAX bytes of "/d"
   // The copy keeps two descriptors for each of its open levels and removal
   // one; one per level of this tree would need 2,100.
-  constexpr rlim_t kDescriptorLimit = 2 * qsfs::kMaxOpenDirectories + 64;
+  constexpr rlim_t kDescriptorLimit = 2 * platform::fs::kMaxOpenDirectories + 64;
   qstest::ShmDir shm;
   const std::string src = shm / "src", dst = shm / "dst", chain = qstest::chainPath(kDepth);
   ASSERT_NO_FATAL_FAILURE(qstest::makeChain(src, kDepth));
@@ -201,8 +201,8 @@ TEST_F(FileManagerMove, CrossDeviceMoveThatRunsOutOfSpaceLeavesTheSourceWholeAnd
 // the destination only with the same token as ticket; a ticket whose aside
 // is gone comes off.
 TEST_F(FileManagerMove, LeftoversOfAnInterruptedMoveGoOnlyWhenTheItemIsCompleteElsewhere) {
-  const std::string ticket = std::string(qsfs::kMoveAttributePrefix) + "ticket";
-  const std::string mark = std::string(qsfs::kMoveAttributePrefix) + "aside";
+  const std::string ticket = std::string(platform::fs::kMoveAttributePrefix) + "ticket";
+  const std::string mark = std::string(platform::fs::kMoveAttributePrefix) + "aside";
   struct Case {
     const char* name;
     // "s": source, "d": destination, "in": hidden copy, "out": item at the
@@ -280,7 +280,7 @@ TEST_F(FileManagerMove, NamesOfOneFileInSeveralItemsOfAGroupStayOneFileAcrossDev
   EXPECT_EQ(qstest::readFile(src + "/Blocked/e"), "shared");
   EXPECT_FALSE(exists(src + "/Documents") || exists(shm / "Blocked/e"));
   // The moves' ticket is off every copy once the group is finished.
-  const std::string ticket = std::string(qsfs::kMoveAttributePrefix) + "ticket";
+  const std::string ticket = std::string(platform::fs::kMoveAttributePrefix) + "ticket";
   for (const char* item : {"Documents", "Library", "top"}) EXPECT_FALSE(qstest::xattrOf(shm / item, ticket.c_str())) << item;
 }
 

@@ -12,7 +12,7 @@
 
 #include <gtest/gtest.h>
 
-#include "Shared/FileManager/PosixHandles.h"
+#include "Platform/PosixHandles.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "Shared/Support/QSError.h"
 #include "support/TestSupport.h"
@@ -96,12 +96,12 @@ inline std::string chainPath(int depth) {
 // longer than PATH_MAX).
 inline void makeChain(const std::string& root, int depth) {
   ASSERT_TRUE(makeDirs(root));
-  qsfs::ScopedFD current(open(root.c_str(), O_RDONLY | O_DIRECTORY));
+  platform::ScopedFD current(open(root.c_str(), O_RDONLY | O_DIRECTORY));
   ASSERT_TRUE(current.valid());
   for (int i = 0; i < depth; ++i) {
     ASSERT_EQ(mkdirat(current.get(), "d", 0755), 0) << "level " << i;
     if (i % 100 == 0) {
-      ASSERT_TRUE(qsfs::ScopedFD(openat(current.get(), "f", O_WRONLY | O_CREAT, 0644)).valid());
+      ASSERT_TRUE(platform::ScopedFD(openat(current.get(), "f", O_WRONLY | O_CREAT, 0644)).valid());
     }
     current.reset(openat(current.get(), "d", O_RDONLY | O_DIRECTORY));
     ASSERT_TRUE(current.valid());

@@ -2,7 +2,7 @@
 #include <thread>
 
 #include "FileLayerTestSupport.h"
-#include "Shared/FileManager/RemoveTree.h"
+#include "Platform/FileTree/RemoveTree.h"
 
 namespace {
 
@@ -33,8 +33,8 @@ TEST_F(FileManagerRemoval, ImmutableDirectoryKeepsFirstErrorAndRemovesTheRest) {
   int unattended = 0;
   EXPECT_FALSE(qstest::whileImmutable(dir / "tree/locked", [&] {
     bool result = fm.removeItemAtURL(fileURL(dir / "tree", true), &error);
-    qsfs::RemovalState bare;  // without a callback the walk stops at the first failure
-    unattended = qsfs::removeTree((dir / "tree").c_str(), bare);
+    platform::fs::RemovalState bare;  // without a callback the walk stops at the first failure
+    unattended = platform::fs::removeTree((dir / "tree").c_str(), bare);
     return result;
   }));
   EXPECT_EQ(unattended, EPERM);
@@ -71,12 +71,12 @@ struct MoveOnFirstFailure {
   int firstError = 0;
 };
 
-qsfs::RemovalDecision moveAwayAndProceed(const qsfs::RemovalState& state, const char*, void* context) {
+platform::fs::RemovalDecision moveAwayAndProceed(const platform::fs::RemovalState& state, const char*, void* context) {
   auto* move = static_cast<MoveOnFirstFailure*>(context);
   if (move->firstError == 0 && state.errorNumber(&move->firstError) == 0) {
     EXPECT_EQ(rename(move->from.c_str(), move->to.c_str()), 0);
   }
-  return qsfs::RemovalDecision::Proceed;
+  return platform::fs::RemovalDecision::Proceed;
 }
 
 // While the walk is deep below it, a directory whose descriptor the walk has
@@ -85,17 +85,17 @@ qsfs::RemovalDecision moveAwayAndProceed(const qsfs::RemovalState& state, const 
 TEST_F(FileManagerRemoval, DirectoryMovedAwayDuringTheWalkIsLeftWhereItWent) {
   constexpr int kDepth = 300;
   constexpr int kMovedLevel = 20;  // its descriptor is closed when the walk is at the bottom
-  static_assert(kDepth - kMovedLevel > static_cast<int>(qsfs::kMaxOpenDirectories));
+  static_assert(kDepth - kMovedLevel > static_cast<int>(platform::fs::kMaxOpenDirectories));
   qstest::ShmDir shm;
   const std::string chain = qstest::chainPath(kDepth);
   ASSERT_NO_FATAL_FAILURE(qstest::makeChain(shm / "root", kDepth));
   ASSERT_TRUE(qstest::writeFile(shm / "root" + chain + "/locked", "x"));
   ASSERT_TRUE(qstest::setImmutable(shm / "root" + chain + "/locked", true));
   MoveOnFirstFailure move{shm / "root" + chain.substr(0, 2 * kMovedLevel), shm / "moved"};
-  qsfs::RemovalState state;
+  platform::fs::RemovalState state;
   ASSERT_EQ(state.setErrorCallback(moveAwayAndProceed), 0);
   ASSERT_EQ(state.setErrorContext(&move), 0);
-  int result = qsfs::removeTree((shm / "root").c_str(), state);
+  int result = platform::fs::removeTree((shm / "root").c_str(), state);
   const std::string movedFile = shm / "moved" + chain.substr(2 * kMovedLevel) + "/locked";
   ASSERT_TRUE(qstest::setImmutable(movedFile, false)) << "the moved directory is where it went";
   EXPECT_EQ(result, 0);

@@ -27,7 +27,7 @@
 #include <gtest/gtest.h>
 
 #include "AppMigrator/QSAppMigrator.h"
-#include "Shared/FileManager/CopyTree.h"
+#include "Platform/FileTree/CopyTree.h"
 #include "Shared/FileManager/QSFileManager.h"
 #include "e2e/Programs.h"
 #include "support/TestSupport.h"
@@ -339,7 +339,7 @@ class World : public testing::Test {
     for (const auto& entry : fs::recursive_directory_iterator(image())) {
       if (QSFileManager::isInterruptedMoveItemName(entry.path().filename().string())) return entry.path().string();
       for (const char* attribute : {"ticket", "aside"}) {
-        const std::string name = std::string(qsfs::kMoveAttributePrefix) + attribute;
+        const std::string name = std::string(platform::fs::kMoveAttributePrefix) + attribute;
         if (lgetxattr(entry.path().c_str(), name.c_str(), value, sizeof value) >= 0) {
           return entry.path().string() + " (" + name + ")";
         }

@@ -17,7 +17,7 @@
 #include <string>
 #include <vector>
 
-namespace qsfs {
+namespace platform::fs {
 
 inline constexpr size_t kMaxOpenDirectories = 128;
 
@@ -45,4 +45,4 @@ int openParentDirectory(int childFD, dev_t device, ino_t inode);
 // Returns 0 or the error number of the failure (entries read so far stay).
 [[nodiscard]] int readDirectoryEntries(int directoryFD, std::vector<DirectoryEntry>& entries);
 
-}  // namespace qsfs
+}  // namespace platform::fs

@@ -8,9 +8,7 @@
 #include <cstddef>
 #include <string>
 
-#include "Shared/FileManager/QuillsetAdditions.h"
-
-namespace qsfs {
+namespace platform::fs {
 
 // The longest link text read; a longer text comes back cut to this length.
 inline constexpr size_t kMaxSymlinkTextLength = 1024;
@@ -22,8 +20,8 @@ inline constexpr size_t kMaxSymlinkTextLength = 1024;
   char buffer[kMaxSymlinkTextLength + 1] = {};
   ssize_t length = readlink(path, buffer, kMaxSymlinkTextLength);
   if (length < 0) return errno;
-  *text = QuillsetAdditions::stringWithFileSystemRepresentation(buffer, static_cast<size_t>(length));
+  *text = std::string(buffer, static_cast<size_t>(length));  // the raw bytes, whatever they are
   return 0;
 }
 
-}  // namespace qsfs
+}  // namespace platform::fs

@@ -1,4 +1,4 @@
-#include "Shared/FileManager/CopyTree.h"
+#include "Platform/FileTree/CopyTree.h"
 
 #include <fcntl.h>
 #include <linux/fs.h>
@@ -17,10 +17,10 @@
 #include <utility>
 #include <vector>
 
-#include "Shared/FileManager/PosixHandles.h"
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/PosixHandles.h"
+#include "Platform/FileTree/TreeWalk.h"
 
-namespace qsfs {
+namespace platform::fs {
 
 namespace {
 
@@ -538,4 +538,4 @@ void CopyLinkTable::topRenamed(const std::string& from, const std::string& to) {
 
 void CopyLinkTable::topRemoved(const std::string& top) { topRenamed(top, ""); }
 
-}  // namespace qsfs
+}  // namespace platform::fs

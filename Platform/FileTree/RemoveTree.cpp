@@ -1,4 +1,4 @@
-#include "Shared/FileManager/RemoveTree.h"
+#include "Platform/FileTree/RemoveTree.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -8,10 +8,10 @@
 #include <string>
 #include <vector>
 
-#include "Shared/FileManager/PosixHandles.h"
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/PosixHandles.h"
+#include "Platform/FileTree/TreeWalk.h"
 
-namespace qsfs {
+namespace platform::fs {
 
 int RemovalState::setErrorCallback(RemovalErrorCallback callback) {
   if (callback == nullptr) return EINVAL;
@@ -207,4 +207,4 @@ int removeTree(const char* path, RemovalState& state) {
   return remover.run(path);
 }
 
-}  // namespace qsfs
+}  // namespace platform::fs

@@ -38,7 +38,7 @@
 #include <utility>
 #include <vector>
 
-namespace qsfs {
+namespace platform::fs {
 
 inline constexpr char kMoveAttributePrefix[] = "trusted.qs-move.";
 
@@ -69,4 +69,4 @@ struct CopyLinkTable {
 
 [[nodiscard]] int copyTree(const char* source, const char* destination, CopyLinkTable* links = nullptr);
 
-}  // namespace qsfs
+}  // namespace platform::fs

@@ -18,9 +18,9 @@
 
 #include <cstddef>
 
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/FileTree/TreeWalk.h"
 
-namespace qsfs {
+namespace platform::fs {
 
 enum class RemovalDecision { Proceed, Stop };
 
@@ -51,4 +51,4 @@ class RemovalState {
 // error number of the failure that stopped the walk.
 int removeTree(const char* path, RemovalState& state);
 
-}  // namespace qsfs
+}  // namespace platform::fs

@@ -1,4 +1,4 @@
-#include "Shared/FileManager/TreeWalk.h"
+#include "Platform/FileTree/TreeWalk.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -7,10 +7,9 @@
 #include <cerrno>
 #include <cstring>
 
-#include "Shared/FileManager/PosixHandles.h"
-#include "Shared/FileManager/QuillsetAdditions.h"
+#include "Platform/PosixHandles.h"
 
-namespace qsfs {
+namespace platform::fs {
 
 bool isDotOrDotDot(const char* name) {
   return std::strcmp(name, kCurrentDirectoryName) == 0 || std::strcmp(name, kParentDirectoryName) == 0;
@@ -44,9 +43,9 @@ int readDirectoryEntries(int directoryFD, std::vector<DirectoryEntry>& entries) 
     const dirent* entry = readdir(stream.get());
     if (entry == nullptr) return errno;
     if (isDotOrDotDot(entry->d_name)) continue;
-    entries.push_back({QuillsetAdditions::stringWithFileSystemRepresentation(entry->d_name, std::strlen(entry->d_name)),
+    entries.push_back({std::string(entry->d_name),
                        entry->d_type});
   }
 }
 
-}  // namespace qsfs
+}  // namespace platform::fs
