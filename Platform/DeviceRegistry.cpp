@@ -29,11 +29,6 @@ constexpr size_t kMountInfoMountPointField = 4;
 constexpr size_t kMountInfoFirstOptionalField = 6;
 constexpr size_t kMountTableReadChunk = 16384;
 
-bool exists(const std::string& path) {
-  struct stat status {};
-  return stat(path.c_str(), &status) == 0;
-}
-
 bool allDigits(std::string_view s) {
   return !s.empty() && std::all_of(s.begin(), s.end(), [](char c) { return c >= '0' && c <= '9'; });
 }
@@ -228,7 +223,7 @@ std::optional<std::vector<DeviceHandle>> LinuxDeviceRegistry::descendantsOf(Devi
 
 bool LinuxDeviceRegistry::isDiskImageDrive(DeviceHandle device) {
   std::optional<Node> node = nodeFor(device);
-  return node && node->kind == Kind::Drive && exists(blockDirectory() + "/" + node->name + "/" + kBackingFile);
+  return node && node->kind == Kind::Drive && pathLeadsToItem(blockDirectory() + "/" + node->name + "/" + kBackingFile);
 }
 
 bool LinuxDeviceRegistry::isMedia(DeviceHandle device) {

@@ -1,9 +1,14 @@
 #include "Platform/FileSystem.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <vector>
+
+#include "Platform/FileTree/TreeWalk.h"
+#include "Platform/PosixHandles.h"
 
 namespace platform {
 
@@ -24,6 +29,27 @@ int makeOneDirectory(const std::string& path, mode_t mode) {
 bool isDirectory(const std::string& path) {
   struct stat status {};
   return stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
+}
+
+bool pathLeadsToItem(const std::string& path) {
+  struct stat status {};
+  return stat(path.c_str(), &status) == 0;
+}
+
+bool itemExists(const std::string& path) {
+  struct stat status {};
+  return lstat(path.c_str(), &status) == 0;
+}
+
+int listDirectory(const std::string& path, std::vector<std::string>* names) {
+  const ScopedFD directory(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!directory.valid()) return errno;
+  std::vector<fs::DirectoryEntry> entries;
+  if (const int errnum = fs::readDirectoryEntries(directory.get(), entries); errnum != 0) return errnum;
+  names->clear();
+  for (fs::DirectoryEntry& entry : entries) names->push_back(std::move(entry.name));
+  std::sort(names->begin(), names->end());
+  return 0;
 }
 
 int makeDirectories(const std::string& path, mode_t mode) {

@@ -2,7 +2,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <fts.h>
 #include <sys/file.h>
 #include <sys/random.h>
 #include <sys/stat.h>
@@ -18,6 +17,8 @@
 #include "Platform/Foundation/Format.h"
 #include "Platform/Foundation/Text.h"
 #include "Platform/FileSystem.h"
+#include "Platform/FileTree/CopyTree.h"
+#include "Platform/FileTree/RemoveTree.h"
 #include "Platform/Registry/SQLiteRegistry.h"
 
 namespace platform::registry {
@@ -26,18 +27,7 @@ namespace {
 
 constexpr mode_t kDirectoryMode = 0755;
 constexpr mode_t kFileMode = 0644;
-constexpr size_t kCopyBufferSize = 1 << 16;
 constexpr size_t kUUIDBytes = 16;
-
-struct FtsCloser {
-  void operator()(FTS* fts) const { fts_close(fts); }
-};
-using FtsHandle = std::unique_ptr<FTS, FtsCloser>;
-
-FtsHandle openTree(const std::string& root) {
-  char* roots[] = {const_cast<char*>(root.c_str()), nullptr};
-  return FtsHandle(fts_open(roots, FTS_PHYSICAL | FTS_NOCHDIR, nullptr));
-}
 
 bool fail(Error* error, const std::string& what, const std::string& path, int errnum) {
   if (error) *error = posixFailure(kRegistryErrorFileOperation, what, path, errnum);
@@ -55,30 +45,10 @@ bool writeAll(int fd, const uint8_t* bytes, size_t length) {
   return true;
 }
 
-bool copyFileContents(const std::string& source, const std::string& destination, mode_t mode, Error* error) {
-  ScopedFD in(open(source.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-  if (!in.valid()) return fail(error, "open", source, errno);
-  ScopedFD out(open(destination.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode & 07777));
-  if (!out.valid()) return fail(error, "create", destination, errno);
-  std::vector<uint8_t> buffer(kCopyBufferSize);
-  for (;;) {
-    ssize_t n = read(in.get(), buffer.data(), buffer.size());
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return fail(error, "read", source, errno);
-    if (n == 0) break;
-    if (!writeAll(out.get(), buffer.data(), static_cast<size_t>(n))) return fail(error, "write", destination, errno);
-  }
-  if (!out.close()) return fail(error, "close", destination, errno);
-  return true;
-}
-
-bool copySymbolicLink(const std::string& source, const std::string& destination, Error* error) {
-  std::vector<char> target(PATH_MAX + 1);
-  ssize_t n = readlink(source.c_str(), target.data(), target.size() - 1);
-  if (n < 0) return fail(error, "readlink", source, errno);
-  target[static_cast<size_t>(n)] = '\0';
-  if (symlink(target.data(), destination.c_str()) != 0) return fail(error, "symlink", destination, errno);
-  return true;
+// Keeps the path of the item a removal could not remove, and stops it.
+platform::fs::RemovalDecision keepFailedPath(const platform::fs::RemovalState&, const char* path, void* context) {
+  *static_cast<std::string*>(context) = path;
+  return platform::fs::RemovalDecision::Stop;
 }
 
 }  // namespace
@@ -100,30 +70,12 @@ bool isDirectoryNoFollow(const std::string& path) {
   return lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
 }
 
-bool exists(const std::string& path) {
-  struct stat st;
-  return lstat(path.c_str(), &st) == 0;
-}
-
 std::optional<std::vector<std::string>> listDirectory(const std::string& path, Error* error) {
-  ScopedDIR dir(opendir(path.c_str()));
-  if (!dir.valid()) {
-    fail(error, "opendir", path, errno);
-    return std::nullopt;
-  }
   std::vector<std::string> names;
-  for (;;) {
-    errno = 0;
-    const dirent* entry = readdir(dir.get());
-    if (!entry) break;
-    std::string name = entry->d_name;
-    if (name != "." && name != "..") names.push_back(std::move(name));
-  }
-  if (errno != 0) {
-    fail(error, "readdir", path, errno);
+  if (const int errnum = platform::listDirectory(path, &names); errnum != 0) {
+    fail(error, "list", path, errnum);
     return std::nullopt;
   }
-  std::sort(names.begin(), names.end());
   return names;
 }
 
@@ -139,57 +91,17 @@ bool createNewDirectory(const std::string& path, Error* error) {
 }
 
 bool removeTree(const std::string& path, Error* error) {
-  struct stat st;
-  if (lstat(path.c_str(), &st) != 0) return errno == ENOENT ? true : fail(error, "lstat", path, errno);
-  if (!S_ISDIR(st.st_mode)) return unlink(path.c_str()) == 0 || errno == ENOENT || fail(error, "unlink", path, errno);
-  FtsHandle fts = openTree(path);
-  if (!fts) return fail(error, "fts_open", path, errno);
-  while (FTSENT* entry = fts_read(fts.get())) {
-    switch (entry->fts_info) {
-      case FTS_D:
-        break;
-      case FTS_DP:
-        if (rmdir(entry->fts_path) != 0 && errno != ENOENT) return fail(error, "rmdir", entry->fts_path, errno);
-        break;
-      case FTS_DNR:
-      case FTS_ERR:
-      case FTS_NS:
-        return fail(error, "read", entry->fts_path, entry->fts_errno);
-      default:
-        if (unlink(entry->fts_path) != 0 && errno != ENOENT) return fail(error, "unlink", entry->fts_path, errno);
-    }
-  }
-  return errno == 0 || fail(error, "fts_read", path, errno);
+  std::string failedPath = path;
+  platform::fs::RemovalState state;
+  (void)state.setErrorCallback(&keepFailedPath);
+  (void)state.setErrorContext(&failedPath);
+  const int errnum = platform::fs::removeTree(path.c_str(), state);
+  return errnum == 0 || errnum == ENOENT || fail(error, "remove", failedPath, errnum);
 }
 
 bool copyTree(const std::string& source, const std::string& destination, Error* error) {
-  FtsHandle fts = openTree(source);
-  if (!fts) return fail(error, "fts_open", source, errno);
-  while (FTSENT* entry = fts_read(fts.get())) {
-    std::string target = destination + std::string(entry->fts_path).substr(source.size());
-    switch (entry->fts_info) {
-      case FTS_D:
-        if (mkdir(target.c_str(), kDirectoryMode) != 0) return fail(error, "mkdir", target, errno);
-        break;
-      case FTS_DP:
-        if (chmod(target.c_str(), entry->fts_statp->st_mode & 07777) != 0) return fail(error, "chmod", target, errno);
-        break;
-      case FTS_F:
-        if (!copyFileContents(entry->fts_path, target, entry->fts_statp->st_mode, error)) return false;
-        break;
-      case FTS_SL:
-      case FTS_SLNONE:
-        if (!copySymbolicLink(entry->fts_path, target, error)) return false;
-        break;
-      case FTS_DNR:
-      case FTS_ERR:
-      case FTS_NS:
-        return fail(error, "read", entry->fts_path, entry->fts_errno);
-      default:
-        return fail(error, "copy (unsupported file type)", entry->fts_path, ENOTSUP);
-    }
-  }
-  return errno == 0 || fail(error, "fts_read", source, errno);
+  const int errnum = platform::fs::copyTree(source.c_str(), destination.c_str());
+  return errnum == 0 || fail(error, "copy to " + destination + " from", source, errnum);
 }
 
 bool moveItem(const std::string& source, const std::string& destination, Error* error) {

@@ -27,7 +27,6 @@ Error registryError(int64_t code, const std::string& message);
 // isDirectory is the platform's (FileSystem.h).
 // A directory itself, not a symbolic link to one.
 bool isDirectoryNoFollow(const std::string& path);
-bool exists(const std::string& path);  // without following a final symbolic link
 
 // Names in a directory, "." and ".." excluded, sorted. Fails when the
 // directory cannot be opened or read.
@@ -38,11 +37,14 @@ std::optional<std::vector<std::string>> listDirectory(const std::string& path, E
 // Makes the missing parents of `path` and then `path` itself, which must not
 // exist yet (so that undoing it can never remove something older).
 [[nodiscard]] bool createNewDirectory(const std::string& path, Error* error);
-// Removes the item at `path` and everything under it; nothing there is success.
+// Removes the item at `path` and everything under it (platform::fs::removeTree,
+// links never followed); nothing there is success. A failure names the item
+// that could not be removed.
 [[nodiscard]] bool removeTree(const std::string& path, Error* error);
-// Copies the tree at `source` to `destination` (which must not exist):
-// directories, regular files (with their modes) and symbolic links. Nothing is
-// flushed: the caller makes the copy durable with syncFileSystems.
+// Copies the tree at `source` to `destination` (which must not exist) with
+// platform::fs::copyTree: every item keeps its data, mode, owner, times and
+// extended attributes. Nothing is flushed: the caller makes the copy durable
+// with syncFileSystems.
 [[nodiscard]] bool copyTree(const std::string& source, const std::string& destination, Error* error);
 // Renames `source` to `destination`. Only a rename can be undone after a crash,
 // so there is no copying fallback: across file systems this fails (EXDEV).

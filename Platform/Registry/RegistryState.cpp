@@ -31,7 +31,7 @@ bool undoEntry(const RegistryLayout& layout, const JournalEntry& entry, Error* e
     case JournalKind::Move:
       // Moved: move it back. Not moved yet (the source is still there): nothing
       // to undo.
-      if (exists(entry.destination) && !exists(entry.source)) return moveItem(entry.destination, entry.source, error);
+      if (itemExists(entry.destination) && !itemExists(entry.source)) return moveItem(entry.destination, entry.source, error);
       return true;
     case JournalKind::Create:
     case JournalKind::Remove:

@@ -98,13 +98,8 @@ bool digestOfFile(const std::string& path, std::vector<uint8_t>& buffer, platfor
 }
 
 std::optional<std::vector<std::string>> directoryEntries(const std::string& path) {
-  platform::ScopedDIR dir(opendir(path.c_str()));
-  if (!dir.valid()) return std::nullopt;
   std::vector<std::string> names;
-  while (const dirent* entry = readdir(dir.get())) {
-    const std::string name = entry->d_name;
-    if (name != "." && name != "..") names.push_back(name);
-  }
+  if (platform::listDirectory(path, &names) != 0) return std::nullopt;
   return names;
 }
 
