@@ -85,8 +85,12 @@ bool makeDirectories(const std::string& path, Error* error) {
 }
 
 bool createNewDirectory(const std::string& path, Error* error) {
-  size_t slash = path.find_last_of('/');
-  if (slash != std::string::npos && slash > 0 && !makeDirectories(path.substr(0, slash), error)) return false;
+  // The parents are nearly always there already: they are made only when the
+  // first attempt says one is missing.
+  if (mkdir(path.c_str(), kDirectoryMode) == 0) return true;
+  const size_t slash = path.find_last_of('/');
+  if (errno != ENOENT || slash == std::string::npos || slash == 0) return fail(error, "mkdir", path, errno);
+  if (!makeDirectories(path.substr(0, slash), error)) return false;
   return mkdir(path.c_str(), kDirectoryMode) == 0 || fail(error, "mkdir", path, errno);
 }
 
