@@ -11,6 +11,13 @@
 
 namespace platform::fs {
 
+namespace {
+
+// The listing is read in pieces of this size.
+constexpr size_t kDirectoryReadBytes = 32768;
+
+}  // namespace
+
 bool isDotOrDotDot(const char* name) {
   return std::strcmp(name, kCurrentDirectoryName) == 0 || std::strcmp(name, kParentDirectoryName) == 0;
 }
@@ -31,20 +38,22 @@ int openParentDirectory(int childFD, dev_t device, ino_t inode) {
 }
 
 int readDirectoryEntries(int directoryFD, std::vector<DirectoryEntry>& entries) {
-  // A stream of its own (a fresh open description, not a dup) so that the
-  // caller's descriptor and its position are left alone.
+  // A descriptor of its own (a fresh open description, not a dup) so that the
+  // caller's descriptor and its position are left alone. It is read with
+  // getdents64 directly: a readdir stream would add an fstat and two fcntl
+  // calls to every directory of every walk.
   ScopedFD fd(openat(directoryFD, kCurrentDirectoryName, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd.valid()) return errno;
-  ScopedDIR stream(fdopendir(fd.get()));
-  if (!stream.valid()) return errno;
-  fd.release();
+  alignas(struct dirent64) char buffer[kDirectoryReadBytes];
   for (;;) {
-    errno = 0;
-    const dirent* entry = readdir(stream.get());
-    if (entry == nullptr) return errno;
-    if (isDotOrDotDot(entry->d_name)) continue;
-    entries.push_back({std::string(entry->d_name),
-                       entry->d_type});
+    const ssize_t got = getdents64(fd.get(), buffer, sizeof buffer);
+    if (got < 0) return errno;
+    if (got == 0) return 0;
+    for (ssize_t at = 0; at < got;) {
+      const auto* entry = reinterpret_cast<const struct dirent64*>(buffer + at);
+      at += entry->d_reclen;
+      if (!isDotOrDotDot(entry->d_name)) entries.push_back({std::string(entry->d_name), entry->d_type});
+    }
   }
 }
 
